@@ -1,0 +1,64 @@
+# Compiler settings, dependencies, and the two functions that every folder uses.
+
+include(CheckCXXCompilerFlag)
+find_package(PkgConfig REQUIRED)
+find_package(Threads REQUIRED)
+
+add_compile_options(-Wall -Wextra -Werror $<$<COMPILE_LANG_AND_ID:CXX,GNU>:-Wshadow=compatible-local> -Wnon-virtual-dtor -Woverloaded-virtual
+                    $<$<COMPILE_LANGUAGE:CXX>:-Wno-missing-field-initializers>)
+if(CMAKE_CXX_COMPILER_ID MATCHES "Clang")
+  add_compile_options(-Wthread-safety -Wno-error=unused-command-line-argument)
+  add_compile_options(-Wno-shadow)
+endif()
+# gcc 12 sees overlapping copies and uninitialised variants where optimised code has none.
+add_compile_options("$<$<AND:$<CONFIG:Release>,$<COMPILE_LANG_AND_ID:CXX,GNU>>:-Wno-restrict;-Wno-maybe-uninitialized>")
+if(VELK_SANITIZE STREQUAL "asan")
+  # Instrumented variants look uninitialised to gcc 12.
+  add_compile_options($<$<COMPILE_LANG_AND_ID:CXX,GNU>:-Wno-maybe-uninitialized>)
+  add_compile_options(-fsanitize=address,undefined -fno-sanitize-recover=undefined -fno-omit-frame-pointer)
+  add_link_options(-fsanitize=address,undefined)
+elseif(VELK_SANITIZE STREQUAL "tsan")
+  add_compile_options(-fsanitize=thread -fno-omit-frame-pointer)
+  # gcc's sanitizer does not model standalone fences; the code uses none, headers of Asio do.
+  add_compile_options($<$<COMPILE_LANG_AND_ID:CXX,GNU>:-Wno-tsan> $<$<COMPILE_LANG_AND_ID:CXX,GNU>:-Wno-maybe-uninitialized>)
+  add_link_options(-fsanitize=thread)
+endif()
+
+# What is linked but not used (a library's folder that a program needs half of) stays out of the program.
+add_link_options(-Wl,--as-needed)
+
+# The current folder (and its linux/ half) as a static library: velk_library(name [EXCLUDE main.cpp] LINKS ...)
+function(velk_library name)
+  cmake_parse_arguments(ARG "" "" "EXCLUDE;LINKS;PRIVATE_LINKS" ${ARGN})
+  file(GLOB sources CONFIGURE_DEPENDS ${CMAKE_CURRENT_SOURCE_DIR}/*.cpp ${CMAKE_CURRENT_SOURCE_DIR}/linux/*.cpp)
+  foreach(excluded ${ARG_EXCLUDE})
+    list(REMOVE_ITEM sources ${CMAKE_CURRENT_SOURCE_DIR}/${excluded})
+  endforeach()
+  if(NOT sources)
+    file(WRITE ${CMAKE_CURRENT_BINARY_DIR}/empty.cpp "")
+    set(sources ${CMAKE_CURRENT_BINARY_DIR}/empty.cpp)
+  endif()
+  add_library(velk_${name} STATIC ${sources})
+  target_include_directories(velk_${name} PUBLIC ${CMAKE_SOURCE_DIR})
+  target_link_libraries(velk_${name} PUBLIC ${ARG_LINKS} PRIVATE ${ARG_PRIVATE_LINKS})
+endfunction()
+
+# A test program with one ctest entry: velk_test(name SOURCES ... LINKS ... [TIMEOUT seconds])
+function(velk_test name)
+  cmake_parse_arguments(ARG "" "TIMEOUT" "SOURCES;LINKS" ${ARGN})
+  if(NOT ARG_SOURCES)
+    return()
+  endif()
+  if(NOT ARG_TIMEOUT)
+    set(ARG_TIMEOUT 120)
+  endif()
+  add_executable(${name} ${ARG_SOURCES})
+  target_link_libraries(${name} PRIVATE ${ARG_LINKS} velk_test_support GTest::gtest GTest::gmock GTest::gtest_main)
+  if(VELK_SANITIZE STREQUAL "tsan")
+    # The sanitizer's shadow needs an address space laid out without randomisation.
+    add_test(NAME ${name} COMMAND setarch -R $<TARGET_FILE:${name}>)
+  else()
+    add_test(NAME ${name} COMMAND ${name})
+  endif()
+  set_tests_properties(${name} PROPERTIES TIMEOUT ${ARG_TIMEOUT})
+endfunction()
