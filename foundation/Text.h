@@ -1,0 +1,30 @@
+// Small operations on UTF-8 text that the standard library lacks.
+#pragma once
+
+#include <cstdint>
+#include <span>
+#include <string>
+#include <string_view>
+#include <vector>
+
+namespace velk {
+
+/// The parts between `separator`s; a text without one is a single part, an empty text one empty part. No trimming.
+[[nodiscard]] std::vector<std::string_view> split(std::string_view text, char separator);
+
+/// ASCII letters lowered; other bytes stay, so UTF-8 stays UTF-8.
+[[nodiscard]] std::string lowerCased(std::string_view text);
+
+/// Comparison without regard to the case of ASCII letters.
+[[nodiscard]] bool equalsIgnoringCase(std::string_view left, std::string_view right) noexcept;
+[[nodiscard]] bool containsIgnoringCase(std::string_view text, std::string_view part) noexcept;
+
+/// Well-formed UTF-8 (RFC 3629): no overlong forms, no surrogates, nothing above U+10FFFF.
+[[nodiscard]] bool isUtf8(std::string_view text) noexcept;
+/// How many UTF-16 code units well-formed UTF-8 takes.
+[[nodiscard]] std::size_t utf16Length(std::string_view text) noexcept;
+
+/// Lower-case hexadecimal, two digits a byte.
+[[nodiscard]] std::string hexadecimal(std::span<const std::uint8_t> bytes);
+
+}  // namespace velk
