@@ -1,0 +1,27 @@
+// Random identifiers that survive restarts, each under a key of a user-defaults suite. The daemon keeps its own in
+// its suite and the library those of the calling user in that user's.
+#pragma once
+
+#include <string>
+#include <string_view>
+
+#include "platform/UserDefaults.h"
+
+namespace velk {
+
+/// The identifier stored under `key`; a new random UUID text is stored first when there is none. When it cannot be
+/// stored the new one is returned all the same, and the failure is logged.
+[[nodiscard]] std::string persistentIdentifier(UserDefaults& defaults, std::string_view key);
+
+/// For clients that respect the user's diagnostics-and-usage consent ("uuidRespectDNU") and for those that need not
+/// ("uuidOverrideDNU"). Serialised by one lock of the process.
+[[nodiscard]] std::string getPersistentIdentifierForDNU(UserDefaults& defaults, bool respectConsent);
+/// Replaces the identifier; the other one stays.
+void regeneratePersistentIdentifierForDNU(UserDefaults& defaults, bool respectConsent);
+
+/// "uuid:<prefix>:<suffix>": an identifier of one client and service. Absent parts count as empty.
+[[nodiscard]] std::string getPersistentIdentifierForCustomClientIDSuffix(UserDefaults& defaults,
+                                                                         const std::string* prefix,
+                                                                         const std::string* suffix);
+
+}  // namespace velk

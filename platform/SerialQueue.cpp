@@ -1,0 +1,161 @@
+#include "platform/SerialQueue.h"
+
+#include <utility>
+
+#include "platform/CurrentQueue.h"
+
+namespace velk {
+namespace {
+
+/// After so many tasks a queue lets others have the thread.
+constexpr unsigned kTasksPerTurn = 64;
+/// An idle queue keeps room for so many tasks; what a burst needed beyond it is given back.
+constexpr std::size_t kKeptCapacity = 256;
+
+std::string_view lastComponent(std::string_view label) {
+  const auto dot = label.rfind('.');
+  return dot == std::string_view::npos || dot + 1 == label.size() ? label : label.substr(dot + 1);
+}
+
+}  // namespace
+
+/// The place of a waiting `sync` among the tasks. Run or dropped, it makes the waiter the next owner.
+class SerialQueueCore::HandOver {
+ public:
+  HandOver(SerialQueueCore& core, Waiter& waiter) noexcept : _core(&core), _waiter(&waiter) {}
+  HandOver(HandOver&& other) noexcept : _core(other._core), _waiter(std::exchange(other._waiter, nullptr)) {}
+  HandOver(const HandOver&) = delete;
+  HandOver& operator=(const HandOver&) = delete;
+  HandOver& operator=(HandOver&&) = delete;
+  ~HandOver() { (*this)(); }
+
+  void operator()() noexcept {
+    if (_waiter != nullptr) _core->_handOverTo = std::exchange(_waiter, nullptr);
+  }
+
+ private:
+  SerialQueueCore* const _core;
+  Waiter* _waiter;
+};
+
+SerialQueueCore::SerialQueueCore(std::shared_ptr<QueueRunner> runner, std::string label)
+    : _runner(std::move(runner)), _label(std::move(label)), _shortName(lastComponent(_label)) {}
+
+void SerialQueueCore::async(Task task) {
+  {
+    Guard guard(_lock);
+    _incoming.push_back(std::move(task));
+    if (std::exchange(_owned, true)) return;
+  }
+  if (!_runner->schedule(shared_from_this())) drain(false);
+}
+
+void SerialQueueCore::runSync(void (*work)(void*), void* context) noexcept {
+  if (CurrentQueueScope::contains(this)) return work(context);
+  const auto self = shared_from_this();  // `work` may drop the queue's last reference.
+  Waiter waiter;
+  bool waits = false;
+  {
+    Guard guard(_lock);
+    waits = std::exchange(_owned, true);
+    if (waits) _incoming.emplace_back(HandOver(*this, waiter));
+  }
+  if (waits) waiter.owns.wait();
+  {
+    CurrentQueueScope current(this);
+    work(context);
+  }
+  release();
+}
+
+void SerialQueueCore::runTurn() noexcept {
+  CurrentQueueScope current(this);
+  do {
+    for (unsigned done = 0; done < kTasksPerTurn; ++done) {
+      if (!nextIsReady()) return;
+      perform(true);
+      if (handsOver()) return;
+    }
+  } while (!_runner->yield(shared_from_this()));
+}
+
+/// False when there is none: the queue has become idle, and is no longer the caller's.
+bool SerialQueueCore::nextIsReady() { return _next < _batch.size() || takesBatch(); }
+
+bool SerialQueueCore::takesBatch() {
+  _batch.clear();
+  _next = 0;
+  if (_batch.capacity() > kKeptCapacity) Tasks().swap(_batch);
+  Tasks surplus;
+  Guard guard(_lock);
+  if (_incoming.empty()) {
+    if (_incoming.capacity() > kKeptCapacity) surplus.swap(_incoming);
+    _owned = false;
+    return false;
+  }
+  _batch.swap(_incoming);
+  return true;
+}
+
+/// Runs or drops the next task. What it owns ends here, while the thread still works for the queue.
+void SerialQueueCore::perform(bool run) noexcept {
+  Task task = std::move(_batch[_next++]);
+  if (run && task) task();
+}
+
+/// True when a waiting `sync` was next: the queue is its own from now on.
+bool SerialQueueCore::handsOver() {
+  auto* const waiter = std::exchange(_handOverTo, nullptr);
+  if (waiter == nullptr) return false;
+  waiter->owns.signal();
+  return true;
+}
+
+/// The end of a `sync`.
+void SerialQueueCore::release() noexcept {
+  if (!nextIsReady()) return;
+  if (!_runner->schedule(shared_from_this())) drain(true);
+}
+
+/// The end of a queue whose runner was stopped: what was handed over during a `sync` runs, anything later is dropped.
+void SerialQueueCore::drain(bool run) noexcept {
+  CurrentQueueScope current(this);
+  while (nextIsReady()) {
+    perform(run);
+    if (handsOver()) return;
+  }
+}
+
+namespace {
+
+class SerialQueue final : public Queue {
+ public:
+  SerialQueue(std::shared_ptr<SerialQueueCore> core, std::shared_ptr<TimerService> timers)
+      : _core(std::move(core)), _timers(std::move(timers)) {}
+
+  [[nodiscard]] std::string_view label() const override { return _core->label(); }
+  void async(Task task) override { _core->async(std::move(task)); }
+  void asyncAfter(Duration delay, Task task) override {
+    if (delay <= Duration::zero()) return _core->async(std::move(task));
+    _timers->add(TimerSchedule::after(_timers->now(), delay), Duration::zero(),
+                 [core = _core, task = std::move(task)](SteadyTime) mutable { core->async(std::move(task)); });
+  }
+  [[nodiscard]] bool isCurrent() const override { return CurrentQueueScope::contains(_core.get()); }
+
+ protected:
+  void runSync(void (*work)(void*), void* context) override { _core->runSync(work, context); }
+
+ private:
+  const std::shared_ptr<SerialQueueCore> _core;
+  const std::shared_ptr<TimerService> _timers;
+};
+
+}  // namespace
+
+std::shared_ptr<Queue> makeSerialQueue(std::shared_ptr<QueueRunner> runner, std::shared_ptr<TimerService> timers,
+                                       std::string label) {
+  return std::make_shared<SerialQueue>(std::make_shared<SerialQueueCore>(std::move(runner), std::move(label)),
+                                       std::move(timers));
+}
+
+}  // namespace velk

@@ -1,0 +1,35 @@
+// The real scheduler: serial queues over an elastic pool of threads, and one thread for the timers.
+#pragma once
+
+#include <cstddef>
+#include <memory>
+
+#include "platform/Queue.h"
+
+namespace velk {
+
+struct ThreadPoolOptions {
+  /// How many threads run at once while none of them is blocked. 0: the number of processors, at least 2.
+  std::size_t runningThreads = 0;
+  /// The most threads that may exist, blocked ones included. Work waits once they are all there.
+  std::size_t maximumThreads = 512;
+  /// How many more may be started, one at a time, while every thread is blocked and work waits: what they all wait for
+  /// may be in that work. Without them a process whose threads all want one lock stands still for ever as soon as the
+  /// lock's holder waits for a task.
+  std::size_t emergencyThreads = 0;
+  /// A thread without work for this long ends.
+  Duration idleThreadLifetime = std::chrono::seconds(5);
+};
+
+/// Starts no thread before there is work. `stop` runs what was handed over, drops delayed work, joins all threads;
+/// it blocks, must not be called from a task, and is called by the destructor. In a forked child it does nothing.
+class ThreadPool : public Scheduler {
+ public:
+  virtual void stop() = 0;
+  /// For status and tests.
+  [[nodiscard]] virtual std::size_t threadCount() const = 0;
+};
+
+[[nodiscard]] std::unique_ptr<ThreadPool> makeThreadPool(ThreadPoolOptions options = {});
+
+}  // namespace velk

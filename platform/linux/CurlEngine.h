@@ -1,0 +1,95 @@
+// The one thread on which the process's HTTP requests run: libcurl's multi interface behind an inbox.
+// Used by the sessions and tasks of the HTTP session service, which share it.
+#pragma once
+
+#include <curl/curl.h>
+
+#include <memory>
+#include <thread>
+#include <unordered_map>
+#include <vector>
+
+#include "platform/Clock.h"
+#include "platform/HttpSession.h"
+#include "platform/Lock.h"
+#include "platform/linux/RouteMonitor.h"
+
+namespace velk {
+
+class CurlTask;
+class CurlTransfer;
+
+/// The thread is started by the first task and sleeps in one system call while there is nothing to do; connections
+/// that nobody used for a minute are closed. It runs no delegates and waits for nobody. `submit` and `unpause` may
+/// be called from any thread and never block.
+class CurlEngine {
+ public:
+  explicit CurlEngine(HttpTrust trust);
+  ~CurlEngine();
+  CurlEngine(const CurlEngine&) = delete;
+  CurlEngine& operator=(const CurlEngine&) = delete;
+
+  /// Starts the task; its delegate hears how it ended, whatever happens.
+  void submit(std::shared_ptr<CurlTask> task);
+  /// The task's delegate has caught up with the data: the transfer may go on.
+  void unpause(std::shared_ptr<CurlTask> task);
+  /// Ends every task with an error, and the thread. Blocks until it is gone; idempotent; not on the thread itself.
+  void stop();
+
+ private:
+  struct Command {
+    std::shared_ptr<CurlTask> task;
+    bool isStart;
+  };
+  struct EasyFreer {
+    void operator()(CURL* easy) const { curl_easy_cleanup(easy); }
+  };
+  struct MultiFreer {
+    void operator()(CURLM* multi) const { curl_multi_cleanup(multi); }
+  };
+  using Easy = std::unique_ptr<CURL, EasyFreer>;
+  using Multi = std::unique_ptr<CURLM, MultiFreer>;
+
+  /// Hands a command to the thread; gives it back when the thread is (or cannot be) there no more.
+  [[nodiscard]] bool handOver(Command command);
+  bool startThreadLocked() VELK_REQUIRES(_lock);
+
+  // On the thread.
+  void run();
+  [[nodiscard]] bool takeCommands(std::vector<Command>& into);
+  void start(std::shared_ptr<CurlTask> task);
+  void attempt(std::shared_ptr<CurlTask> task);
+  void resumePaused(const CurlTask& task);
+  void collectFinished();
+  void finished(CURL* easy, CURLcode code);
+  void retryWaiting();
+  void expireWaiting();
+  void endAll();
+  void sleep();
+  [[nodiscard]] int sleepMilliseconds() const;
+  void forgetConnections();
+  [[nodiscard]] Easy takeEasy();
+  void giveEasyBack(Easy easy);
+
+  // Constant after construction.
+  const HttpTrust _trust;
+
+  // The thread's own.
+  std::unordered_map<CURL*, std::unique_ptr<CurlTransfer>> _running;
+  /// Tasks that wait for a network; while there are any, the monitor is open.
+  std::vector<std::shared_ptr<CurlTask>> _waiting;
+  std::unique_ptr<RouteMonitor> _routes;
+  std::vector<Easy> _spare;
+  bool _mayHaveConnections = false;
+  SteadyTime _idleSince;
+
+  // Guarded by _lock. The multi handle changes on the thread alone, which therefore reads it without the lock.
+  Lock _lock;
+  Multi _multi;
+  std::vector<Command> _inbox VELK_GUARDED_BY(_lock);
+  bool _started VELK_GUARDED_BY(_lock) = false;
+  bool _stopping VELK_GUARDED_BY(_lock) = false;
+  std::thread _thread;
+};
+
+}  // namespace velk

@@ -1,0 +1,266 @@
+#include "platform/UserDefaults.h"
+
+#include <fcntl.h>
+#include <sys/file.h>
+#include <sys/stat.h>
+
+#include <cerrno>
+#include <system_error>
+
+#include "foundation/Json.h"
+#include "platform/BlockingScope.h"
+#include "platform/FileDescriptor.h"
+#include "platform/Files.h"
+#include "platform/Lock.h"
+#include "platform/Log.h"
+
+namespace velk {
+namespace {
+
+constexpr std::size_t kMaximumSuiteBytes = 4 * 1024 * 1024;
+
+/// What one version of a file is told by. Files are replaced, never written in place, and a version that is in use is
+/// kept open, so that its number cannot be given to the next one; size and time of change tell when somebody edits it
+/// in place or changes its mode.
+struct FileIdentity {
+  dev_t device = 0;
+  ino_t inode = 0;
+  off_t size = -1;  ///< below 0: there is no file
+  std::int64_t changed = 0;
+
+  bool operator==(const FileIdentity&) const = default;
+};
+
+FileIdentity identityOf(const struct stat& status) {
+  return {status.st_dev, status.st_ino, status.st_size,
+          std::int64_t{status.st_ctim.tv_sec} * 1'000'000'000 + status.st_ctim.tv_nsec};
+}
+
+FileIdentity identityOfPath(const std::string& path) {
+  struct stat status {};
+  return ::stat(path.c_str(), &status) == 0 ? identityOf(status) : FileIdentity{};
+}
+
+enum class Usability { usable, corrupt, unreadable };
+
+/// One version of a suite's file in memory.
+struct Version {
+  FileIdentity identity;
+  FileDescriptor file;
+  PropertyDictionary values;
+  bool isTrustworthy = true;
+  Usability usability = Usability::usable;
+  std::string problem;
+};
+
+Version problematic(Version version, Usability usability, std::string problem) {
+  version.usability = usability;
+  version.problem = std::move(problem);
+  return version;
+}
+
+Version readVersion(const std::string& path) {
+  Version version;
+  version.file = FileDescriptor(::open(path.c_str(), O_RDONLY | O_CLOEXEC | O_NONBLOCK | O_NOCTTY));
+  if (!version.file) {
+    if (errno == ENOENT || errno == ENOTDIR) return version;
+    const std::string problem = std::generic_category().message(errno);
+    version.identity = identityOfPath(path);
+    return problematic(std::move(version), Usability::unreadable, problem);
+  }
+  struct stat status {};
+  if (::fstat(version.file.get(), &status) == 0) version.identity = identityOf(status);
+  version.isTrustworthy = files::isTrustworthy(path);
+  // The open descriptor, not the path: the file may be replaced at any moment.
+  const auto bytes = files::readDescriptor(version.file.get(), path, kMaximumSuiteBytes);
+  if (!bytes) {
+    const bool tooLarge = bytes.error().code == static_cast<int>(files::Code::tooLarge);
+    return problematic(std::move(version), tooLarge ? Usability::corrupt : Usability::unreadable,
+                       bytes.error().description);
+  }
+  auto parsed = json::parse({reinterpret_cast<const char*>(bytes->data()), bytes->size()}, json::Extensions::tagged);
+  if (!parsed) return problematic(std::move(version), Usability::corrupt, parsed.error().description);
+  const auto* dictionary = parsed->dictionary();
+  if (dictionary == nullptr) return problematic(std::move(version), Usability::corrupt, "not a dictionary");
+  version.values = *dictionary;
+  return version;
+}
+
+/// A file whose last version is kept in memory. Reads cost one stat() while nobody writes.
+class CachedFile {
+ public:
+  explicit CachedFile(std::string path) : _path(std::move(path)) {}
+
+  [[nodiscard]] const std::string& path() const noexcept { return _path; }
+
+  /// The version that is on the disk now. `isNew` becomes true when this object had not seen it before.
+  std::shared_ptr<const Version> current(bool& isNew) {
+    const FileIdentity identity = identityOfPath(_path);
+    {
+      Guard guard(_lock);
+      isNew = _version == nullptr || _version->identity != identity;
+      if (!isNew) return _version;
+    }
+    // Not under the lock: another thread that reads the file meanwhile finds the same.
+    auto version = std::make_shared<const Version>(readVersion(_path));
+    Guard guard(_lock);
+    _version = version;
+    return version;
+  }
+
+ private:
+  const std::string _path;
+  Lock _lock;
+  std::shared_ptr<const Version> _version VELK_GUARDED_BY(_lock);
+};
+
+/// The lock file of a suite, held by one writer of all processes.
+class SuiteLock {
+ public:
+  explicit SuiteLock(const std::string& path) {
+    // Failing is usual: the file is there already.
+    (void)files::createEmpty(path);
+    _file = FileDescriptor(::open(path.c_str(), O_RDWR | O_CLOEXEC | O_NOFOLLOW));
+    if (!_file) return;
+    const BlockingScope blocking;
+    while (::flock(_file.get(), LOCK_EX) != 0) {
+      if (errno == EINTR) continue;
+      _file = FileDescriptor();
+      return;
+    }
+  }
+  [[nodiscard]] bool held() const noexcept { return static_cast<bool>(_file); }
+
+ private:
+  FileDescriptor _file;  // closing it lets the lock go
+};
+
+class FileUserDefaults : public UserDefaults {
+ public:
+  FileUserDefaults(std::string_view suite, std::string stateDirectory, const std::string& configurationDirectory)
+      : _stateDirectory(std::move(stateDirectory)),
+        _lockPath(_stateDirectory + "/" + std::string(suite) + ".lock"),
+        _user(_stateDirectory + "/" + std::string(suite) + ".json"),
+        _administrator(configurationDirectory.empty() ? ""
+                                                      : configurationDirectory + "/" + std::string(suite) + ".json") {}
+
+  std::optional<PropertyValue> value(std::string_view key) const override {
+    const auto user = userVersion();
+    if (const auto* found = user->values.find(key)) return *found;
+    const auto defaults = administratorValues();
+    const auto* found = defaults.find(key);
+    return found != nullptr ? std::optional(*found) : std::nullopt;
+  }
+
+  PropertyDictionary allValues() const override {
+    auto values = administratorValues();
+    values.merge(userVersion()->values);
+    return values;
+  }
+
+  Result<void> set(std::string_view key, PropertyValue value) override {
+    return change([&](PropertyDictionary& values) {
+      values.set(key, std::move(value));
+      return true;
+    });
+  }
+
+  Result<void> remove(std::string_view key) override {
+    if (!userVersion()->values.contains(key)) return {};
+    return change([&](PropertyDictionary& values) { return values.remove(key); });
+  }
+
+  Result<PropertyValue> valueOrStore(std::string_view key, const std::function<PropertyValue()>& make) override {
+    if (auto found = value(key)) return std::move(*found);
+    PropertyValue result;
+    const auto changed = change([&](PropertyDictionary& values) {
+      // Another process may have been quicker.
+      if (const auto* found = values.find(key)) {
+        result = *found;
+        return false;
+      }
+      result = make();
+      values.set(key, result);
+      return true;
+    });
+    if (!changed) return Failure(changed.error());
+    return result;
+  }
+
+ private:
+  std::shared_ptr<const Version> userVersion() const {
+    bool isNew = false;
+    auto version = _user.current(isNew);
+    if (version->usability == Usability::corrupt) return afterSettingAside(isNew);
+    if (isNew && version->usability == Usability::unreadable) {
+      log::error("UserDefaults: Cannot read %s: %s", _user.path(), version->problem);
+    }
+    return version;
+  }
+
+  /// Under the suite's lock a corrupt file is what every process sees, so it is moved away once.
+  std::shared_ptr<const Version> afterSettingAside(bool isUnreported) const {
+    const SuiteLock suite(_lockPath);
+    return setAsideLocked(isUnreported);
+  }
+
+  std::shared_ptr<const Version> setAsideLocked(bool isUnreported) const {
+    bool isNew = false;
+    auto version = _user.current(isNew);
+    if (version->usability != Usability::corrupt) return version;
+    if (const auto name = files::setAside(_user.path())) {
+      log::error("UserDefaults: Set aside unusable %s as %s: %s", _user.path(), *name, version->problem);
+    } else if (isNew || isUnreported) {
+      log::error("UserDefaults: Cannot use %s: %s", _user.path(), version->problem);
+    }
+    return _user.current(isNew);
+  }
+
+  PropertyDictionary administratorValues() const {
+    if (_administrator.path().empty()) return {};
+    bool isNew = false;
+    const auto version = _administrator.current(isNew);
+    const bool refused = !version->isTrustworthy;
+    if (isNew && refused) log::error("UserDefaults: Ignoring %s: others can write it", _administrator.path());
+    if (isNew && !refused && version->usability != Usability::usable) {
+      log::error("UserDefaults: Cannot use %s: %s", _administrator.path(), version->problem);
+    }
+    return refused ? PropertyDictionary() : version->values;
+  }
+
+  /// Reads, lets `edit` change the values, and writes them when it returns true: one step among all processes.
+  Result<void> change(const std::function<bool(PropertyDictionary&)>& edit) {
+    if (auto made = files::createDirectories(_stateDirectory, 0700); !made) return made;
+    const SuiteLock suite(_lockPath);
+    if (!suite.held()) return failure("UserDefaults", 1, "cannot lock " + _lockPath);
+    const auto version = setAsideLocked(false);
+    if (version->usability == Usability::unreadable) {
+      return failure("UserDefaults", 2, "cannot read " + _user.path() + ": " + version->problem);
+    }
+    PropertyDictionary values = version->values;
+    if (!edit(values)) return {};
+    std::string text;
+    if (!json::writePretty(values, text, json::Extensions::tagged)) {
+      return failure("UserDefaults", 3, "a value cannot be stored in " + _user.path());
+    }
+    text += '\n';
+    if (text.size() > kMaximumSuiteBytes) return failure("UserDefaults", 4, _user.path() + " would grow too large");
+    return files::writeAtomically(_user.path(), {reinterpret_cast<const std::uint8_t*>(text.data()), text.size()});
+  }
+
+  // Constant after construction.
+  const std::string _stateDirectory;
+  const std::string _lockPath;
+  // Self-synchronised.
+  mutable CachedFile _user;
+  mutable CachedFile _administrator;
+};
+
+}  // namespace
+
+std::unique_ptr<UserDefaults> openUserDefaults(std::string_view suite, std::string stateDirectory,
+                                               std::string configurationDirectory) {
+  return std::make_unique<FileUserDefaults>(suite, std::move(stateDirectory), configurationDirectory);
+}
+
+}  // namespace velk
