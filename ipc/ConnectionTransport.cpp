@@ -1,0 +1,235 @@
+// How a connection's bytes move: on the event loop's thread, except that the delivery queue may send what it has just
+// answered.
+#include <cerrno>
+#include <cstring>
+
+#include "ipc/ConnectionCore.h"
+#include "ipc/Limits.h"
+#include "platform/LocalSocket.h"
+
+namespace velk::ipc {
+namespace {
+
+/// Reads of one connection in one turn of the loop, before others get theirs.
+constexpr int kReadsPerTurn = 4;
+
+/// One for the loop's thread, whatever the number of connections.
+std::span<std::uint8_t> receiveBuffer() {
+  thread_local std::vector<std::uint8_t> buffer(kReceiveBytes);
+  return buffer;
+}
+
+}  // namespace
+
+bool ConnectionCore::openWatch() {
+  if (!_watch && !_closed) _watch = _loop.watch(_socket.get());
+  return _watch != nullptr;
+}
+
+void ConnectionCore::startReading() {
+  if (_reading || _readingDone || _closed) return;
+  _reading = true;
+  if (openWatch()) {
+    receive();
+  } else {
+    readingEnded(End::badFrame, "the system cannot watch its socket");
+  }
+}
+
+void ConnectionCore::awaitReadable() {
+  if (_readingDone || _closed) return;
+  _watch->whenReadable([self = shared_from_this()] { self->receive(); });
+}
+
+void ConnectionCore::receive() {
+  if (_readingDone || _closed) return;
+  int reads = 0;
+  while (reads < kReadsPerTurn && receiveOnce()) ++reads;
+  if (!_readingDone && !pausesReading()) awaitReadable();
+}
+
+/// True when there may be more to read at once.
+bool ConnectionCore::receiveOnce() {
+  const auto buffer = receiveBuffer();
+  const auto transfer = receiveFromLocalSocket(_socket.get(), buffer, _reader.arrivedDescriptors());
+  switch (transfer.status) {
+    case Transfer::Status::wouldBlock:
+      return false;
+    case Transfer::Status::moved:
+      return received(buffer.first(transfer.bytes)) && transfer.bytes == buffer.size();
+    case Transfer::Status::failed:
+      if (transfer.error == ECONNRESET) break;
+      readingEnded(End::badFrame, transfer.error == EMFILE ? "descriptors were lost" : "its socket failed");
+      return false;
+    case Transfer::Status::ended:
+      break;
+  }
+  // What a client began and did not finish is its fault; when a daemon dies in mid-frame it is one that went away.
+  if (_accepted && _reader.hasPartialFrame()) {
+    readingEnded(End::badFrame, "frame cut short");
+  } else {
+    readingEnded(End::endOfFile, "");
+  }
+  return false;
+}
+
+bool ConnectionCore::received(std::span<const std::uint8_t> bytes) {
+  const char* fault = nullptr;
+  bool anything = false;
+  {
+    Guard guard(_inboxLock);
+    const std::size_t framesBefore = _inbox.frames.size();
+    const std::size_t bytesBefore = _inbox.bytes.size();
+    const std::size_t descriptorsBefore = _inbox.descriptors.size();
+    fault = _reader.consume(bytes, _inbox);
+    const std::size_t frames = _inbox.frames.size() - framesBefore;
+    anything = frames != 0;
+    _unreadBytes.fetch_add(_inbox.bytes.size() - bytesBefore + frames * kFrameHeaderBytes);
+    _unclaimedDescriptors.fetch_add(_inbox.descriptors.size() - descriptorsBefore);
+  }
+  if (fault != nullptr) {
+    readingEnded(End::badFrame, fault);
+  } else if (_reader.sawGoodbye()) {
+    readingEnded(End::goodbye, "");
+  } else if (anything) {
+    scheduleDelivery();
+  }
+  return !_readingDone && _unreadBytes.load() < kMaximumUnreadBytes;
+}
+
+/// Leaves the socket alone while too much waits to be run; whoever runs it lets reading go on.
+bool ConnectionCore::pausesReading() {
+  if (_unreadBytes.load() < kMaximumUnreadBytes && _unclaimedDescriptors.load() < kMaximumUnclaimedDescriptors) {
+    return false;
+  }
+  _readingPaused = true;
+  return !(mayResumeReading() && _readingPaused.exchange(false));
+}
+
+void ConnectionCore::readingEnded(End end, const char* reason) {
+  if (!std::exchange(_readingDone, true)) {
+    Guard guard(_inboxLock);
+    _receivedEnd = end;
+    _endReason = reason;
+  }
+  scheduleDelivery();
+}
+
+void ConnectionCore::awaitWritable() {
+  if (_closed) return;
+  if (!openWatch()) return sendingFailed();
+  _watch->whenWritable([self = shared_from_this()] { self->pump(Sender::loop); });
+}
+
+/// Sends until nothing is left or the socket is full. The caller is the sender, and no longer is on return unless the
+/// loop waits for room.
+void ConnectionCore::pump(Sender self) {
+  if (self == Sender::loop && _closed) return;
+  for (;;) {
+    if (_sending.allSent() && !refillSending(self)) return;
+    const auto part = _sending.next();
+    const auto transfer = sendToLocalSocket(_socket.get(), part.bytes, part.descriptors);
+    if (transfer.status == Transfer::Status::moved) {
+      _sending.sent(transfer.bytes);
+      bytesLeft(transfer.bytes);
+    } else if (transfer.status == Transfer::Status::failed) {
+      return sendingFailed();
+    } else if (self == Sender::loop) {
+      return awaitWritable();
+    } else {
+      {
+        Guard guard(_lock);
+        _sender = Sender::loop;
+      }
+      return _loop.post([core = shared_from_this()] { core->awaitWritable(); });
+    }
+  }
+}
+
+bool ConnectionCore::refillSending(Sender self) {
+  _sending.clear();
+  {
+    Guard guard(_lock);
+    if (!_outbox.empty()) {
+      std::swap(_outbox, _sending);
+      return true;
+    }
+    _sender = Sender::nobody;
+  }
+  _allSent.notifyAll();
+  if (!_closeWanted.load()) return false;
+  if (self == Sender::loop) {
+    closeNow();
+  } else {
+    _loop.post([core = shared_from_this()] { core->closeNow(); });
+  }
+  return false;
+}
+
+/// The peer reads no more. What it had sent before may still wait in the socket, so reading goes on.
+void ConnectionCore::sendingFailed() {
+  _sending.clear();
+  Outbox dropped;
+  {
+    Guard guard(_lock);
+    _sendFailed = true;
+    std::swap(dropped, _outbox);
+    _sender = Sender::nobody;
+    _outboxBytes = 0;
+  }
+  _allSent.notifyAll();
+  resumeDelivery();
+  if (_closeWanted.load()) _loop.post([core = shared_from_this()] { core->closeNow(); });
+}
+
+void ConnectionCore::bytesLeft(std::size_t count) {
+  if (_outboxBytes.fetch_sub(count) - count <= kOutboxBytesToPauseCalls / 2) resumeDelivery();
+}
+
+void ConnectionCore::resumeDelivery() {
+  if (_deliveryPaused.exchange(false)) queue->async([core = shared_from_this()] { core->deliver(); });
+}
+
+void ConnectionCore::closeWhenSent() {
+  if (_closed) return;
+  _closeWanted = true;
+  bool idle = false;
+  bool send = false;
+  {
+    Guard guard(_lock);
+    send = claimSenderLocked();
+    idle = !send && _sender == Sender::nobody;
+  }
+  if (idle) return closeNow();
+  if (!std::exchange(_closeTimerRuns, true)) {
+    _loop.postAfter(kDrainTime, [self = shared_from_this()] { self->closeNow(); });
+  }
+  if (send) pump(Sender::loop);
+}
+
+void ConnectionCore::closeNow() {
+  if (_closed) return;
+  Outbox dropped;
+  {
+    Guard guard(_lock);
+    if (_sender == Sender::deliveryQueue) {
+      // It is about to fail, and calls again.
+      return shutDownLocalSocket(_socket.get());
+    }
+    _closed = true;
+    _sendFailed = true;
+    _accepting = false;
+    _sender = Sender::nobody;
+    std::swap(dropped, _outbox);
+    _outboxBytes = 0;
+  }
+  _sending.clear();
+  _watch.reset();
+  _socket = FileDescriptor();
+  _allSent.notifyAll();
+  if (auto whenClosed = std::move(_whenClosed)) whenClosed();
+  resumeDelivery();
+  readingEnded(End::here, "");
+}
+
+}  // namespace velk::ipc
