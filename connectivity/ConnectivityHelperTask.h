@@ -1,0 +1,30 @@
+// One running request of a connectivity helper: collects the body of the answer and knows whom to tell.
+#pragma once
+
+#include <span>
+#include <string>
+
+#include "connectivity/ConnectivityInterface.h"
+
+namespace velk {
+
+/// Lives in its helper's table from the start of the request to its end; used on the helper's state queue alone.
+class ConnectivityHelperTask {
+ public:
+  ConnectivityHelperTask(std::string taskDescription, HttpCompletion completionHandler);
+  ~ConnectivityHelperTask();
+  ConnectivityHelperTask(const ConnectivityHelperTask&) = delete;
+  ConnectivityHelperTask& operator=(const ConnectivityHelperTask&) = delete;
+
+  [[nodiscard]] const std::string& taskDescription() const noexcept { return _taskDescription; }
+  void appendReceivedData(std::span<const std::uint8_t> data);
+  /// Calls the completion, if there is one, with what was received. Once.
+  void complete(std::shared_ptr<const HttpResponse> response, std::optional<Error> error);
+
+ private:
+  HttpCompletion _completionHandler;
+  const std::string _taskDescription;
+  ByteData _receivedData;
+};
+
+}  // namespace velk
