@@ -1,0 +1,77 @@
+// Which class a storebag section's name stands for.
+#include <array>
+#include <string_view>
+
+#include "backends/HTTPSPostBackend.h"
+#include "backends/LogTexts.h"
+#include "backends/VelkReportingBackend.h"
+#include "device/DeviceEnvironment.h"
+#include "ipc/Vocabulary.h"
+#include "platform/Log.h"
+
+namespace velk {
+
+namespace {
+
+/// The one family of devices without diagnostics-service backend.
+constexpr std::string_view kProductTypeWithoutQuill = "Hollin";
+
+struct Section {
+  const BackendContext& context;
+  const std::string& name;
+  const PropertyValue& profile;
+  const std::optional<std::string>& productFamily;
+  std::int32_t clientType;
+};
+
+using Maker = std::shared_ptr<VelkReportingBackend> (*)(const Section&);
+
+std::shared_ptr<VelkReportingBackend> makeHTTPSPostBackend(const Section& section) {
+  return HTTPSPostBackend::initWithName(section.context, section.name, section.profile, section.productFamily);
+}
+
+/// Stands where a class is known by name but not built into this daemon: its sections are passed over.
+std::shared_ptr<VelkReportingBackend> makeNothingYet(const Section& section) {
+  log::debug("VelkReportingBackend(newBackendWithName): this daemon has no %s backend", section.name);
+  return nullptr;
+}
+
+struct Row {
+  std::string_view name;
+  bool isSubstring;
+  Maker make;
+};
+
+// Tested from the top.
+constexpr std::array kRows{
+    Row{kVelkReportingBackendDashboard, false, makeNothingYet},
+    Row{kVelkReportingBackendUploadServer, false, makeNothingYet},
+    Row{kVelkReportingBackendHTTPPost, true, makeHTTPSPostBackend},
+    Row{kVelkReportingBackendHTTPPost2, false, makeHTTPSPostBackend},
+    Row{kVelkReportingBackendPowerlog, false, makeNothingYet},
+    Row{kVelkReportingBackendQRS, false, makeHTTPSPostBackend},
+    Row{kVelkReportingBackendQuill, false, makeNothingYet},
+};
+
+bool standsFor(const Row& row, const Section& section) {
+  if (row.isSubstring) return section.name.find(row.name) != std::string::npos;
+  if (section.name != row.name) return false;
+  return row.name != kVelkReportingBackendQuill ||
+         section.context.environment.productType() != kProductTypeWithoutQuill;
+}
+
+}  // namespace
+
+std::shared_ptr<VelkReportingBackend> newBackendWithName(const BackendContext& context, const std::string& name,
+                                                         const PropertyValue& profile,
+                                                         const std::optional<std::string>& productFamily,
+                                                         std::int32_t clientType) {
+  const Section section{context, name, profile, productFamily, clientType};
+  for (const Row& row : kRows) {
+    if (standsFor(row, section)) return row.make(section);
+  }
+  log::error(backend_texts::kUnknownBackend, name);
+  return nullptr;
+}
+
+}  // namespace velk

@@ -1,0 +1,52 @@
+// The events that a backend holds back, and the counters that say when they have waited long enough.
+// Guarded by the backend's state queue: every method runs on it, except where a method says otherwise.
+#pragma once
+
+#include <cstddef>
+#include <cstdint>
+#include <string>
+#include <unordered_map>
+#include <vector>
+
+#include "foundation/PropertyValue.h"
+
+namespace velk {
+
+class EventBatch {
+ public:
+  /// A batch never holds more than this (estimated): further events are refused until it is emptied. An ordinary batch
+  /// stays below a thousandth of it; only a session that can neither post nor discard comes here.
+  static constexpr std::uint64_t kMaximumBytes = 64U * 1024 * 1024;
+  /// So many methods are counted; further ones never reach a threshold by themselves.
+  static constexpr std::size_t kMaximumCounters = 65'536;
+
+  enum class Appended : std::uint8_t { kept, full, stillFull };
+
+  /// From the first event, kept or not, to the next `take` or `discard`.
+  [[nodiscard]] bool exists() const noexcept { return _exists; }
+  void create() noexcept { _exists = true; }
+
+  /// Counts an event of this method. True when more than `threshold` had been counted: the count then begins anew.
+  [[nodiscard]] bool countReaches(const PropertyValue* method, std::int32_t threshold);
+  void clearCounters() { _counters.clear(); }
+
+  /// `stillFull` when this is not the first event that is refused.
+  Appended append(PropertyDictionary event);
+  /// The events; the batch no longer exists. The counters stay.
+  [[nodiscard]] std::vector<PropertyDictionary> take();
+  void discard() { static_cast<void>(take()); }
+
+  /// Sets "_sessionID" in every event.
+  void setSessionID(const std::string& sessionID);
+  [[nodiscard]] std::uint64_t estimatedSize() const;
+
+ private:
+  std::vector<PropertyDictionary> _events;
+  // By the method's number; a method that is not a whole number is counted under its text's hash.
+  std::unordered_map<std::int64_t, std::int64_t> _counters;
+  std::uint64_t _bytes = 0;
+  bool _exists = false;
+  bool _refused = false;
+};
+
+}  // namespace velk

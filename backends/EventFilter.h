@@ -1,0 +1,38 @@
+// The payload filters of a client entry: which keys leave the device, and which only hashed. Owned by an HTTPS post
+// backend and used on its session's queue.
+#pragma once
+
+#include <cstddef>
+#include <cstdint>
+#include <string>
+#include <vector>
+
+#include "foundation/PropertyValue.h"
+
+namespace velk {
+
+enum class FilterAction : std::uint8_t { none, remove, sha256, blacklistValues, whitelistValues };
+
+struct FilterRecord {
+  std::int32_t method = -1;  ///< -1: every method
+  std::int32_t status = -1;  ///< -1: every status
+  FilterAction action = FilterAction::none;
+  PropertyValue key;    ///< one that is not text matches no key
+  PropertyValue value;  ///< the action's argument
+};
+
+class EventFilter {
+ public:
+  /// Replaces the records; an empty array keeps them as they are. Elements that are no dictionaries match nothing.
+  void createFiltersFromArray(const PropertyArray& filters);
+  [[nodiscard]] std::size_t size() const noexcept { return _records.size(); }
+
+  /// Applies to each key the first record that matches it, in place. The event's own "_method" and "_status" decide
+  /// which records apply.
+  void apply(PropertyDictionary& event) const;
+
+ private:
+  std::vector<FilterRecord> _records;
+};
+
+}  // namespace velk

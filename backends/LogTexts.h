@@ -1,0 +1,89 @@
+// The fixed texts of this folder, with their placeholders: log lines, and the errors that completions receive.
+// Code and tests share them; whoever watches the log relies on every letter, misprints included.
+#pragma once
+
+namespace velk::backend_texts {
+
+// Factory.
+inline constexpr const char* kUnknownBackend = "VelkReportingBackend(newBackendWithName): %s";
+
+// Creation of the HTTPS post backend.
+inline constexpr const char* kNoClientList = "HTTPSPostBackend(initWithName): can't find the client list.";
+inline constexpr const char* kDefaultPostURL = "HTTPSPostBackend(initWithName): Using user default '%s' for postURL";
+inline constexpr const char* kDefaultRealtimePostURL =
+    "HTTPSPostBackend(initWithName): Using user default '%s' for realtimePostURL";
+
+// Its configuration.
+inline constexpr const char* kEventThreshold = "resetBackendStateWithClient: event_threshold set to %d";
+inline constexpr const char* kExtrasOnInternal = "setBackendStateWithClient: extras on internal is set to %d";
+inline constexpr const char* kStorebagPostURL = "HTTPSPostBackend(updatePostLink): Storebag '%s' for postURL";
+inline constexpr const char* kStorebagRealtimePostURL =
+    "HTTPSPostBackend(updatePostLink): Storebag '%s' for realtimePostURL";
+inline constexpr const char* kRealtimePostURLDefaults =
+    "HTTPSPostBackend(updatePostLink): realtimePostURL defaults to postURL '%s'";
+inline constexpr const char* kBatchEventOverride =
+    "HTTPSPostBackend(updateBackendState): Store bag override  _batchEvent=%d";
+inline constexpr const char* kDisabledByConsent =
+    "HTTPSPostBackend(updateBackendState): reporting disabled by DNU: %d.";
+inline constexpr const char* kNotInCountryList =
+    "HTTPSPostBackend(updateBackendState): (%s) isn't in country code list %s";
+inline constexpr const char* kNotInDeviceWhitelist =
+    "HTTPSPostBackend(updateBackendState): (%s) isn't in device whitelist %s";
+inline constexpr const char* kInDeviceBlacklist =
+    "HTTPSPostBackend(updateBackendState): (%s) is in device blacklist %s";
+inline constexpr const char* kFiltersRequired = "HTTPSPostBackend(updateBackendState): filters are required.";
+inline constexpr const char* kSamplingThresholdChanged =
+    "HTTPSPostBackend(updateBackendState): sampling threshold for %s changed from %.02f to %.02f";
+inline constexpr const char* kClientFound =
+    "HTTPSPostBackend(updateBackendState): %s: client found %s:%s, state=%d, samplingFactor=%f";
+inline constexpr const char* kEventWhitelist = "HTTPSPostBackend(updateBackendState): %s: eventWhitelist=%@";
+inline constexpr const char* kEventBlacklist = "HTTPSPostBackend(updateBackendState): %s: eventBlacklist=%@";
+
+// Sending and batching.
+inline constexpr const char* kNoMessage = "HTTPSPostBackend(sendMessage): SESSION_TYPE_STOP message dictionary is nil";
+inline constexpr const char* kAddingStopFields =
+    "HTTPSPostBackend(sendMessage): Adding dnu type and sampling threshold to SESSION_TYPE_STOP message dictionary";
+inline constexpr const char* kRealtime = "HTTPSPostBackend(sendMessage): realtime is %d";
+inline constexpr const char* kForcingFlush =
+    "HTTPSPostBackend(sendMessage): Got a realtime event and some events have already been batched. Forcing Flush here "
+    "to keep events in order.";
+inline constexpr const char* kSending = "HTTPSPostBackend(sendMessage): Sending %d, %d, %d";
+inline constexpr const char* kBatching = "HTTPSPostBackend(sendMessage): Batching %d, %d, %d";
+inline constexpr const char* kFlushedAndStandalone = "Flushed events:\n%@\nStandalone event:\n%@";
+inline constexpr const char* kThresholdReached =
+    "HTTPSPostBackend(batchEvent): Flushing all batched events as we reached event threshold for method %d";
+inline constexpr const char* kBatchFull =
+    "HTTPSPostBackend(batchEvent): batch of backend %s is full, dropping events until it is flushed";
+inline constexpr const char* kUnableToSerialize =
+    "HTTPSPostBackend(createMessageForPostAndLogging): Serializer unable to handle key: %s, value: %s";
+inline constexpr const char* kNoBody =
+    "HTTPSPostBackend(createMessageForPostAndLogging): %d events of backend %s have no JSON form and are lost";
+
+// Posting.
+inline constexpr const char* kPostURLMissing = "postURL is nil";
+inline constexpr const char* kPostError = "HTTPSPostBackend(postJsonMessage): post error: %s";
+inline constexpr const char* kDisabledByServer = "backend %s disabled by server %d return code";
+inline constexpr const char* kPostJSONMessage = "postJSONMessage: %s";
+
+// Flushing.
+inline constexpr const char* kFlushCalled = "HTTPSPostBackend(flushMessagesWithCompletion): called";
+inline constexpr const char* kFlushNotWhitelisted =
+    "flushMessagesWithCompletion: Dropping event with category %d as it is not whitelisted for backend %s";
+inline constexpr const char* kFlushBlacklisted =
+    "flushMessagesWithCompletion: Dropping event with category %d as it is blacklisted for backend %s";
+inline constexpr const char* kUserInfoRequired = "Can not flush: userInfo is required";
+inline constexpr const char* kNothingToFlush = "Nothing to flush";
+inline constexpr const char* kEverythingFiltered = "Nothing to flush: batched events were completely filtered out";
+
+// Macro expansion.
+inline constexpr const char* kExpandingMacro = "expandMacroForDataSet: Expanding macro '%@' into '%@'";
+
+// Compression.
+inline constexpr const char* kCompressEmpty = "compressDataWithZlibOrGzip: Cannot compress empty ByteBuffer";
+inline constexpr const char* kCompressSetupError =
+    "compressDataWithZlibOrGzip: deflateInit2() Error: \"%s\" Message: \"%s\"";
+inline constexpr const char* kCompressed = "compressDataWithZlibOrGzip: Compressed file from %u to %u";
+inline constexpr const char* kCompressError =
+    "compressDataWithZlibOrGzip: zlib error while attempting compression: \"%s\" Message: \"%s\"";
+
+}  // namespace velk::backend_texts
