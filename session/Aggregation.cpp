@@ -1,0 +1,68 @@
+// Events on their way to the client that aggregates them. An event is only ever appended to the aggregator's bounded
+// outbox: a peer that hangs costs its relatives a log line, never time.
+#include "platform/Log.h"
+#include "session/ClientSession.h"
+#include "session/LogTexts.h"
+
+namespace velk {
+
+namespace {
+
+void logFailure(const Result<void>& sent) {
+  if (!sent) log::standard(session_texts::kProxyFailure, sent.error());
+}
+
+}  // namespace
+
+void ClientSession::aggregateMessage(double timestamp, std::uint16_t category, std::uint16_t type,
+                                     const PropertyDictionary* payload) {
+  const bool mayHaveAncestors = ownHierarchy().token && ownHierarchy().level > 0;
+  if (!mayHaveAncestors && !hasAggregator()) return;  // nobody could listen: spare the merge and the agent's lock
+  std::optional<PropertyDictionary> merged;
+  if (payload != nullptr) {
+    merged = *payload;
+    if (ownUserInfo()) merged->merge(*ownUserInfo());
+  }
+  Result<void> sent;
+  std::shared_ptr<ReportingdSession> ancestor;
+  if (mayHaveAncestors) {
+    Guard guard(_delegate.monitor());
+    ancestor = _delegate.getAncestorWithAggregatorForSession(*this);
+    if (ancestor) sent = ancestor->sendToAggregator(ownSessionInfo(), timestamp, category, type, merged);
+  }
+  if (!ancestor && hasAggregator()) sent = sendToAggregator(ownSessionInfo(), timestamp, category, type, merged);
+  logFailure(sent);
+}
+
+Result<void> ClientSession::sendToAggregator(const std::optional<PropertyDictionary>& sessionInfo, double timestamp,
+                                             std::uint16_t category, std::uint16_t type,
+                                             const std::optional<PropertyDictionary>& payload) {
+  Guard guard(_aggregationLock);
+  if (!_hasAggregator) return {};  // ended since the caller looked: nothing follows the end marker
+  return appendToConnection(sessionInfo, timestamp, category, type, payload);
+}
+
+void ClientSession::shutdownSessionAggregation() {
+  log::standard(session_texts::kDisableAggregation, sessionID());
+  Result<void> sent;
+  {
+    Guard guard(_aggregationLock);
+    if (_hasAggregator) sent = appendToConnection(std::nullopt, 0, 0, 0, std::nullopt);
+    _hasAggregator = false;
+  }
+  logFailure(sent);
+}
+
+Result<void> ClientSession::appendToConnection(const std::optional<PropertyDictionary>& sessionInfo, double timestamp,
+                                               std::uint16_t category, std::uint16_t type,
+                                               const std::optional<PropertyDictionary>& payload) {
+  std::shared_ptr<SessionConnection> connection;
+  {
+    Guard guard(_lock);
+    connection = _connection;
+  }
+  if (!connection) return {};  // ended by ourselves: there is nobody left to tell
+  return connection->sendMessageToClient(sessionInfo, timestamp, category, type, payload);
+}
+
+}  // namespace velk

@@ -1,0 +1,107 @@
+// Creation, and what other threads read.
+#include "session/ReportingdSession.h"
+
+#include "foundation/Base64.h"
+#include "foundation/Format.h"
+#include "foundation/Uuid.h"
+#include "ipc/Vocabulary.h"
+#include "platform/Log.h"
+#include "session/ClientSession.h"
+#include "session/LogTexts.h"
+#include "session/SessionConstants.h"
+
+namespace velk {
+
+std::shared_ptr<ReportingdSession> ReportingdSession::initWithSessionDelegate(
+    ReportingdSessionDelegate& delegate, std::shared_ptr<SessionConnection> connection,
+    const SessionServices& services) {
+  return std::make_shared<ClientSession>(delegate, std::move(connection), services);
+}
+
+ClientSession::ClientSession(ReportingdSessionDelegate& delegate, std::shared_ptr<SessionConnection> connection,
+                             const SessionServices& services)
+    : _delegate(delegate),
+      _services(services),
+      _sessionIDString(base64Encoded(randomUuid())),
+      _connectivityHelperReleaseTimeout(kDefaultReleaseTimeout),
+      _connection(std::move(connection)) {
+  log::standard(session_texts::kSessionInit, _delegate.description());
+  readDeviceIdentifier();
+  log::standard(session_texts::kSessionInitialized, _sessionIDString);
+}
+
+std::optional<PropertyDictionary> ClientSession::sessionInfo() const {
+  Guard guard(_lock);
+  return _sessionInfo;
+}
+
+std::optional<PropertyDictionary> ClientSession::userInfo() const {
+  Guard guard(_lock);
+  return _userInfo;
+}
+
+std::optional<std::string> ClientSession::hierarchyToken() const {
+  Guard guard(_lock);
+  return _hierarchy.token;
+}
+
+std::uint32_t ClientSession::hierarchyLevel() const {
+  Guard guard(_lock);
+  return _hierarchy.level;
+}
+
+std::shared_ptr<const SessionBackends> ClientSession::backends() const {
+  Guard guard(_lock);
+  return _backends;
+}
+
+bool ClientSession::hasValidUserInfoKeys() const {
+  const auto info = userInfo();
+  return info &&
+         (info->contains(kVelkReportingUserInfoClientName) || info->contains(kVelkReportingUserInfoServiceName));
+}
+
+std::uint64_t ClientSession::batchedEventsSize() const { return velk::batchedEventsSize(backends().get()); }
+
+std::string ClientSession::description() const {
+  return formatText("<ReportingdSession %u, %s>", {sessionID(), _sessionIDString});
+}
+
+namespace {
+
+PropertyValue valueOrNull(const std::optional<PropertyDictionary>& dictionary, std::string_view key) {
+  const PropertyValue* value = dictionary ? dictionary->find(key) : nullptr;
+  return value != nullptr ? *value : PropertyValue();
+}
+
+PropertyArray statusOfBackends(const SessionBackends* backends) {
+  PropertyArray list;
+  if (backends == nullptr) return list;
+  for (const auto& entry : *backends) {
+    list.append(PropertyDictionary{
+        {"name", entry.name}, {"state", entry.backend->state()}, {"batchedBytes", entry.backend->batchedEventsSize()}});
+  }
+  return list;
+}
+
+}  // namespace
+
+PropertyDictionary ClientSession::statusDictionary() const {
+  const auto info = sessionInfo();
+  const auto user = userInfo();
+  const auto token = hierarchyToken();
+  return PropertyDictionary{{"sessionID", sessionID()},
+                            {"sessionIDString", _sessionIDString},
+                            {"clientType", valueOrNull(info, kVelkReportingSessionInfoClientType)},
+                            {"clientVersion", valueOrNull(info, kVelkReportingSessionInfoClientVersion)},
+                            {"clientName", valueOrNull(user, kVelkReportingUserInfoClientName)},
+                            {"serviceName", valueOrNull(user, kVelkReportingUserInfoServiceName)},
+                            {"level", hierarchyLevel()},
+                            {"token", token ? PropertyValue(*token) : PropertyValue()},
+                            {"counted", isCounted()},
+                            {"finished", _hasFinishedGracefully.load()},
+                            {"hasAggregator", hasAggregator()},
+                            {"backends", statusOfBackends(backends().get())}};
+}
+
+}  // namespace velk

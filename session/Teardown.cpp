@@ -1,0 +1,72 @@
+// The end of a session, from top to bottom.
+#include "connectivity/ReportingSessionConnectivityHelper.h"
+#include "platform/Log.h"
+#include "session/ClientSession.h"
+#include "session/Health.h"
+#include "session/LogTexts.h"
+#include "session/SessionConstants.h"
+
+namespace velk {
+
+void ClientSession::invalidate() {
+  std::shared_ptr<SessionConnection> connection;
+  {
+    Guard guard(_lock);
+    connection.swap(_connection);
+  }
+  if (connection) connection->invalidate();
+}
+
+void ClientSession::teardown() {
+  if (std::exchange(_tornDown, true)) return;
+  log::standard(session_texts::kSessionDealloc, sessionID());
+  PropertyDictionary healthPayload = makeHealthPayload();
+  if (ownBackends() && ownSessionInfo()) {
+    internalSendMessage(std::move(healthPayload), kInternalCategory, kHealthMessageType);
+    flushMessagesWithCompletion(FlushReply());
+  }
+  shutdownSessionAggregation();
+  returnKeepAlive();
+  // After the helper has counted this session: releasing the user info may end the helper, which gives back what it
+  // has counted.
+  releaseUserInfo();
+  releaseEverything();
+}
+
+PropertyDictionary ClientSession::makeHealthPayload() {
+  PropertyDictionary payload;
+  if (_storebagVersion) {
+    payload.set("StorebagVersion", *_storebagVersion);
+    payload.set("GracefulTermination", _hasFinishedGracefully.load());
+  }
+  // Holds other sessions. Dropping it drops references only, even the last ones.
+  const ReportingAgentState state = _delegate.copyReportingAgentState();
+  addSessionsAccumulatedHealthInfoToPayload(payload, *this, state.sessions, state.cachedStorebags,
+                                            _services.backends.platform.process);
+  return payload;
+}
+
+void ClientSession::returnKeepAlive() {
+  if (_connectivityHelper) {
+    log::standard(session_texts::kIncrementSessionsServed, sessionID());
+    _connectivityHelper->incrementTotalSessionsServedCount();
+    return;
+  }
+  log::standard(session_texts::kReleaseTransactionWithoutHelper, sessionID());
+  Guard guard(_delegate.monitor());
+  _delegate.releaseIPCTransactions(1);
+}
+
+void ClientSession::releaseEverything() {
+  _frameworks.clear();
+  publishBackends(nullptr);
+  _storebagVersion.reset();
+  _digestKey.reset();
+  Hierarchy hierarchy;
+  std::shared_ptr<SessionConnection> connection;
+  Guard guard(_lock);
+  std::swap(_hierarchy, hierarchy);
+  connection.swap(_connection);
+}
+
+}  // namespace velk
