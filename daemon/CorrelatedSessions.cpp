@@ -1,0 +1,139 @@
+#include "daemon/CorrelatedSessions.h"
+
+#include <algorithm>
+
+#include "daemon/LogTexts.h"
+#include "platform/Log.h"
+#include "session/ReportingdSession.h"
+
+namespace velk {
+
+namespace {
+
+using SessionList = CorrelatedSessions::SessionList;
+
+bool contains(const SessionList& list, const ReportingdSession& session) {
+  return std::any_of(list.begin(), list.end(), [&](const auto& listed) { return listed.get() == &session; });
+}
+
+void removeFrom(SessionList& list, const ReportingdSession& session) {
+  std::erase_if(list, [&](const auto& listed) { return listed.get() == &session; });
+}
+
+// First session of each level below `level`, so that a level that a client made up (they go to four thousand million)
+// costs no more than the sessions that there are.
+std::map<std::uint32_t, std::shared_ptr<ReportingdSession>> firstSessionsBelow(std::uint32_t level,
+                                                                               const SessionList& list) {
+  std::map<std::uint32_t, std::shared_ptr<ReportingdSession>> first;
+  for (const auto& session : list) {
+    if (session->hierarchyLevel() < level) first.try_emplace(session->hierarchyLevel(), session);
+  }
+  return first;
+}
+
+}  // namespace
+
+void CorrelatedSessions::add(ReportingdSession& session) {
+  const auto token = session.hierarchyToken();
+  if (!token) {
+    log::standard(daemontexts::kStandaloneSession, session.sessionID());
+    return;
+  }
+  for (auto& [otherToken, list] : _sessions) removeFrom(list, session);
+  auto& list = _sessions[*token];
+  log::standard(daemontexts::kAddingCorrelatedSession, session.sessionID(), *token, session.hierarchyLevel());
+  list.push_back(session.shared_from_this());
+}
+
+std::vector<std::string> CorrelatedSessions::remove(const ReportingdSession& session) {
+  std::vector<std::string> emptied;
+  for (auto& [token, list] : _sessions) {
+    // Under every token: the session may have forgotten its own since it registered.
+    removeFrom(list, session);
+    if (list.empty()) emptied.push_back(token);
+  }
+  for (const auto& token : emptied) _sessions.erase(token);
+  return emptied;
+}
+
+const SessionList* CorrelatedSessions::sessions(const std::string& token) const {
+  const auto found = _sessions.find(token);
+  return found != _sessions.end() && !found->second.empty() ? &found->second : nullptr;
+}
+
+std::shared_ptr<ReportingdSession> CorrelatedSessions::getFirstSessionWithHierarchy(std::uint32_t level,
+                                                                                    const SessionList& sessionList) {
+  for (const auto& session : sessionList) {
+    if (session->hierarchyLevel() == level) return session;
+  }
+  return nullptr;
+}
+
+std::optional<std::string> CorrelatedSessions::parentSessionIDString(const ReportingdSession& session) const {
+  const auto level = session.hierarchyLevel();
+  const auto token = session.hierarchyToken();
+  if (level == 0 || !token) return std::nullopt;
+  log::standard(daemontexts::kCheckingChain, *token, session.sessionID());
+  const auto* list = sessions(*token);
+  if (list == nullptr) {
+    log::error(daemontexts::kNoSessionsForChain, *token);
+    return std::nullopt;
+  }
+  if (!contains(*list, session)) {
+    log::standard(daemontexts::kNotFoundForChain, session.sessionID(), *token);
+    return std::nullopt;
+  }
+  const auto ancestors = firstSessionsBelow(level, *list);
+  std::optional<std::string> chain;
+  for (auto wanted = level; wanted-- > 0;) {
+    const auto ancestor = ancestors.find(wanted);
+    if (ancestor == ancestors.end()) {
+      log::standard(daemontexts::kGapInChain, chain);
+      break;
+    }
+    const auto& identifier = ancestor->second->sessionIDString();
+    chain = chain ? identifier + "." + *chain : identifier;
+  }
+  return chain;
+}
+
+std::shared_ptr<ReportingdSession> CorrelatedSessions::parent(const ReportingdSession& session) const {
+  const auto level = session.hierarchyLevel();
+  const auto token = session.hierarchyToken();
+  if (level == 0 || !token) return nullptr;
+  log::standard(daemontexts::kCheckingParent, *token, session.sessionID());
+  const auto* list = sessions(*token);
+  if (list == nullptr) {
+    log::error(daemontexts::kNoSessionsForParent, *token);
+    return nullptr;
+  }
+  if (!contains(*list, session)) {
+    log::error(daemontexts::kNotFoundForParent, session.sessionID(), *token);
+    return nullptr;
+  }
+  auto found = getFirstSessionWithHierarchy(level - 1, *list);
+  if (!found) log::standard(daemontexts::kNoParentAtLevel, level - 1, *token);
+  return found;
+}
+
+std::shared_ptr<ReportingdSession> CorrelatedSessions::ancestorWithAggregator(const ReportingdSession& session) const {
+  const auto token = session.hierarchyToken();
+  const auto* list = token ? sessions(*token) : nullptr;
+  if (list == nullptr) return nullptr;
+  for (const auto& [level, ancestor] : firstSessionsBelow(session.hierarchyLevel(), *list)) {
+    if (ancestor->hasAggregator()) return ancestor;
+  }
+  return nullptr;
+}
+
+SessionList CorrelatedSessions::descendants(const ReportingdSession& session) const {
+  const auto token = session.hierarchyToken();
+  const auto* list = token ? sessions(*token) : nullptr;
+  SessionList deeper;
+  if (list == nullptr) return deeper;
+  std::copy_if(list->begin(), list->end(), std::back_inserter(deeper),
+               [&](const auto& other) { return other->hierarchyLevel() > session.hierarchyLevel(); });
+  return deeper;
+}
+
+}  // namespace velk

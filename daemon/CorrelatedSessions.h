@@ -1,0 +1,48 @@
+// The sessions of each hierarchy token, in the order in which they registered, and the questions that sessions ask
+// about their relatives. Part of the agent, whose lock guards every call.
+#pragma once
+
+#include <cstdint>
+#include <map>
+#include <memory>
+#include <optional>
+#include <string>
+#include <vector>
+
+namespace velk {
+
+class ReportingdSession;
+
+/// The session at a level always means the first one in the token's list with exactly that level: levels may be
+/// shared, and may be missing.
+class CorrelatedSessions {
+ public:
+  using SessionList = std::vector<std::shared_ptr<ReportingdSession>>;
+
+  /// Puts the session at the end of its token's list, out of any other. Standalone sessions are not listed.
+  void add(ReportingdSession& session);
+  /// Takes the session out of the list where it stands, under whatever token. Returns the tokens that are now without
+  /// sessions; they have been dropped.
+  std::vector<std::string> remove(const ReportingdSession& session);
+
+  /// The identifier strings of the ancestors from the root to the parent, joined by "."; those above a gap are missing.
+  [[nodiscard]] std::optional<std::string> parentSessionIDString(const ReportingdSession& session) const;
+  [[nodiscard]] std::shared_ptr<ReportingdSession> parent(const ReportingdSession& session) const;
+  /// The ancestor nearest to the root that aggregates.
+  [[nodiscard]] std::shared_ptr<ReportingdSession> ancestorWithAggregator(const ReportingdSession& session) const;
+  /// Every deeper session of the token, in list order.
+  [[nodiscard]] SessionList descendants(const ReportingdSession& session) const;
+
+  [[nodiscard]] std::size_t tokenCount() const noexcept { return _sessions.size(); }
+
+  [[nodiscard]] static std::shared_ptr<ReportingdSession> getFirstSessionWithHierarchy(std::uint32_t level,
+                                                                                       const SessionList& sessionList);
+
+ private:
+  /// Null when the token has no list or an empty one.
+  [[nodiscard]] const SessionList* sessions(const std::string& token) const;
+
+  std::map<std::string, SessionList, std::less<>> _sessions;
+};
+
+}  // namespace velk

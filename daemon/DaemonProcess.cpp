@@ -1,0 +1,255 @@
+#include "daemon/DaemonProcess.h"
+
+#include <atomic>
+#include <vector>
+
+#include "daemon/IdleWatch.h"
+#include "daemon/IncomingConnection.h"
+#include "daemon/MessageLogFile.h"
+#include "daemon/ReportingdAgent.h"
+#include "daemon/StorebagService.h"
+#include "device/DeviceEnvironment.h"
+#include "ipc/Listener.h"
+#include "ipc/Vocabulary.h"
+#include "platform/DeviceInformation.h"
+#include "platform/Directories.h"
+#include "platform/Entitlements.h"
+#include "platform/EventLoop.h"
+#include "platform/Files.h"
+#include "platform/HttpSession.h"
+#include "platform/Launch.h"
+#include "platform/Log.h"
+#include "platform/Process.h"
+#include "platform/ThreadPool.h"
+#include "platform/UserDefaults.h"
+
+namespace velk {
+
+namespace {
+
+constexpr Duration kActivatedIdleLimit = std::chrono::seconds(30);
+// How long the end of the process waits for sessions to say goodbye, and then for the network to take their last posts.
+constexpr Duration kTeardownTime = std::chrono::seconds(5);
+constexpr Duration kDeliveryTime = std::chrono::seconds(10);
+// How far beyond its usual bound the pool may grow while everybody waits for the agent's lock: more than the
+// connections that a few users may have.
+constexpr std::size_t kEmergencyThreads = 3584;
+// Where retired message logs go for support to collect; without it they are deleted.
+constexpr std::string_view kLogSpoolSetting = "logSubmissionDirectory";
+
+std::optional<Duration> idleLimit(const DaemonOptions& options, bool activated) {
+  if (options.idleExitSeconds) {
+    if (*options.idleExitSeconds == 0) return std::nullopt;
+    return std::chrono::seconds(*options.idleExitSeconds);
+  }
+  return activated ? std::optional(kActivatedIdleLimit) : std::nullopt;
+}
+
+ThreadPoolOptions poolOptions() {
+  ThreadPoolOptions options;
+  options.emergencyThreads = kEmergencyThreads;
+  return options;
+}
+
+std::string textSetting(const UserDefaults& defaults, std::string_view key) {
+  const auto value = defaults.value(key);
+  const auto* text = value ? value->string() : nullptr;
+  return text != nullptr ? *text : std::string();
+}
+
+}  // namespace
+
+/// Everything, in the order in which it is made; the end is the reverse. What stands higher outlives what stands lower.
+struct DaemonProcess::Parts {
+  Parts(const DaemonOptions& options, process::RunLoop& loop, bool activated);
+
+  [[nodiscard]] bool hasEntitlement(std::string_view name, const Connection& connection);
+  [[nodiscard]] bool isOccupied() const {
+    return listener && (listener->openConnections() > 0 || listener->hasWaitingConnection());
+  }
+  [[nodiscard]] Listener::Options listenerOptions();
+  void reload();
+  /// Verification itself says nothing of a key that is missing, and everything that fails for it looks like the
+  /// network.
+  void reportMissingPublicKey() const;
+
+  process::RunLoop& runLoop;
+  const Directories directories;
+
+  const std::unique_ptr<ThreadPool> pool;
+  /// For the transport of storebags alone: what a session waits for with the agent's lock held never waits for a thread
+  /// behind the sessions that want this lock.
+  const std::unique_ptr<ThreadPool> storebagPool;
+  const std::unique_ptr<UserDefaults> defaults;
+  const std::unique_ptr<DeviceInformation> device;
+  const std::unique_ptr<Locale> locale;
+  const std::unique_ptr<HttpSessionService> http;
+  const std::unique_ptr<RandomSource> random;
+  const std::unique_ptr<Consent> consent;
+  const std::unique_ptr<ProcessStatistics> statistics;
+  const std::unique_ptr<LogSubmission> logSubmission;
+  const DeviceEnvironment environment;
+  IdleWatch idleWatch;
+  Platform platform;
+  Platform storebagPlatform;
+  MessageLogFile messageLog;
+  const SessionServices services;
+
+  const StorebagPublicKeySource publicKey;
+  const std::shared_ptr<StorebagService> storebagService;
+  const std::shared_ptr<ReportingdAgent> agent;
+
+  const std::shared_ptr<Queue> acceptQueue;
+  const std::shared_ptr<Queue> reloadQueue;
+  EventLoop eventLoop;
+  Lock entitlementsLock;
+  std::shared_ptr<const EntitlementRules> entitlements VELK_GUARDED_BY(entitlementsLock);
+  std::unique_ptr<Listener> listener;
+};
+
+DaemonProcess::Parts::Parts(const DaemonOptions& options, process::RunLoop& loop, bool activated)
+    : runLoop(loop),
+      directories(daemonDirectories()),
+      pool(makeThreadPool(poolOptions())),
+      storebagPool(makeThreadPool()),
+      defaults(openUserDefaults(kVelkReportingDefaultsSuite, directories.state, directories.configuration)),
+      device(makeDeviceInformation(directories.configuration)),
+      locale(makeLocale()),
+      http(makeHttpSessionService()),
+      random(makeRandomSource()),
+      consent(makeConsent(*defaults)),
+      statistics(makeProcessStatistics()),
+      logSubmission(makeLogSubmission(textSetting(*defaults, kLogSpoolSetting))),
+      environment(*defaults, *device),
+      idleWatch(
+          *pool, idleLimit(options, activated), [this] { return isOccupied(); }, [this] { runLoop.wakeUp(); }),
+      platform{systemClock(), *pool,     *defaults, *device,     *locale,       *http,
+               *random,       idleWatch, *consent,  *statistics, *logSubmission},
+      storebagPlatform{systemClock(), *storebagPool, *defaults, *device,     *locale,       *http,
+                       *random,       idleWatch,     *consent,  *statistics, *logSubmission},
+      messageLog(directories.logs, platform.clock, *logSubmission),
+      services{{platform, environment}, messageLog},
+      publicKey(storebagPublicKeyFromDirectories(directories.configuration, directories.data)),
+      storebagService(StorebagService::make(storebagPlatform, environment,
+                                            makeStorebagDiskCache(directories.cache + "/storebags"), publicKey)),
+      agent(ReportingdAgent::make(
+          platform, storebagService,
+          [this](ReportingdSessionDelegate& delegate, std::shared_ptr<SessionConnection> connection) {
+            return ReportingdSession::initWithSessionDelegate(delegate, std::move(connection), services);
+          })),
+      acceptQueue(pool->makeSerialQueue("com.tavrin.velkreportingd.accept")),
+      reloadQueue(pool->makeSerialQueue("com.tavrin.velkreportingd.reload")),
+      eventLoop("velk-ipc"),
+      entitlements(std::make_shared<EntitlementRules>(EntitlementRules::load(directories.configuration))) {}
+
+bool DaemonProcess::Parts::hasEntitlement(std::string_view name, const Connection& connection) {
+  std::shared_ptr<const EntitlementRules> rules;
+  {
+    Guard guard(entitlementsLock);
+    rules = entitlements;
+  }
+  return rules->valueOfEntitlement(name, connection.peer());
+}
+
+Listener::Options DaemonProcess::Parts::listenerOptions() {
+  Listener::Options options;
+  options.loop = &eventLoop;
+  options.acceptQueue = acceptQueue;
+  options.makeDeliveryQueue = [this] { return pool->makeSerialQueue("com.tavrin.velkreportingd.session"); };
+  options.shouldAcceptNewConnection = [this](const std::shared_ptr<Connection>& connection) {
+    return agent->shouldAcceptNewConnection(makeIncomingConnection(
+        connection, [this](std::string_view name, const Connection& asked) { return hasEntitlement(name, asked); }));
+  };
+  return options;
+}
+
+void DaemonProcess::Parts::reload() {
+  auto rules = std::make_shared<const EntitlementRules>(EntitlementRules::load(directories.configuration));
+  log::standard("reload: %d entitlement grants; storebags are fetched afresh", rules->grantCount());
+  {
+    Guard guard(entitlementsLock);
+    entitlements.swap(rules);
+  }
+  reportMissingPublicKey();
+  agent->refreshStorebags();
+}
+
+void DaemonProcess::Parts::reportMissingPublicKey() const {
+  if (publicKey()) return;
+  log::error("velkreportingd: there is no usable publicKey.der, neither in %@ nor in %@; no storebag can be verified",
+             directories.configuration, directories.data);
+}
+
+DaemonProcess::DaemonProcess(std::unique_ptr<Parts> parts) : _parts(std::move(parts)) {}
+DaemonProcess::~DaemonProcess() = default;
+
+Result<std::unique_ptr<DaemonProcess>> DaemonProcess::make(const DaemonOptions& options, process::RunLoop& runLoop) {
+  auto sockets = launch::takeActivatedSockets();
+  const bool activated = !sockets.empty();
+  auto parts = std::make_unique<Parts>(options, runLoop, activated);
+  for (const auto* directory : {&parts->directories.state, &parts->directories.cache}) {
+    if (const auto made = files::createDirectories(*directory); !made) {
+      return failure("velkreportingd", kExitCannotCreate,
+                     "cannot use the directory " + *directory + ": " + made.error().description +
+                         " (it must belong to the user that the daemon runs as)");
+    }
+  }
+  auto listener = [&]() -> Result<std::unique_ptr<Listener>> {
+    if (activated) return Listener::adopt(std::move(sockets.front()), parts->listenerOptions());
+    const auto path =
+        options.socketPath.empty() ? parts->directories.runtime + "/" + std::string(kServiceName) : options.socketPath;
+    if (options.socketPath.empty()) {
+      // Everybody may connect, so everybody may pass through.
+      if (const auto made = files::createDirectories(parts->directories.runtime, 0755); !made) {
+        return Failure(made.error());
+      }
+    }
+    return Listener::bind(path, parts->listenerOptions());
+  }();
+  if (!listener) {
+    return failure("velkreportingd", kExitUnavailable,
+                   "cannot listen for clients: " + listener.error().description +
+                       " (another place for the socket is given with --socket)");
+  }
+  parts->listener = std::move(*listener);
+  return std::unique_ptr<DaemonProcess>(new DaemonProcess(std::move(parts)));
+}
+
+void DaemonProcess::resume() {
+  _parts->reportMissingPublicKey();
+  _parts->listener->resume();
+  _parts->idleWatch.start();
+}
+
+void DaemonProcess::reload() {
+  _parts->reloadQueue->async([parts = _parts.get()] { parts->reload(); });
+}
+
+bool DaemonProcess::stopsListeningIfIdle() {
+  return _parts->idleWatch.isReleased() && _parts->listener->stopIfUnused();
+}
+
+void DaemonProcess::stop() {
+  _parts->idleWatch.stop();
+  // Whoever waits for a storebag gets none, so that the agent's lock is free.
+  _parts->storebagService->stop();
+  // Nobody new. A decision that is being taken right now still counts.
+  _parts->listener->stop();
+  _parts->acceptQueue->sync([] {});
+  // Everybody who is here: the call that runs is answered, then the session ends with its last messages.
+  _parts->agent->invalidateAllSessions();
+  if (!_parts->agent->waitForTeardowns(kTeardownTime)) {
+    log::error("stop: sessions are still busy after %d s and are cut off", kTeardownTime / std::chrono::seconds(1));
+  }
+  // What the sessions posted.
+  _parts->agent->invalidateAllConnectivityHelpers();
+  if (!_parts->idleWatch.waitUntilReleased(kDeliveryTime)) {
+    log::error("stop: posts are still under way after %d s and are cut off", kDeliveryTime / std::chrono::seconds(1));
+  }
+  // The threads: first those that hand work over, then those that do it.
+  _parts->eventLoop.stop();
+  _parts->pool->stop();
+  _parts->storebagPool->stop();
+}
+
+}  // namespace velk

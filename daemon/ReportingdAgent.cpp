@@ -1,0 +1,275 @@
+#include "daemon/ReportingdAgent.h"
+
+#include "daemon/LogTexts.h"
+#include "daemon/StorebagService.h"
+#include "device/DeviceEnvironment.h"
+#include "ipc/Vocabulary.h"
+#include "platform/Log.h"
+
+namespace velk {
+
+namespace {
+
+// The session info's client type; nothing when there is none.
+const PropertyValue* clientTypeIn(const PropertyDictionary& sessionInfo) {
+  const auto* value = sessionInfo.find(kVelkReportingSessionInfoClientType);
+  return value != nullptr && !value->isNull() ? value : nullptr;
+}
+
+}  // namespace
+
+std::shared_ptr<ReportingdAgent> ReportingdAgent::make(const Platform& platform,
+                                                       std::shared_ptr<StorebagService> storebagService,
+                                                       SessionFactory makeSession) {
+  return std::shared_ptr<ReportingdAgent>(
+      new ReportingdAgent(platform, std::move(storebagService), std::move(makeSession)));
+}
+
+ReportingdAgent::ReportingdAgent(const Platform& platform, std::shared_ptr<StorebagService> storebagService,
+                                 SessionFactory makeSession)
+    : _platform(platform),
+      _storebagService(std::move(storebagService)),
+      _makeSession(std::move(makeSession)),
+      _connectivityHelpers(std::make_shared<SharedConnectivityHelpers>(platform)),
+      _cachedStorebags(*_storebagService, platform.clock),
+      _keepAlive(platform.keepAlive) {}
+
+// ---- Connections
+
+bool ReportingdAgent::shouldAcceptNewConnection(const std::shared_ptr<IncomingConnection>& connection) {
+  if (!connection->valueOfEntitlement(kServiceEntitlement)) {
+    log::standard(daemontexts::kConnectionRefused, connection->description());
+    return false;
+  }
+  {
+    Guard guard(_monitor);
+    log::standard(daemontexts::kConnectionAccepted, connection->description(), _sessionList.size(),
+                  _correlatedSessions.tokenCount());
+  }
+  StatusHandler status;
+  if (connection->valueOfEntitlement(kStatusEntitlement)) {
+    status = [weak = weak_from_this()](StatusReply reply) {
+      if (const auto agent = weak.lock()) reply(agent->copyStatus());
+    };
+  }
+  _census.add();
+  const auto session = createReportingSessionWithDelegate(*this, connection);
+  connection->setExportedObject(session, std::move(status));
+  connection->setInterruptionHandler(
+      [session] { log::standard(daemontexts::kConnectionInterrupted, session->description()); });
+  connection->setInvalidationHandler(
+      [agent = shared_from_this(), session] { agent->connectionWasInvalidated(session); });
+  connection->resume();
+  return true;
+}
+
+// On the connection's queue, behind everything that the peer had sent.
+void ReportingdAgent::connectionWasInvalidated(const std::shared_ptr<ReportingdSession>& session) {
+  log::standard(daemontexts::kConnectionInvalidated, session->description());
+  invalidateReportingSession(session);
+  session->teardown();
+  _census.remove();
+}
+
+std::shared_ptr<ReportingdSession> ReportingdAgent::createReportingSessionWithDelegate(
+    ReportingdSessionDelegate& delegate, std::shared_ptr<SessionConnection> connection) {
+  auto session = _makeSession(delegate, std::move(connection));
+  Guard guard(_monitor);
+  _keepAlive.beginIfUnused(session->description());
+  _sessionList.push_back(session);
+  _keepAlive.retain();
+  return session;
+}
+
+void ReportingdAgent::invalidateReportingSession(const std::shared_ptr<ReportingdSession>& session) {
+  Guard guard(_monitor);
+  for (const auto& token : _correlatedSessions.remove(*session)) _sharedData.drop(token);
+  const auto description = session->description();
+  std::erase(_sessionList, session);
+  log::standard(daemontexts::kSessionInvalidated, description);
+  decrementActiveClientsLocked(*session);
+}
+
+// Whether this session was counted is not asked: one that never was still lowers its type's counter.
+void ReportingdAgent::decrementActiveClientsLocked(const ReportingdSession& session) {
+  const auto sessionInfo = session.sessionInfo();
+  const auto* value = sessionInfo ? clientTypeIn(*sessionInfo) : nullptr;
+  if (value == nullptr) return;
+  const auto clientType = int32Value(value);
+  if (const auto count = _activeClients.decrement(clientType)) {
+    log::debug(daemontexts::kActiveCountDecremented, clientType, *count);
+  }
+}
+
+void ReportingdAgent::invalidateAllSessions() {
+  for (const auto& session : copyReportingAgentState().sessions) session->invalidate();
+}
+
+// ---- Keep-alive and the active-client limit
+
+void ReportingdAgent::releaseIPCTransactions(std::uint32_t count) {
+  Guard guard(_monitor);
+  _keepAlive.release(count);
+}
+
+bool ReportingdAgent::isActiveClientLimitReachedForSession(ReportingdSession& session,
+                                                           const PropertyDictionary& sessionInfo) {
+  Guard guard(_monitor);
+  if (session.isCounted()) return false;
+  session.setCounted(true);
+  const auto* value = clientTypeIn(sessionInfo);
+  if (value == nullptr) {
+    log::error(daemontexts::kMissingClientType, session.sessionID(), sessionInfo);
+    session.invalidate();
+    return true;
+  }
+  const auto clientType = int32Value(value);
+  const bool limitReached = _activeClients.isLimitReached(clientType);
+  if (limitReached) log::error(daemontexts::kActiveLimitExceeded, session.sessionID(), *value);
+  // The refused session is counted as well; its invalidation brings the counter down again.
+  if (const auto count = _activeClients.increment(clientType)) {
+    log::debug(daemontexts::kActiveCountIncremented, clientType, *count);
+  }
+  if (limitReached) session.invalidate();
+  return limitReached;
+}
+
+// ---- Storebags
+
+std::optional<PropertyDictionary> ReportingdAgent::storebagForSession(ReportingdSession& session) {
+  Guard guard(_monitor);
+  return _cachedStorebags.storebagForSession(session);
+}
+
+std::optional<std::string> ReportingdAgent::storebagVersionForSession(ReportingdSession& session) {
+  Guard guard(_monitor);
+  return _cachedStorebags.storebagVersionForSession(session);
+}
+
+void ReportingdAgent::refreshStorebags() {
+  _storebagService->startAfresh();
+  Guard guard(_monitor);
+  _cachedStorebags.expireAll();
+}
+
+// ---- Hierarchies
+
+void ReportingdAgent::updateCorrelatedSessions(ReportingdSession& session) {
+  Guard guard(_monitor);
+  _correlatedSessions.add(session);
+}
+
+std::optional<std::string> ReportingdAgent::parentSessionIDStringForSession(ReportingdSession& session) {
+  Guard guard(_monitor);
+  return _correlatedSessions.parentSessionIDString(session);
+}
+
+std::shared_ptr<ReportingdSession> ReportingdAgent::parentSessionForChild(ReportingdSession& session) {
+  Guard guard(_monitor);
+  return _correlatedSessions.parent(session);
+}
+
+std::shared_ptr<ReportingdSession> ReportingdAgent::getAncestorWithAggregatorForSession(ReportingdSession& session) {
+  Guard guard(_monitor);
+  return _correlatedSessions.ancestorWithAggregator(session);
+}
+
+void ReportingdAgent::updateDownstreamSessions(ReportingdSession& session) {
+  if (!session.hierarchyToken()) return;
+  Guard guard(_monitor);
+  session.updateCombinedSessionID();
+  session.syncReportingStates();
+  const bool ancestorAggregates =
+      session.hierarchyLevel() >= 1 && _correlatedSessions.ancestorWithAggregator(session) != nullptr;
+  if (ancestorAggregates) session.shutdownSessionAggregation();
+  for (const auto& deeper : _correlatedSessions.descendants(session)) {
+    log::standard(daemontexts::kUpdatingDownstream, deeper->sessionID());
+    deeper->updateCombinedSessionID();
+    deeper->syncReportingStates();
+    // Only the topmost aggregator of a hierarchy stays active.
+    if ((ancestorAggregates || session.hasAggregator()) && deeper->hasAggregator()) {
+      deeper->shutdownSessionAggregation();
+    }
+  }
+}
+
+// ---- Shared data and transports
+
+void ReportingdAgent::updateSharedDataForSession(ReportingdSession& session, const PropertyDictionary& sharedData) {
+  Guard guard(_monitor);
+  if (_sharedData.merge(session.hierarchyToken(), sharedData)) return;
+  log::error(
+      "updateSharedDataForSession: session %u's data are not taken: those of its hierarchy would exceed %u bytes",
+      session.sessionID(), SharedDataTable::kMaximumBytes);
+}
+
+void ReportingdAgent::removeObjectFromSharedDataForSession(ReportingdSession& session, const std::string& key) {
+  Guard guard(_monitor);
+  _sharedData.removeKey(session.hierarchyToken(), key);
+}
+
+std::optional<PropertyDictionary> ReportingdAgent::sharedDataForSession(ReportingdSession& session) {
+  Guard guard(_monitor);
+  return _sharedData.values(session.hierarchyToken());
+}
+
+std::shared_ptr<ReportingSessionConnectivityHelper> ReportingdAgent::copySharedConnectivityHelperForReportingSession(
+    ReportingdSession& session, std::int32_t mode) {
+  const auto userInfo = session.hasValidUserInfoKeys() ? session.userInfo() : std::nullopt;
+  if (!userInfo) return nullptr;
+  return _connectivityHelpers->request(*userInfo, mode, weak_from_this());
+}
+
+void ReportingdAgent::releaseSharedConnectivityHelperForReportingSession(ReportingdSession& session) {
+  const auto userInfo = session.userInfo();
+  if (!userInfo) return;
+  if (session.hasValidUserInfoKeys()) {
+    _connectivityHelpers->release(*userInfo);
+  } else {
+    // A session whose user info names nobody was given no transport and has none to give back, even though its
+    // identifier reads like somebody's whose names are empty.
+    log::standard(daemontexts::kReleasingHelper, userInfoIdentifierString(*userInfo));
+  }
+}
+
+// ---- Snapshots
+
+ReportingAgentState ReportingdAgent::copyReportingAgentState() {
+  constexpr std::size_t kRoomForNewSessions = 8;
+  std::size_t sessionCount = 0;
+  {
+    Guard guard(_monitor);
+    sessionCount = _sessionList.size();
+  }
+  ReportingAgentState state;
+  state.sessions.reserve(sessionCount + kRoomForNewSessions);
+  Guard guard(_monitor);
+  state.sessions.assign(_sessionList.begin(), _sessionList.end());
+  state.cachedStorebags = _cachedStorebags.snapshot();
+  return state;
+}
+
+PropertyDictionary ReportingdAgent::copyStatus() {
+  std::vector<std::shared_ptr<ReportingdSession>> sessions;
+  PropertyDictionary status;
+  {
+    Guard guard(_monitor);
+    sessions = _sessionList;
+    status.set("keepAliveCount", _keepAlive.count());
+    status.set("hierarchies", _correlatedSessions.tokenCount());
+    status.set("storebags", _cachedStorebags.status());
+    PropertyDictionary activeClients;
+    for (std::int32_t type = 0; type < ActiveClientCounter::kFirstUncountedType; ++type) {
+      if (const auto count = _activeClients.count(type)) activeClients.set(std::to_string(type), count);
+    }
+    status.set("activeClients", std::move(activeClients));
+  }
+  PropertyArray rows;
+  for (const auto& session : sessions) rows.append(session->statusDictionary());
+  status.set("sessions", std::move(rows));
+  status.set("helpers", _connectivityHelpers->status());
+  status.set("processMemory", _platform.process.anonymousMemory());
+  return status;
+}
+
+}  // namespace velk

@@ -1,0 +1,39 @@
+// What the server said about a storebag's age, kept in the user-defaults suite between fetches. Used by the storebag
+// service under the storebag lock.
+#pragma once
+
+#include <cstdint>
+#include <optional>
+#include <string>
+
+#include "platform/HttpSession.h"
+#include "platform/UserDefaults.h"
+
+namespace velk {
+
+/// The max age that counts when the server gives none, and the most that a storebag may ask for itself.
+inline constexpr std::int32_t kDefaultStorebagMaxAge = 86400;
+
+class StorebagMetrics {
+ public:
+  /// `defaults` outlives it.
+  explicit StorebagMetrics(UserDefaults& defaults) : _defaults(defaults) {}
+
+  /// The stored max age in seconds, 0 when none was ever stored.
+  [[nodiscard]] std::int32_t maxAge(const std::string& name) const;
+
+  /// Replaces `lastModified` by the stored value when there is one. True: the stored one equals the one passed, so
+  /// the storebag in hand has been dealt with already.
+  bool updateLastModified(const std::string& name, std::optional<std::string>& lastModified) const;
+
+  /// From the headers of a successful answer.
+  void save(const std::string& name, const HttpResponse& response);
+
+ private:
+  UserDefaults& _defaults;
+};
+
+/// The seconds of a "Cache-Control" header's max-age; the default when the header is absent or gives none.
+[[nodiscard]] std::int32_t maxAgeOfCacheControl(const std::string* cacheControl);
+
+}  // namespace velk
