@@ -1,0 +1,120 @@
+// The services of the class that need no client object: identifiers, hierarchy tokens, one-shot messages.
+
+#include <atomic>
+
+#include "client/ClientRuntime.h"
+#include "client/DaemonConnection.h"
+#include "client/LogTexts.h"
+#include "client/SessionInfoValidation.h"
+#include "client/VelkReporting.h"
+#include "client/VelkReportingImplementation.h"
+#include "foundation/Uuid.h"
+#include "ipc/SessionProxies.h"
+#include "ipc/Vocabulary.h"
+#include "platform/Log.h"
+#include "platform/PersistentIdentifier.h"
+
+namespace velk {
+
+std::string VelkReporting::getPersistentIdentifierForDNU(bool respectConsent) {
+  return velk::getPersistentIdentifierForDNU(ClientRuntime::shared().defaults(), respectConsent);
+}
+
+void VelkReporting::regeneratePersistentIdentifierForDNU(bool respectConsent) {
+  velk::regeneratePersistentIdentifierForDNU(ClientRuntime::shared().defaults(), respectConsent);
+}
+
+std::optional<PropertyDictionary> VelkReporting::newHierarchyTokenFromParentToken(
+    const std::optional<PropertyValue>& parentToken) {
+  PropertyDictionary token;
+  if (!parentToken) {
+    token.set(kVelkReportingHierarchyTokenTokenID, randomUuidText());
+    token.set(kVelkReportingHierarchyTokenLevel, 0);
+    return token;
+  }
+  const PropertyDictionary* parent = parentToken->dictionary();
+  const PropertyValue* identifier = parent != nullptr ? parent->find(kVelkReportingHierarchyTokenTokenID) : nullptr;
+  if (identifier == nullptr) return std::nullopt;
+  const std::int64_t level = integerValue(parent->find(kVelkReportingHierarchyTokenLevel));
+  token.set(kVelkReportingHierarchyTokenTokenID, *identifier);
+  token.set(kVelkReportingHierarchyTokenLevel, static_cast<std::int64_t>(static_cast<std::uint64_t>(level) + 1));
+  return token;
+}
+
+namespace {
+
+/// One-shot messages that wait for their reply: each has a connection of its own.
+constexpr int kMaximumOneShots = 256;
+
+/// Counts one message for as long as its connection is needed.
+class OneShotSlot {
+ public:
+  explicit OneShotSlot(std::atomic<int>& underWay) : _underWay(underWay) {}
+  OneShotSlot(const OneShotSlot&) = delete;
+  OneShotSlot& operator=(const OneShotSlot&) = delete;
+  ~OneShotSlot() { _underWay.fetch_sub(1); }
+
+ private:
+  std::atomic<int>& _underWay;
+};
+
+struct OneMessage {
+  PropertyDictionary sessionInfo;
+  std::optional<PropertyDictionary> userInfo;
+  std::uint16_t category;
+  std::uint16_t type;
+  std::optional<PropertyDictionary> payload;
+};
+
+void sendOneMessage(ClientRuntime& runtime, const OneMessage& message, std::shared_ptr<OneShotSlot> slot) {
+  log::standard(texts::kClientStartsLogging);
+  auto made = connectToDaemon(runtime, runtime.oneMessageQueue());
+  if (!made && isDistrust(made.error())) return log::error("sendOneMessageWithSessionInfo: %s", made.error());
+  if (!made) return log::standard(texts::kOneMessageFailedToConnect);
+  const std::shared_ptr<Connection> connection = std::move(*made);
+  connection->setInvalidationHandler([slot] { log::standard(texts::kOneMessageInvalidated); });
+  connection->setInterruptionHandler([] { log::standard(texts::kOneMessageInterrupted); });
+  connection->resume();
+  const auto failed = [connection](const Error& error) {
+    log::standard(texts::kOneMessageNoProxy);
+    log::debug("sendOneMessageWithSessionInfo: %s", error);
+    connection->invalidate();
+  };
+  SessionInterfaceProxy(connection, failed)
+      .sendMessageWithSessionInfo(message.sessionInfo, message.userInfo, message.category, message.type,
+                                  message.payload, [connection](const std::optional<std::string>& text) {
+                                    log::standard(texts::kOneMessageReply, text);
+                                    connection->invalidate();
+                                  });
+}
+
+}  // namespace
+
+bool VelkReporting::sendOneMessageWithSessionInfo(const std::optional<PropertyDictionary>& sessionInfo,
+                                                  const std::optional<PropertyDictionary>& userInfo,
+                                                  std::uint16_t category, std::uint16_t type,
+                                                  const std::optional<PropertyDictionary>& payload, Error* error) {
+  ClientRuntime& runtime = ClientRuntime::shared();
+  const auto refuse = [error](Error reason) {
+    if (error != nullptr) *error = std::move(reason);
+    return false;
+  };
+  if (auto invalid = validateSessionInfo(sessionInfo)) return refuse(std::move(*invalid));
+  const std::string domain(kVelkReportingErrorDomain);
+  if (category == 0) return refuse({domain, 4, "the category is 0"});
+  auto& underWay = runtime.oneMessagesUnderWay();
+  if (underWay.fetch_add(1) >= kMaximumOneShots) {
+    underWay.fetch_sub(1);
+    return refuse({domain, VelkReportingImplementation::kOutboxFull, "too many single messages are under way"});
+  }
+  auto slot = std::make_shared<OneShotSlot>(underWay);
+  if (error != nullptr) *error = {};
+  OneMessage message{*sessionInfo, userInfo, category, type, payload};
+  message.sessionInfo.set(kVelkReportingSessionInfoBatchEvent, false);  // the event must go out at once
+  runtime.oneMessageQueue()->async([&runtime, message = std::move(message), slot = std::move(slot)]() mutable {
+    sendOneMessage(runtime, message, std::move(slot));
+  });
+  return true;
+}
+
+}  // namespace velk

@@ -1,0 +1,26 @@
+#include "client/DaemonConnection.h"
+
+#include "client/ClientRuntime.h"
+#include "platform/Directories.h"
+#include "platform/Log.h"
+#include "platform/PeerTrust.h"
+
+namespace velk {
+
+Result<std::shared_ptr<Connection>> connectToDaemon(ClientRuntime& runtime, std::shared_ptr<Queue> deliveryQueue) {
+  const std::string path = daemonSocketPath();
+  auto made = Connection::connect(path, runtime.loop(), std::move(deliveryQueue));
+  if (!made) return made;
+  const auto distrust = reasonToDistrustService(path, (*made)->peer().uid);
+  if (!distrust) return made;
+  (*made)->invalidate();
+  return failure(std::string(kTrustErrorDomain), kDistrustedService, *distrust);
+}
+
+bool isDistrust(const Error& error) { return error.domain == kTrustErrorDomain && error.code == kDistrustedService; }
+
+ProxyErrorHandler loggingHandler(std::string_view text) {
+  return [text](const Error& error) { log::standard(text, error); };
+}
+
+}  // namespace velk

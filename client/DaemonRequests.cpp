@@ -1,0 +1,162 @@
+// The calls that ask the daemon for something, each with its own words for a daemon that cannot be reached.
+
+#include "client/DaemonConnection.h"
+#include "client/LogTexts.h"
+#include "client/VelkReportingImplementation.h"
+#include "foundation/Uuid.h"
+#include "platform/Log.h"
+
+namespace velk {
+
+namespace {
+
+const Error& noDaemon() {
+  static const Error error = connectionError(ConnectionError::notConnected, "no daemon answers");
+  return error;
+}
+
+/// A callback of the user, shared between the reply and the error handler: whichever comes runs it, elsewhere, once.
+template <class... Arguments>
+class SharedCallback {
+ public:
+  SharedCallback(ClientRuntime& runtime, std::function<void(Arguments...)> callback)
+      : _runtime(&runtime), _callback(std::make_shared<std::function<void(Arguments...)>>(std::move(callback))) {}
+
+  template <class... Given>
+  void operator()(Given... given) const {
+    auto callback = std::exchange(*_callback, nullptr);
+    if (!callback) return;
+    _runtime->runCallback([callback = std::move(callback), given = std::make_tuple(std::move(given)...)] {
+      std::apply(callback, given);
+    });
+  }
+
+ private:
+  ClientRuntime* _runtime;
+  std::shared_ptr<std::function<void(Arguments...)>> _callback;
+};
+
+}  // namespace
+
+ConfigurationReply VelkReportingImplementation::statesReply(VelkReporting::StatesCallback callback) {
+  const SharedCallback<const std::optional<PropertyArray>&> shared(_runtime, std::move(callback));
+  return [self = weak_from_this(), shared](const std::optional<PropertyArray>& enabled,
+                                           const std::optional<PropertyArray>& whitelist,
+                                           const std::optional<PropertyArray>& blacklist) {
+    if (const auto strong = self.lock()) {
+      strong->_queue->async([lists = strong->_lists, enabled, whitelist, blacklist] {
+        lists->replace(std::make_shared<const EventLists>(enabled, whitelist, blacklist));
+        log::standard(texts::kCachedLists, enabled ? enabled->size() : 0, whitelist, blacklist);
+      });
+    }
+    shared(enabled);
+  };
+}
+
+void VelkReportingImplementation::startConfiguration(VelkReporting::StatesCallback completionHandler) {
+  const auto connection = _link->connect();
+  _link->description().isConfigured = true;
+  if (!connection) {
+    log::standard(texts::kStartConfigurationProxyFailure, noDaemon());
+    SharedCallback<const std::optional<PropertyArray>&>(_runtime,
+                                                        std::move(completionHandler))(std::optional<PropertyArray>());
+    return;
+  }
+  const SharedCallback<const std::optional<PropertyArray>&> onError(_runtime, completionHandler);
+  SessionInterfaceProxy(connection, [onError](const Error& error) {
+    log::standard(texts::kStartConfigurationProxyFailure, error);
+    onError(std::optional<PropertyArray>());
+  }).startConfigWithCompletionHandler(statesReply(std::move(completionHandler)));
+  fetchDisplayURL(connection);
+}
+
+void VelkReportingImplementation::fetchDisplayURL(const std::shared_ptr<Connection>& connection) {
+  SessionInterfaceProxy(connection, loggingHandler(texts::kStartConfigurationProxyFailure))
+      .fetchDisplayURL([self = weak_from_this()](const std::optional<std::string>& url) {
+        const auto strong = self.lock();
+        if (!strong || !url) return;
+        strong->logText(*url == texts::kUrlNotAvailable ? *url : formatText(texts::kUrlForTheSession, {*url}));
+      });
+}
+
+void VelkReportingImplementation::fetchReportingStates(const std::optional<PropertyDictionary>& userInfo,
+                                                       VelkReporting::StatesCallback fetchComplete) {
+  const auto connection = _link->connect();
+  if (userInfo) _link->description().userInfo = userInfo;
+  const SharedCallback<const std::optional<PropertyArray>&> onError(_runtime, fetchComplete);
+  const auto failed = [onError](const Error& error) {
+    log::standard(texts::kFetchStatesProxyFailure, error);
+    onError(std::optional<PropertyArray>());
+  };
+  if (!connection) return failed(noDaemon());
+  SessionInterfaceProxy(connection, failed).fetchStatesWithUserInfo(userInfo, statesReply(std::move(fetchComplete)));
+}
+
+void VelkReportingImplementation::flush(VelkReporting::FlushCallback completion) {
+  const SharedCallback<const std::optional<Error>&> shared(_runtime, std::move(completion));
+  const auto failed = [shared](const Error& error) {
+    log::standard(texts::kFlushProxyFailure, error);
+    shared(std::optional<Error>(error));
+  };
+  const auto connection = _link->connect();
+  if (!connection) return failed(noDaemon());
+  SessionInterfaceProxy(connection, failed)
+      .flushMessagesWithCompletion(
+          [self = weak_from_this(), shared](const std::optional<std::string>& text, const std::optional<Error>& error) {
+            if (error) {
+              log::standard(texts::kFlushFailed, *error);
+            } else {
+              log::standard(texts::kFlushedSuccessfully, text);
+              if (const auto strong = self.lock(); strong && text) strong->logText(*text);
+            }
+            shared(error);
+          });
+}
+
+void VelkReportingImplementation::updateSharedDataWithDictionary(const PropertyDictionary& dictionary) {
+  const auto failed = loggingHandler(texts::kUpdateSharedDataWithDictionaryProxyFailure);
+  const auto connection = _link->connect();
+  if (!connection) return failed(noDaemon());
+  SessionInterfaceProxy(connection, failed).updateSharedDataWithDictionary(dictionary);
+}
+
+void VelkReportingImplementation::updateSharedDataForKey(const std::string& key,
+                                                         const std::optional<PropertyValue>& value) {
+  const auto failed = loggingHandler(texts::kUpdateSharedDataForKeyProxyFailure);
+  const auto connection = _link->connect();
+  if (!connection) return failed(noDaemon());
+  SessionInterfaceProxy(connection, failed).updateSharedDataForKey(key, value);
+}
+
+void VelkReportingImplementation::setDigestKey(const ByteData& key, std::int32_t algorithm) {
+  // The text of another operation, shared with it.
+  const auto failed = loggingHandler(texts::kUploadDataArrayProxyFailure);
+  const auto connection = _link->connect();
+  _link->description().digestKey = key;
+  _link->description().digestAlgorithm = algorithm;
+  if (!connection) return failed(noDaemon());
+  SessionInterfaceProxy(connection, failed).setDigestKey(key, algorithm);
+}
+
+void VelkReportingImplementation::uploadFile(const std::string& url, FileDescriptor file,
+                                             VelkReporting::UploadCallback completionHandler) {
+  const auto failed = loggingHandler(texts::kUploadFileProxyFailure);
+  const auto connection = _link->connect();
+  if (!connection) return failed(noDaemon());
+  const SharedCallback<bool, const std::optional<Error>&> shared(_runtime, std::move(completionHandler));
+  SessionInterfaceProxy(connection, failed)
+      .uploadFileAtPath(url, randomUuidText(), std::move(file),
+                        [shared](bool uploaded) { shared(uploaded, std::optional<Error>()); });
+}
+
+void VelkReportingImplementation::uploadLogData(const PropertyArray& logData,
+                                                VelkReporting::UploadCallback completionHandler) {
+  const auto failed = loggingHandler(texts::kUploadDataArrayProxyFailure);
+  const auto connection = _link->connect();
+  if (!connection) return failed(noDaemon());
+  const SharedCallback<bool, const std::optional<Error>&> shared(_runtime, std::move(completionHandler));
+  SessionInterfaceProxy(connection, failed)
+      .uploadLogData(logData, [shared](bool uploaded, const std::optional<Error>& error) { shared(uploaded, error); });
+}
+
+}  // namespace velk

@@ -1,0 +1,79 @@
+// The fixed lines of the library, used by its code and its tests.
+#pragma once
+
+#include <string_view>
+
+namespace velk::texts {
+
+// Creation
+inline constexpr std::string_view kSessionInfoIsNil = "validateSessionInfo: sessionInfo is nil";
+inline constexpr std::string_view kClientTypeIsInvalid = "validateSessionInfo: clientType is invalid";
+inline constexpr std::string_view kClientStartsLogging = "startLogging: Client starts logging...";
+inline constexpr std::string_view kSessionDisabled = "initWithSessionInfo: the session is disabled";
+inline constexpr std::string_view kNotEntitled = "initWithSessionInfo: IPC not entitled, %d";
+inline constexpr std::string_view kFailedToConnect = "initWithSessionInfo: Failed to connect to daemon";
+inline constexpr std::string_view kFailedToCreateQueue = "initWithSessionInfo: Failed to create reporting queue";
+inline constexpr std::string_view kConnectionInvalidated = "initWithSessionInfo: IPC connection invalidated";
+inline constexpr std::string_view kConnectionInterrupted = "initWithSessionInfo: IPC connection interrupted";
+
+// Proxy failures, one an operation. setDigestKey shares the text of uploadDataArray.
+inline constexpr std::string_view kInitProxyFailure = "initWithSessionInfo: Failed to get remote object proxy: %s";
+inline constexpr std::string_view kStartConfigurationProxyFailure =
+    "startConfigurationWithCompletionHandler: Failed to get remote object proxy: %s";
+inline constexpr std::string_view kFetchStatesProxyFailure =
+    "fetchReportingStatesWithUserInfo: Failed to get remote object proxy: %s";
+inline constexpr std::string_view kSendMessageProxyFailure =
+    "sendMessageWithDictionary: Failed to get remote object proxy: %s";
+inline constexpr std::string_view kFlushProxyFailure =
+    "flushMessagesWithCompletion: Failed to get remote object proxy: %s";
+inline constexpr std::string_view kFinishSessionProxyFailure = "finishSession: Failed to get remote object proxy: %s";
+inline constexpr std::string_view kUpdateSharedDataWithDictionaryProxyFailure =
+    "updateSharedDataWithDictionary: Failed to get remote object proxy: %s";
+inline constexpr std::string_view kUpdateSharedDataForKeyProxyFailure =
+    "updateSharedDataForKey: Failed to get remote object proxy: %s";
+inline constexpr std::string_view kUploadFileProxyFailure = "uploadFileWithURL: Failed to get remote object proxy: %s";
+inline constexpr std::string_view kUploadDataArrayProxyFailure =
+    "uploadDataArray: Failed to get remote object proxy: %s";
+
+// Configuration and sending
+inline constexpr std::string_view kCachedLists = "Cached %d enabled backends, (%@, %@) listed events";
+inline constexpr std::string_view kUrlForTheSession = "URL for the session is: %@";
+inline constexpr std::string_view kUrlNotAvailable = "URL not available";
+inline constexpr std::string_view kMissingCategory = "Missing mandatory parameter 'category'";
+inline constexpr std::string_view kMissingType = "Missing mandatory parameter 'type'";
+inline constexpr std::string_view kSentMessage = "sendMessageWithDictionary: %s";
+inline constexpr std::string_view kEventIsFiltered = "Event %u is filtered by storebag";
+inline constexpr std::string_view kDelegateIsSet = "Message Sent Delegate is set to %x:";
+inline constexpr std::string_view kDelegateReads = "Message Sent Delegate reads %x:";
+inline constexpr std::string_view kLoggingBlockSet = "setMessageLoggingBlock: called";
+inline constexpr std::string_view kNotifyCalled = "notifyMessageWasSent: called";
+inline constexpr std::string_view kFlushMessages = "flushMessages:";
+inline constexpr std::string_view kFlushedSuccessfully =
+    "flushMessagesWithCompletion: flushed session successfully with reply %s";
+inline constexpr std::string_view kFlushFailed = "flushMessagesWithCompletion: flush failed with error '%s'";
+inline constexpr std::string_view kDigestKeyIsNil = "setDigestKey: digestKey should not be nil!!!";
+
+// Uploads
+inline constexpr std::string_view kServerSupportsFileUpload = "serverSupportsFileUpload:%s (%lu backends)";
+inline constexpr std::string_view kFileUrlIsNil = "uploadFileWithURL: fileURL provided is nil";
+inline constexpr std::string_view kNoExtension =
+    "uploadFileWithURL: Failed to get sandbox extension for path %s, errno %d";
+inline constexpr std::string_view kLogDataArrayIsEmpty = "uploadDataArray: Log data array is empty";
+
+// Aggregation and the end
+inline constexpr std::string_view kSendMessageToClient = "sendMessageToClient: %u, %u";
+inline constexpr std::string_view kAggregationBlockThrew =
+    "sendMessageToClient: Exception during invocation of aggregation block. Disabling aggregation";
+inline constexpr std::string_view kAboutToDealloc =
+    "aboutToDealloc: VelkReporting client session %p is about to dealloc";
+
+// One-shot messages
+inline constexpr std::string_view kOneMessageFailedToConnect =
+    "sendOneMessageWithSessionInfo: Failed to connect to daemon";
+inline constexpr std::string_view kOneMessageNoProxy =
+    "sendOneMessageWithSessionInfo: Failed to get remote object proxy";
+inline constexpr std::string_view kOneMessageInvalidated = "sendOneMessageWithSessionInfo: IPC connection invalidated";
+inline constexpr std::string_view kOneMessageInterrupted = "sendOneMessageWithSessionInfo: IPC connection interrupted";
+inline constexpr std::string_view kOneMessageReply = "sendOneMessageWithSessionInfo: %s";
+
+}  // namespace velk::texts

@@ -1,0 +1,86 @@
+// A client's link to its session in the daemon: connects at first use, and again after the daemon went away. To each
+// connection the session is described with all that has been said of it so far: its description with the latest user
+// info, the digest key, and its configuration if it was asked for, even while no daemon was there to hear of it. Other
+// calls that were already written are not made again.
+//
+// All methods run on the client's reporting queue, except where they say otherwise. Owned by the implementation.
+#pragma once
+
+#include <chrono>
+#include <functional>
+#include <memory>
+#include <optional>
+#include <string>
+
+#include "foundation/PropertyValue.h"
+#include "ipc/Connection.h"
+#include "ipc/SessionProxies.h"
+#include "platform/Clock.h"
+#include "platform/Lock.h"
+
+namespace velk {
+
+class ClientRuntime;
+class CurrentEventLists;
+
+/// What the daemon must know of a session, in the order in which it is told.
+struct SessionDescription {
+  PropertyDictionary sessionInfo;
+  std::optional<PropertyDictionary> userInfo;
+  PropertyArray frameworksToCheck;
+  bool hasAggregationBlock = false;
+
+  bool isConfigured = false;
+  std::optional<ByteData> digestKey;
+  std::int32_t digestAlgorithm = 0;
+};
+
+class SessionLink : public std::enable_shared_from_this<SessionLink> {
+ public:
+  /// `lists` and `exported` are shared with the connections made here.
+  SessionLink(ClientRuntime& runtime, std::shared_ptr<Queue> queue, SessionDescription description,
+              std::shared_ptr<ClientSessionReplyInterface> exported, std::shared_ptr<CurrentEventLists> lists);
+
+  /// The first connection, made on the creator's thread before anything is on the queue. Fine when nobody answers.
+  /// `whenInterrupted` runs on the queue, each time.
+  void open(std::function<void()> whenInterrupted);
+
+  /// A connection that works, made now if need be; null when nobody answers. After a failed attempt the next one is
+  /// made at the earliest after a pause that grows from 100 ms to 10 s.
+  [[nodiscard]] std::shared_ptr<Connection> connect();
+
+  /// The connection as it is, or null. Any thread.
+  [[nodiscard]] std::shared_ptr<Connection> current() const;
+
+  /// For the description after the next reconnection.
+  [[nodiscard]] SessionDescription& description() { return _description; }
+
+  /// How long until `connect` would try again.
+  [[nodiscard]] Duration pauseLeft() const;
+
+  /// Says goodbye behind what was sent. No connection is made any more.
+  void close();
+
+ private:
+  [[nodiscard]] std::shared_ptr<Connection> makeConnection();
+  void describeSession(const std::shared_ptr<Connection>& connection);
+  void wasInterrupted(const std::weak_ptr<Connection>& connection);
+  void setCurrent(std::shared_ptr<Connection> connection);
+
+  ClientRuntime& _runtime;
+  const std::shared_ptr<Queue> _queue;
+  const std::shared_ptr<ClientSessionReplyInterface> _exported;
+  const std::shared_ptr<CurrentEventLists> _lists;
+
+  mutable Lock _lock;
+  std::shared_ptr<Connection> _connection VELK_GUARDED_BY(_lock);
+
+  // On the reporting queue (and in `open`, before it has work).
+  SessionDescription _description;
+  std::function<void()> _whenInterrupted;
+  bool _isClosed = false;
+  SteadyTime _nextAttempt{};
+  Duration _pause{};
+};
+
+}  // namespace velk

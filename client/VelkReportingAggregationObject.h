@@ -1,0 +1,36 @@
+// What a client exports to the daemon: it is handed the events of the sessions below its own.
+#pragma once
+
+#include <memory>
+
+#include "client/VelkReporting.h"
+#include "ipc/SessionInterface.h"
+#include "platform/Lock.h"
+#include "platform/Queue.h"
+
+namespace velk {
+
+/// Called on the library's thread; runs the client's block, if there is one, on `callbackQueue`, in order. A block
+/// that throws is released and never called again. Lives as long as its connection.
+class VelkReportingAggregationObject : public ClientSessionReplyInterface,
+                                       public std::enable_shared_from_this<VelkReportingAggregationObject> {
+ public:
+  VelkReportingAggregationObject(VelkReportingAggregationBlock aggregationBlock, std::shared_ptr<Queue> callbackQueue);
+
+  void sendMessageToClient(std::optional<PropertyDictionary> sessionInfo, double timestamp, std::uint16_t category,
+                           std::uint16_t type, std::optional<PropertyDictionary> payload) override;
+
+  [[nodiscard]] bool hasAggregationBlock() const;
+  /// The client is going: its block is not called any more, but for a call that has begun.
+  void releaseAggregationBlock();
+
+ private:
+  using SharedBlock = std::shared_ptr<const VelkReportingAggregationBlock>;
+  [[nodiscard]] SharedBlock block() const;
+
+  const std::shared_ptr<Queue> _callbackQueue;
+  mutable Lock _lock;
+  SharedBlock _aggregationBlock VELK_GUARDED_BY(_lock);
+};
+
+}  // namespace velk

@@ -1,0 +1,248 @@
+#include "client/VelkReportingImplementation.h"
+
+#include "client/DaemonConnection.h"
+#include "client/LogTexts.h"
+#include "ipc/MethodTable.h"
+#include "ipc/Vocabulary.h"
+#include "platform/Log.h"
+#include "platform/Semaphore.h"
+
+namespace velk {
+
+namespace {
+
+/// How long the last release waits for queued events to leave.
+constexpr Duration kEndOfLifeBound = std::chrono::seconds(1);
+/// How soon a connection that was full is tried again.
+constexpr Duration kFullConnectionPause = std::chrono::milliseconds(2);
+/// While events come more often than this, they are taken together: each wake-up of the library's thread costs more
+/// than the sending of several events. No event waits longer for it.
+constexpr Duration kLinger = std::chrono::milliseconds(1);
+
+}  // namespace
+
+VelkReportingImplementation::VelkReportingImplementation(ClientRuntime& runtime, SessionDescription description,
+                                                         VelkReportingAggregationBlock aggregationBlock)
+    : _runtime(runtime),
+      _queue(runtime.loop().makeLoopQueue("com.tavrin.VelkReporting.main")),
+      _orderedCallbacks(runtime.makeCallbackQueue("com.tavrin.VelkReporting.callbacks")),
+      _lists(std::make_shared<CurrentEventLists>()),
+      _aggregation(std::make_shared<VelkReportingAggregationObject>(std::move(aggregationBlock), _orderedCallbacks)),
+      _mayLinger(booleanValue(description.sessionInfo.find(kVelkReportingSessionInfoBatchEvent))) {
+  description.hasAggregationBlock = _aggregation->hasAggregationBlock();
+  _link = std::make_shared<SessionLink>(runtime, _queue, std::move(description), _aggregation, _lists);
+}
+
+void VelkReportingImplementation::open() {
+  _link->open([self = weak_from_this()] {
+    if (const auto strong = self.lock()) strong->wasInterrupted();
+  });
+}
+
+bool VelkReportingImplementation::enqueueEvent(const PropertyDictionary& message) {
+  const std::size_t size = estimatedSize(message);
+  if (!_outbox.reserve(size)) return false;
+  const IncomingEvents::Ticket ticket = _incoming.add(message, size);
+  if (ticket != 0) _queue->async([self = shared_from_this(), ticket] { self->takeIncoming(ticket); });
+  return true;
+}
+
+void VelkReportingImplementation::takeIncoming(IncomingEvents::Ticket ticket) {
+  const SteadyTime now = _runtime.loop().clock().steadyTime();
+  const bool lingers = _mayLinger && now - _lastTaken < 2 * kLinger;
+  auto events = _incoming.take(ticket, lingers);
+  if (events.empty()) return;
+  _lastTaken = now;
+  if (lingers) _queue->asyncAfter(kLinger, [self = shared_from_this(), ticket] { self->takeIncoming(ticket); });
+  sendEvents(std::move(events));
+}
+
+void VelkReportingImplementation::sendEvents(std::vector<IncomingEvents::Event> events) {
+  for (auto& event : events) {
+    if (_outbox.held.empty() && trySending(event.message)) {
+      _outbox.release(event.size);
+      continue;
+    }
+    _outbox.held.push_back({std::move(event.message), event.size, nullptr});
+    retryLater(std::max(_link->pauseLeft(), kFullConnectionPause));
+  }
+  if (!events.empty() && _outbox.held.empty()) reportOverflow();
+}
+
+bool VelkReportingImplementation::trySending(const PropertyDictionary& message) {
+  const auto connection = _link->connect();
+  if (!connection) return false;
+  // Nobody looks at the reply unless it is logged, and asking for none saves both ends most of its cost.
+  const bool wantsReply = _loggingBlock != nullptr || log::isEnabled(log::Level::standard);
+  ReplyHandler handler;
+  if (wantsReply) {
+    handler = [self = weak_from_this()](Result<PropertyArray> reply) {
+      if (!reply) return log::standard(texts::kSendMessageProxyFailure, reply.error());
+      const std::string* text = reply->empty() ? nullptr : (*reply)[0].string();
+      log::standard(texts::kSentMessage, text);
+      if (const auto strong = self.lock(); strong && text != nullptr) strong->logText(*text);
+    };
+  }
+  const auto encode = [&message](CborWriter& writer) { writer.value(message); };
+  const auto method = static_cast<std::uint32_t>(Method::sendMessageWithDictionary);
+  const auto sent =
+      wantsReply ? connection->call(method, 1, encode, std::move(handler)) : connection->send(method, 1, encode);
+  if (sent) return true;
+  const auto code = static_cast<ConnectionError>(sent.error().code);
+  if (code == ConnectionError::outboxFull || code == ConnectionError::ended) return false;
+  log::standard(texts::kSendMessageProxyFailure, sent.error());  // it can never be sent
+  return true;
+}
+
+void VelkReportingImplementation::sendWhatFits() {
+  auto& held = _outbox.held;
+  while (!held.empty()) {
+    auto& first = held.front();
+    if (first.call) {
+      first.call();
+    } else if (trySending(first.message)) {
+      _outbox.release(first.size);
+    } else {
+      return;
+    }
+    held.pop_front();
+  }
+}
+
+void VelkReportingImplementation::runBehindHeldEvents(Task call) {
+  if (!_outbox.held.empty()) sendHeldEvents();
+  // With nobody there it fails at once, as it would without events; and what waits is bounded.
+  const auto& held = _outbox.held;
+  if (held.empty() || held.size() >= EventOutbox::kMaximumEvents || !_link->connect()) return call();
+  _outbox.held.push_back({{}, 0, std::move(call)});
+}
+
+void VelkReportingImplementation::sendHeldEvents() {
+  sendWhatFits();
+  if (_outbox.held.empty()) return reportOverflow();
+  retryLater(std::max(_link->pauseLeft(), kFullConnectionPause));
+}
+
+void VelkReportingImplementation::retryLater(Duration delay) {
+  if (std::exchange(_retryIsPending, true)) return;
+  _queue->asyncAfter(delay, [self = weak_from_this()] {
+    const auto strong = self.lock();
+    if (!strong) return;
+    strong->_retryIsPending = false;
+    if (!strong->_isFinished) strong->sendHeldEvents();
+  });
+}
+
+void VelkReportingImplementation::reportOverflow() {
+  const std::size_t lost = _outbox.takeOverflowCount();
+  if (lost != 0)
+    log::error("sendMessageWithDictionary: %u events were refused while the daemon was away or slow", lost);
+}
+
+void VelkReportingImplementation::wasInterrupted() {
+  if (!_outbox.held.empty()) retryLater(kFullConnectionPause);
+}
+
+void VelkReportingImplementation::finishSession() {
+  if (const auto connection = _link->current()) {
+    SessionInterfaceProxy(connection, loggingHandler(texts::kFinishSessionProxyFailure)).finishSessionGracefully();
+  } else {
+    log::standard(texts::kFinishSessionProxyFailure, "no daemon answers");
+  }
+}
+
+void VelkReportingImplementation::endOfLife(const void* client) {
+  const Clock& clock = _runtime.loop().clock();
+  const SteadyTime deadline = clock.steadyTime() + kEndOfLifeBound;
+  const bool mayWait = !_runtime.loop().isCurrent();
+  if (mayWait) sendHeldEventsWithin(deadline);
+  auto done = std::make_shared<Semaphore>();
+  onQueue([client, done](VelkReportingImplementation& self) {
+    self.finishAndClose(client);
+    done->signal();
+  });
+  if (!mayWait || !done->waitFor(deadline - clock.steadyTime())) return;
+  const auto connection = _link->current();
+  const Duration left = deadline - clock.steadyTime();
+  if (connection && left > Duration::zero()) static_cast<void>(connection->waitUntilSent(left));
+}
+
+/// Off the queue: makes room in the connection, again and again, for what did not fit into it.
+void VelkReportingImplementation::sendHeldEventsWithin(SteadyTime deadline) {
+  const Clock& clock = _runtime.loop().clock();
+  for (;;) {
+    auto turn = std::make_shared<Semaphore>();
+    auto isLeft = std::make_shared<std::atomic<bool>>(false);
+    onQueue([turn, isLeft](VelkReportingImplementation& self) {
+      self.sendHeldEvents();
+      *isLeft = !self._outbox.held.empty();
+      turn->signal();
+    });
+    if (!turn->waitFor(deadline - clock.steadyTime()) || !*isLeft) return;
+    const auto connection = _link->current();
+    if (!connection || connection->hasEnded()) return;
+    if (!connection->waitUntilSent(deadline - clock.steadyTime())) return;
+  }
+}
+
+void VelkReportingImplementation::finishAndClose(const void* client) {
+  _isFinished = true;
+  sendWhatFits();
+  std::size_t lost = 0;
+  for (auto& waiting : _outbox.held) {
+    if (waiting.call) {
+      waiting.call();  // its callback learns that it failed
+    } else {
+      ++lost;
+    }
+  }
+  _outbox.held.clear();
+  if (lost != 0) log::error("aboutToDealloc: %u events are lost: no daemon takes them", lost);
+  reportOverflow();
+  log::standard(texts::kAboutToDealloc, client);
+  finishSession();
+  _aggregation->releaseAggregationBlock();
+  replaceLoggingBlock(nullptr);
+  _link->close();
+}
+
+void VelkReportingImplementation::setMessageSentDelegate(std::weak_ptr<VelkReportingMessageSentDelegate> delegate) {
+  log::standard(texts::kDelegateIsSet, reinterpret_cast<std::uintptr_t>(delegate.lock().get()));
+  Guard guard(_lock);
+  _weakMessageSentDelegate.swap(delegate);
+}
+
+std::shared_ptr<VelkReportingMessageSentDelegate> VelkReportingImplementation::messageSentDelegate() const {
+  Guard guard(_lock);
+  return _weakMessageSentDelegate.lock();
+}
+
+void VelkReportingImplementation::notifyMessageWasSent(std::weak_ptr<VelkReporting> client,
+                                                       const PropertyDictionary& message) {
+  onQueue([client = std::move(client), message](VelkReportingImplementation& self) {
+    auto delegate = self.messageSentDelegate();
+    if (!delegate) return;
+    log::standard(texts::kNotifyCalled);
+    self._orderedCallbacks->async([client, message, delegate = std::move(delegate)] {
+      if (const auto strong = client.lock()) delegate->didSendMessageForReportingClient(strong, message);
+    });
+  });
+}
+
+void VelkReportingImplementation::logText(const std::string& text) {
+  if (!_loggingBlock) return;
+  _orderedCallbacks->async([block = _loggingBlock, text] { (*block)(text); });
+}
+
+void VelkReportingImplementation::setMessageLoggingBlock(VelkReporting::LoggingBlock block) {
+  log::standard(texts::kLoggingBlockSet);
+  replaceLoggingBlock(block ? std::make_shared<const VelkReporting::LoggingBlock>(std::move(block)) : nullptr);
+}
+
+void VelkReportingImplementation::replaceLoggingBlock(SharedLoggingBlock block) {
+  // What the old one owns may wait for this thread when it ends: it ends where callbacks run.
+  if (_loggingBlock) _orderedCallbacks->async([old = std::move(_loggingBlock)] {});
+  _loggingBlock = std::move(block);
+}
+
+}  // namespace velk

@@ -1,0 +1,133 @@
+// What stands behind a client object. Queued work owns it, so it outlives the object's last reference until that work
+// is done; it joins no thread and waits for nothing that its own thread has to do.
+//
+// Bound to the reporting queue ("com.tavrin.VelkReporting.main", on the library's thread) unless a method says
+// otherwise.
+#pragma once
+
+#include <atomic>
+#include <cstdint>
+#include <memory>
+#include <optional>
+#include <string>
+
+#include "client/ClientRuntime.h"
+#include "client/EventLists.h"
+#include "client/EventOutbox.h"
+#include "client/IncomingEvents.h"
+#include "client/SessionLink.h"
+#include "client/VelkReporting.h"
+#include "client/VelkReportingAggregationObject.h"
+
+namespace velk {
+
+class VelkReportingImplementation : public std::enable_shared_from_this<VelkReportingImplementation> {
+ public:
+  /// Codes of errors that only the library makes.
+  static constexpr int kOutboxFull = 8;
+  static constexpr int kForkedChild = 9;
+
+  VelkReportingImplementation(ClientRuntime& runtime, SessionDescription description,
+                              VelkReportingAggregationBlock aggregationBlock);
+  /// Connects; on the creator's thread, once, before anything else.
+  void open();
+
+  // Any thread.
+
+  /// In a forked child every operation does nothing.
+  [[nodiscard]] bool isForeign() const noexcept { return _forkGuard.forked(); }
+  [[nodiscard]] const CurrentEventLists& lists() const { return *_lists; }
+  /// Queues work on the reporting queue, behind the events handed over so far; it owns this object until it has run.
+  template <class Work>
+  void onQueue(Work work) {
+    auto before = _incoming.takeForWork();
+    _queue->async([self = shared_from_this(), before = std::move(before), work = std::move(work)]() mutable {
+      self->sendEvents(std::move(before));
+      work(*self);
+    });
+  }
+  /// The same for a call to the daemon: it stays behind the events that were handed over before it.
+  template <class Work>
+  void callInOrder(Work work) {
+    onQueue([work = std::move(work)](VelkReportingImplementation& self) mutable {
+      self.runBehindHeldEvents([&self, work = std::move(work)]() mutable { work(self); });
+    });
+  }
+  /// Queues an event. False when the outbox is full.
+  [[nodiscard]] bool enqueueEvent(const PropertyDictionary& message);
+  /// Directly over the connection, past everything that is queued.
+  void finishSession();
+  /// The end: what was queued is sent, the session finished, the connection closed. Waits for that within a bound,
+  /// unless it runs on the library's own thread.
+  void endOfLife(const void* client);
+
+  /// From here on messages are brought to the queue, which knows the delegate.
+  void expectMessageSentDelegate() noexcept { _mayHaveDelegate.store(true, std::memory_order_relaxed); }
+  [[nodiscard]] bool mayHaveMessageSentDelegate() const noexcept {
+    return _mayHaveDelegate.load(std::memory_order_relaxed);
+  }
+  [[nodiscard]] std::shared_ptr<VelkReportingMessageSentDelegate> messageSentDelegate() const;
+  /// Tells the delegate of a message, in order, on a thread for callbacks.
+  void notifyMessageWasSent(std::weak_ptr<VelkReporting> client, const PropertyDictionary& message);
+
+  // On the reporting queue.
+
+  void setMessageSentDelegate(std::weak_ptr<VelkReportingMessageSentDelegate> delegate);
+  void startConfiguration(VelkReporting::StatesCallback completionHandler);
+  void fetchReportingStates(const std::optional<PropertyDictionary>& userInfo,
+                            VelkReporting::StatesCallback fetchComplete);
+  void flush(VelkReporting::FlushCallback completion);
+  void updateSharedDataWithDictionary(const PropertyDictionary& dictionary);
+  void updateSharedDataForKey(const std::string& key, const std::optional<PropertyValue>& value);
+  void setDigestKey(const ByteData& key, std::int32_t algorithm);
+  void setMessageLoggingBlock(VelkReporting::LoggingBlock block);
+  void uploadFile(const std::string& url, FileDescriptor file, VelkReporting::UploadCallback completionHandler);
+  void uploadLogData(const PropertyArray& logData, VelkReporting::UploadCallback completionHandler);
+
+ private:
+  using SharedLoggingBlock = std::shared_ptr<const VelkReporting::LoggingBlock>;
+
+  void takeIncoming(IncomingEvents::Ticket ticket);
+  void sendEvents(std::vector<IncomingEvents::Event> events);
+  /// False when it has to wait.
+  [[nodiscard]] bool trySending(const PropertyDictionary& message);
+  void sendHeldEvents();
+  void sendWhatFits();
+  void runBehindHeldEvents(Task call);
+  void sendHeldEventsWithin(SteadyTime deadline);
+  void retryLater(Duration delay);
+  void reportOverflow();
+  void wasInterrupted();
+  void finishAndClose(const void* client);
+  void fetchDisplayURL(const std::shared_ptr<Connection>& connection);
+  void logText(const std::string& text);
+  void replaceLoggingBlock(SharedLoggingBlock block);
+  [[nodiscard]] ConfigurationReply statesReply(VelkReporting::StatesCallback callback);
+
+  // Constant after construction.
+  ClientRuntime& _runtime;
+  const ForkGuard _forkGuard;
+  const std::shared_ptr<Queue> _queue;
+  const std::shared_ptr<Queue> _orderedCallbacks;
+  const std::shared_ptr<CurrentEventLists> _lists;
+  const std::shared_ptr<VelkReportingAggregationObject> _aggregation;
+  std::shared_ptr<SessionLink> _link;
+  /// Events are batched on their way anyway, so a moment more or less is nothing to them.
+  const bool _mayLinger;
+
+  // Self-synchronised.
+  EventOutbox _outbox;
+  IncomingEvents _incoming;
+  std::atomic<bool> _mayHaveDelegate{false};  ///< once true it stays so
+
+  mutable Lock _lock;
+  std::weak_ptr<VelkReportingMessageSentDelegate> _weakMessageSentDelegate VELK_GUARDED_BY(_lock);
+
+  // On the reporting queue.
+  SharedLoggingBlock _loggingBlock;
+  bool _retryIsPending = false;
+  SteadyTime _lastTaken{};
+  bool _isFinished = false;
+};
+
+}  // namespace velk
