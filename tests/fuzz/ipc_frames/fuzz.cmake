@@ -1,0 +1,1 @@
+velk_fuzz(ipc_frames LINKS velk_ipc)

@@ -1,0 +1,1 @@
+velk_fuzz(json LINKS velk_foundation)

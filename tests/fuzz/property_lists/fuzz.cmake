@@ -1,0 +1,1 @@
+velk_fuzz(property_lists LINKS velk_platform)

@@ -1,0 +1,98 @@
+#include "backends/EventBatch.h"
+
+#include <gtest/gtest.h>
+
+#include "backends/MemoryEstimate.h"
+
+namespace velk::test {
+namespace {
+
+int countsUntilReached(EventBatch& batch, const PropertyValue* method, std::int32_t threshold) {
+  for (int counted = 1; counted < 1000; ++counted) {
+    if (batch.countReaches(method, threshold)) return counted;
+  }
+  return -1;
+}
+
+TEST(EventBatch, ExistsFromCreationToTaking) {
+  EventBatch batch;
+  EXPECT_FALSE(batch.exists());
+  batch.create();
+  EXPECT_TRUE(batch.exists());
+  batch.append({{"a", 1}});
+  EXPECT_EQ(batch.take().size(), 1U);
+  EXPECT_FALSE(batch.exists());
+  EXPECT_TRUE(batch.take().empty());
+}
+
+TEST(EventBatch, CountsEachMethodByItself) {
+  EventBatch batch;
+  const PropertyValue first(1);
+  const PropertyValue second(2);
+  EXPECT_FALSE(batch.countReaches(&second, 3));
+  EXPECT_EQ(countsUntilReached(batch, &first, 3), 5);
+  EXPECT_EQ(countsUntilReached(batch, &second, 3), 4);
+  // The event that reached the threshold counted as the first of the next round.
+  EXPECT_EQ(countsUntilReached(batch, &first, 3), 4);
+}
+
+TEST(EventBatch, CountsAnyKindOfMethod) {
+  EventBatch batch;
+  for (const PropertyValue& method : {PropertyValue("seven"), PropertyValue(1.5), PropertyValue(PropertyArray{})}) {
+    EXPECT_EQ(countsUntilReached(batch, &method, 3), 5);
+  }
+  EXPECT_EQ(countsUntilReached(batch, nullptr, 3), 5);
+}
+
+TEST(EventBatch, ReachesAtOnceBelowAZeroThreshold) {
+  EventBatch batch;
+  EXPECT_TRUE(batch.countReaches(nullptr, -1));
+  EXPECT_TRUE(batch.countReaches(nullptr, -5));
+}
+
+TEST(EventBatch, CountsAFixedNumberOfMethods) {
+  EventBatch batch;
+  for (std::size_t method = 0; method < EventBatch::kMaximumCounters; ++method) {
+    const PropertyValue key(method);
+    EXPECT_FALSE(batch.countReaches(&key, 0));
+  }
+  const PropertyValue known(5);
+  const PropertyValue surplus(EventBatch::kMaximumCounters + 5);
+  EXPECT_TRUE(batch.countReaches(&known, 0));
+  EXPECT_EQ(countsUntilReached(batch, &surplus, 0), -1);
+  batch.clearCounters();
+  EXPECT_EQ(countsUntilReached(batch, &surplus, 0), 2);
+}
+
+TEST(EventBatch, RefusesEventsWhenFull) {
+  EventBatch batch;
+  const PropertyDictionary large{{"text", std::string(10U * 1024 * 1024, 'x')}};
+  int kept = 0;
+  while (batch.append(large) == EventBatch::Appended::kept) ++kept;
+  EXPECT_GT(kept, 0);
+  EXPECT_LE(batch.estimatedSize(), EventBatch::kMaximumBytes);
+  EXPECT_EQ(batch.append(large), EventBatch::Appended::stillFull);
+  EXPECT_EQ(batch.append({{"small", 1}}), EventBatch::Appended::kept);
+  batch.discard();
+  EXPECT_EQ(batch.append(large), EventBatch::Appended::kept);
+}
+
+TEST(EventBatch, WritesASessionIDIntoEveryEvent) {
+  EventBatch batch;
+  batch.append({{"_sessionID", 5}});
+  batch.append({{"a", 1}});
+  batch.setSessionID("parent.child");
+  for (const auto& event : batch.take()) EXPECT_EQ(*event.string("_sessionID"), "parent.child");
+}
+
+TEST(EventBatch, EstimatesItsSize) {
+  EventBatch batch;
+  EXPECT_EQ(batch.estimatedSize(), 0U);
+  const PropertyDictionary event{{"a", "some text"}};
+  batch.append(event);
+  batch.append(event);
+  EXPECT_EQ(batch.estimatedSize(), 2U * memoryEstimate(event));
+}
+
+}  // namespace
+}  // namespace velk::test

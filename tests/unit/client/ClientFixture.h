@@ -1,0 +1,59 @@
+// A client object and the daemon that it talks to.
+#pragma once
+
+#include <gtest/gtest.h>
+
+#include <memory>
+#include <optional>
+#include <utility>
+
+#include "client/VelkReporting.h"
+#include "platform/Semaphore.h"
+#include "tests/support/RecordingLog.h"
+#include "tests/unit/client/FakeDaemon.h"
+
+namespace velk::test {
+
+inline constexpr Duration kPatience = std::chrono::seconds(30);
+
+inline PropertyDictionary sessionInfo(int clientType = 9) { return {{"ComponentType", clientType}, {"SessionID", 7}}; }
+inline PropertyDictionary userInfo() { return {{"_clientName", "Test"}, {"_serviceName", "unit"}}; }
+inline PropertyDictionary message(int category, int type = 1) {
+  return {{"ParametersCategory", category}, {"ParametersType", type}};
+}
+
+class VelkReportingTest : public ::testing::Test {
+ protected:
+  std::shared_ptr<VelkReporting> makeClient(VelkReportingAggregationBlock block = nullptr) {
+    return VelkReporting::initWithSessionInfo(sessionInfo(), userInfo(), {"framework"}, std::move(block));
+  }
+
+  /// Configures and waits for the callback; then for the lists, which are cached before the next call is answered.
+  std::optional<PropertyArray> configure(VelkReporting& client) {
+    auto states = std::make_shared<std::optional<PropertyArray>>();
+    auto answered = std::make_shared<Semaphore>();
+    client.startConfigurationWithCompletionHandler([states, answered](const std::optional<PropertyArray>& enabled) {
+      *states = enabled;
+      answered->signal();
+    });
+    EXPECT_TRUE(answered->waitFor(kPatience));
+    flush(client);
+    return *states;
+  }
+
+  std::optional<Error> flush(VelkReporting& client) {
+    auto result = std::make_shared<std::optional<Error>>();
+    auto answered = std::make_shared<Semaphore>();
+    client.flushMessagesWithCompletion([result, answered](const std::optional<Error>& error) {
+      *result = error;
+      answered->signal();
+    });
+    EXPECT_TRUE(answered->waitFor(kPatience));
+    return *result;
+  }
+
+  RecordingLog _log;
+  FakeDaemon _daemon;
+};
+
+}  // namespace velk::test

@@ -1,0 +1,63 @@
+#include "client/IncomingEvents.h"
+
+#include <gtest/gtest.h>
+
+#include "tests/unit/client/ClientFixture.h"
+
+namespace velk::test {
+namespace {
+
+PropertyDictionary event(int number) { return {{"number", number}}; }
+
+TEST(IncomingEvents, OnlyTheFirstNeedsATaker) {
+  IncomingEvents incoming;
+  const auto ticket = incoming.add(event(1), 1);
+  EXPECT_NE(ticket, 0U);
+  EXPECT_EQ(incoming.add(event(2), 1), 0U);
+  EXPECT_EQ(incoming.take(ticket, false).size(), 2U);
+  EXPECT_NE(incoming.add(event(3), 1), 0U);
+}
+
+TEST(IncomingEvents, LingeringTakerIsExpectedUntilItFindsNothing) {
+  IncomingEvents incoming;
+  const auto ticket = incoming.add(event(1), 1);
+  EXPECT_EQ(incoming.take(ticket, true).size(), 1U);
+  EXPECT_EQ(incoming.add(event(2), 1), 0U);
+  EXPECT_EQ(incoming.take(ticket, true).size(), 1U);
+  EXPECT_TRUE(incoming.take(ticket, true).empty());
+  EXPECT_NE(incoming.add(event(3), 1), 0U);
+}
+
+TEST(IncomingEvents, WorkTakesAlongWhatCameBeforeIt) {
+  IncomingEvents incoming;
+  const auto stale = incoming.add(event(1), 1);
+  EXPECT_EQ(incoming.takeForWork().size(), 1U);
+  const auto fresh = incoming.add(event(2), 1);
+  EXPECT_NE(fresh, 0U) << "the taker that was queued before the work must not overtake it";
+  EXPECT_TRUE(incoming.take(stale, true).empty());
+  EXPECT_EQ(incoming.take(fresh, false).size(), 1U);
+}
+
+class ClientOrder : public VelkReportingTest {};
+
+TEST_F(ClientOrder, HoldsBetweenEventsAndCallsHoweverDense) {
+  _daemon.start();
+  const auto client = VelkReporting::initWithSessionInfo(
+      PropertyDictionary{{"ComponentType", 9}, {"SessionID", 7}, {"BatchEvents", true}}, std::nullopt, {});
+  for (int number = 0; number < 200; ++number) {
+    client->sendMessageWithCategory(1, static_cast<std::uint16_t>(number));
+    if (number % 7 == 0) client->updateSharedDataForKey("after", PropertyValue(number));
+  }
+  ASSERT_TRUE(_daemon.waitForCalls("sendMessageWithDictionary", 200));
+  int next = 0;
+  for (const auto& call : _daemon.calls()) {
+    if (call.method == "sendMessageWithDictionary") {
+      EXPECT_EQ(integerValue(call.arguments[0].dictionary()->find("ParametersType")), next++);
+    } else if (call.method == "updateSharedDataForKey") {
+      EXPECT_EQ(integerValue(call.arguments[1]), next - 1);
+    }
+  }
+}
+
+}  // namespace
+}  // namespace velk::test

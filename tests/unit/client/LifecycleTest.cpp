@@ -1,0 +1,202 @@
+// Daemons that come, go and are slow; the last reference; forks.
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <atomic>
+#include <thread>
+
+#include "client/LogTexts.h"
+#include "tests/unit/client/ClientFixture.h"
+
+namespace velk::test {
+namespace {
+
+using LifecycleTest = VelkReportingTest;
+
+TEST_F(LifecycleTest, IsInertInAForkedChild) {
+  _daemon.start();
+  auto client = makeClient();
+  static_cast<void>(configure(*client));
+  const pid_t child = fork();
+  ASSERT_GE(child, 0);
+  if (child == 0) {
+    alarm(20);
+    Error error;
+    bool isInert = !client->sendMessageWithDictionary(message(1), &error) && error.code == 9;
+    isInert = isInert && client->isWhitelistedEvent(1) && !client->isBlacklistedEvent(1);
+    isInert = isInert && !client->serverSupportsFileUpload() && !client->messageSentDelegate();
+    client->finishSession();
+    client.reset();
+    _exit(isInert ? 0 : 1);
+  }
+  int status = -1;
+  ASSERT_EQ(waitpid(child, &status, 0), child);
+  EXPECT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) == 0);
+  EXPECT_TRUE(client->sendMessageWithDictionary(message(1)));
+  EXPECT_FALSE(flush(*client)) << "the parent's connection is whole";
+  EXPECT_EQ(_daemon.count("sendMessageWithDictionary"), 1U);
+  EXPECT_EQ(_daemon.count("finishSessionGracefully"), 0U);
+}
+
+TEST_F(LifecycleTest, UnreachableDaemonAnswersCallbacksWithNothing) {
+  const auto client = makeClient();
+  auto answered = std::make_shared<Semaphore>();
+  client->startConfigurationWithCompletionHandler([answered](const std::optional<PropertyArray>& enabled) {
+    EXPECT_FALSE(enabled);
+    answered->signal();
+  });
+  EXPECT_TRUE(answered->waitFor(kPatience));
+  EXPECT_TRUE(flush(*client));
+  EXPECT_TRUE(_log.contains("startConfigurationWithCompletionHandler: Failed to get remote object proxy: "));
+}
+
+TEST_F(LifecycleTest, LastReferenceSendsFinishesAndCloses) {
+  _daemon.start();
+  auto client = makeClient();
+  auto second = client;
+  for (int event = 0; event < 100; ++event) client->sendMessageWithCategory(1, 1);
+  client.reset();
+  EXPECT_EQ(_daemon.count("finishSessionGracefully"), 0U) << "a reference is left";
+  second.reset();
+  ASSERT_TRUE(_daemon.waitForCalls("finishSessionGracefully", 1));
+  EXPECT_TRUE(_daemon.waitForEnds(1));
+  EXPECT_EQ(_daemon.count("sendMessageWithDictionary"), 100U);
+  EXPECT_EQ(_daemon.calls().back().method, "finishSessionGracefully");
+  EXPECT_TRUE(_log.contains("is about to dealloc"));
+}
+
+TEST_F(LifecycleTest, FinishSessionOvertakesQueuedSends) {
+  _daemon.start();
+  const auto client = makeClient();
+  ASSERT_TRUE(_daemon.waitForCalls("setSessionInfo", 1));
+  // A callback of the queue's own keeps it busy until the session has been finished from here.
+  auto entered = std::make_shared<Semaphore>();
+  auto leave = std::make_shared<Semaphore>();
+  struct Blocking : log::Sink {
+    std::shared_ptr<Semaphore> entered, leave;
+    void write(log::Level, std::string_view line) override {
+      if (line != texts::kLoggingBlockSet) return;
+      entered->signal();
+      leave->wait();
+    }
+  };
+  auto sink = std::make_shared<Blocking>();
+  sink->entered = entered;
+  sink->leave = leave;
+  log::setSink(sink);
+  client->setMessageLoggingBlock(nullptr);
+  ASSERT_TRUE(entered->waitFor(kPatience));
+  client->sendMessageWithCategory(1, 1);
+  client->finishSession();
+  leave->signal();
+  ASSERT_TRUE(_daemon.waitForCalls("sendMessageWithDictionary", 1));
+  log::setSink(nullptr);
+  const auto calls = _daemon.calls();
+  ASSERT_EQ(calls.size(), 3U);
+  EXPECT_EQ(calls[1].method, "finishSessionGracefully");
+  EXPECT_EQ(calls[2].method, "sendMessageWithDictionary");
+}
+
+TEST_F(LifecycleTest, EventsWaitForADaemonThatComesLater) {
+  const auto client = makeClient();
+  for (int event = 0; event < 50; ++event) EXPECT_TRUE(client->sendMessageWithDictionary(message(1, event)));
+  _daemon.start();
+  ASSERT_TRUE(_daemon.waitForCalls("sendMessageWithDictionary", 50));
+  EXPECT_EQ(_daemon.calls().front().method, "setSessionInfo");
+}
+
+TEST_F(LifecycleTest, TellsADaemonThatComesLaterWhatWasSaidBefore) {
+  const auto client = makeClient();
+  client->setDigestKey(ByteData{9}, 0);
+  client->startConfigurationWithCompletionHandler(nullptr);
+  EXPECT_TRUE(flush(*client)) << "nobody is there";
+  _daemon.start();
+  client->sendMessageWithCategory(1, 1);
+  ASSERT_TRUE(_daemon.waitForCalls("sendMessageWithDictionary", 1));
+  std::vector<std::string> methods;
+  for (const auto& call : _daemon.calls()) methods.push_back(call.method);
+  EXPECT_EQ(methods, (std::vector<std::string>{"setSessionInfo", "setDigestKey", "startConfigWithCompletionHandler",
+                                               "sendMessageWithDictionary"}));
+}
+
+TEST_F(LifecycleTest, ReconnectsAndDescribesTheSessionAgain) {
+  _daemon.start();
+  const auto client = makeClient();
+  std::atomic<int> answers{0};
+  client->startConfigurationWithCompletionHandler([&answers](const auto&) { ++answers; });
+  client->setDigestKey(ByteData{9}, 0);
+  flush(*client);
+  _daemon.stop();
+  _daemon.start();
+  // The client may still believe in the old connection: events are sent until one arrives over the new one.
+  while (_daemon.count("setSessionInfo") < 2) {
+    static_cast<void>(flush(*client));
+  }
+  client->sendMessageWithCategory(1, 1);
+  ASSERT_TRUE(_daemon.waitForCalls("sendMessageWithDictionary", 1));
+  std::vector<std::string> again;
+  for (const auto& call : _daemon.calls()) {
+    if (call.connection == 2 && call.method != "flushMessagesWithCompletion") again.push_back(call.method);
+  }
+  EXPECT_EQ(again, (std::vector<std::string>{"setSessionInfo", "setDigestKey", "startConfigWithCompletionHandler",
+                                             "sendMessageWithDictionary"}));
+  EXPECT_EQ(answers.load(), 1) << "callbacks do not fire twice";
+}
+
+TEST_F(LifecycleTest, WhatCallbacksOwnMayWaitForTheLibraryWhenItEnds) {
+  _daemon.start();
+  const auto other = makeClient();
+  auto ended = std::make_shared<Semaphore>();
+  const auto owned = [this, other, ended] {
+    return std::shared_ptr<void>(nullptr, [this, other, ended](void*) {
+      flush(*other);
+      ended->signal();
+    });
+  };
+  auto client = makeClient([owner = owned()](auto&&...) {});
+  client->setMessageLoggingBlock([owner = owned()](const std::string&) {});
+  client->setMessageLoggingBlock([owner = owned()](const std::string&) {});
+  ASSERT_TRUE(ended->waitFor(kPatience));
+  client.reset();
+  ASSERT_TRUE(ended->waitFor(kPatience));
+  ASSERT_TRUE(ended->waitFor(kPatience));
+}
+
+TEST_F(LifecycleTest, FullOutboxRefusesAndSaysSo) {
+  const auto client = makeClient();  // nobody listens
+  Error error;
+  bool refused = false;
+  for (int event = 0; event < 20000 && !refused; ++event) {
+    refused = !client->sendMessageWithDictionary(message(1), &error);
+  }
+  EXPECT_TRUE(refused);
+  EXPECT_EQ(error.code, 8);
+  EXPECT_TRUE(client->sendMessageWithCategory(1, 1)) << "the category form answers true all the same";
+}
+
+TEST_F(LifecycleTest, LastReferenceWaitsForRoomAndKeepsTheOrder) {
+  _daemon.start();
+  auto client = makeClient();
+  ASSERT_TRUE(_daemon.waitForCalls("setSessionInfo", 1));
+  _daemon.holdCalls(true);
+  // More than the daemon's socket, its unread bytes and the connection's outbox hold together.
+  constexpr std::size_t kEvents = 120;
+  const PropertyDictionary payload{{"text", std::string(50'000, 'x')}};
+  for (std::size_t event = 0; event < kEvents; ++event) {
+    Error error;
+    client->sendMessageWithCategory(1, 1, payload, &error);
+    ASSERT_EQ(error, Error());
+  }
+  client->updateSharedDataWithDictionary({{"a", 1}});
+  std::thread releasing([this] { _daemon.holdCalls(false); });
+  client.reset();
+  releasing.join();
+  ASSERT_TRUE(_daemon.waitForCalls("finishSessionGracefully", 1));
+  EXPECT_EQ(_daemon.count("sendMessageWithDictionary"), kEvents);
+  const auto calls = _daemon.calls();
+  EXPECT_EQ(calls[calls.size() - 2].method, "updateSharedDataWithDictionary") << "it overtakes no event";
+  EXPECT_FALSE(_log.contains("are lost"));
+}
+
+}  // namespace
+}  // namespace velk::test

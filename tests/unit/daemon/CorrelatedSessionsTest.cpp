@@ -1,0 +1,176 @@
+#include "daemon/CorrelatedSessions.h"
+
+#include "tests/unit/daemon/AgentFixture.h"
+
+namespace velk {
+namespace {
+
+using test::FakeReportingdSession;
+
+class CorrelatedSessionsTest : public test::AgentFixture {
+ protected:
+  std::shared_ptr<FakeReportingdSession> add(std::uint32_t level, std::string idString, bool aggregates = false) {
+    auto session = FakeReportingdSession::relative("tree", level, std::move(idString), aggregates);
+    session->number = 100 + static_cast<std::uint32_t>(relatives.size());
+    relatives.push_back(session);
+    agent->updateCorrelatedSessions(*session);
+    return session;
+  }
+
+  std::vector<std::shared_ptr<FakeReportingdSession>> relatives;
+};
+
+TEST_F(CorrelatedSessionsTest, NeverListsAStandaloneSession) {
+  const auto session = create();
+  session->level = 2;
+  agent->updateCorrelatedSessions(*session);
+  EXPECT_EQ(logged(daemontexts::kStandaloneSession, session->number), 1);
+  EXPECT_EQ(agent->parentSessionForChild(*session), nullptr);
+  EXPECT_EQ(agent->parentSessionIDStringForSession(*session), std::nullopt);
+  EXPECT_EQ(agent->getAncestorWithAggregatorForSession(*session), nullptr);
+  agent->updateDownstreamSessions(*session);
+  EXPECT_TRUE(session->calls.empty());
+}
+
+TEST_F(CorrelatedSessionsTest, ARootHasNeitherParentNorChain) {
+  const auto root = add(0, "A");
+  EXPECT_EQ(agent->parentSessionForChild(*root), nullptr);
+  EXPECT_EQ(agent->parentSessionIDStringForSession(*root), std::nullopt);
+  EXPECT_EQ(logged(daemontexts::kAddingCorrelatedSession, root->number, "tree", 0), 1);
+}
+
+TEST_F(CorrelatedSessionsTest, ChainsAncestorsFromTheRootDownToTheParent) {
+  add(0, "A");
+  const auto child = add(1, "B");
+  const auto grandchild = add(2, "C");
+  EXPECT_EQ(agent->parentSessionIDStringForSession(*grandchild), "A.B");
+  EXPECT_EQ(agent->parentSessionForChild(*grandchild), child);
+  EXPECT_EQ(agent->parentSessionIDStringForSession(*child), "A");
+  EXPECT_EQ(logged(daemontexts::kCheckingChain, "tree", grandchild->number), 1);
+  EXPECT_EQ(logged(daemontexts::kCheckingParent, "tree", grandchild->number), 1);
+}
+
+TEST_F(CorrelatedSessionsTest, AMissingParentEndsTheChainBeforeItBegins) {
+  add(0, "A");
+  const auto session = add(2, "C");
+  EXPECT_EQ(agent->parentSessionForChild(*session), nullptr);
+  EXPECT_EQ(agent->parentSessionIDStringForSession(*session), std::nullopt);
+  EXPECT_EQ(logged(daemontexts::kGapInChain, nullptr), 1);
+  EXPECT_EQ(logged(daemontexts::kNoParentAtLevel, 1, "tree"), 1);
+}
+
+TEST_F(CorrelatedSessionsTest, AGapCutsOffWhatLiesAboveIt) {
+  add(0, "A");
+  add(1, "B");
+  const auto deep = add(3, "D");
+  EXPECT_EQ(agent->parentSessionIDStringForSession(*deep), std::nullopt);
+  const auto middle = add(2, "C");
+  EXPECT_EQ(agent->parentSessionIDStringForSession(*middle), "A.B");
+  const auto deepest = add(5, "F");
+  add(4, "E");
+  agent->invalidateReportingSession(middle);
+  EXPECT_EQ(agent->parentSessionIDStringForSession(*deepest), "D.E");
+  EXPECT_EQ(logged(daemontexts::kGapInChain, "D.E"), 1);
+}
+
+TEST_F(CorrelatedSessionsTest, ReportsATokenWithoutSessionsAndASessionThatNeverRegistered) {
+  const auto unknown = FakeReportingdSession::relative("other", 1, "X");
+  EXPECT_EQ(agent->parentSessionForChild(*unknown), nullptr);
+  EXPECT_EQ(agent->parentSessionIDStringForSession(*unknown), std::nullopt);
+  EXPECT_EQ(loggedAsError(daemontexts::kNoSessionsForParent, "other"), 1);
+  EXPECT_EQ(loggedAsError(daemontexts::kNoSessionsForChain, "other"), 1);
+  add(0, "A");
+  const auto stranger = FakeReportingdSession::relative("tree", 1, "Y");
+  EXPECT_EQ(agent->parentSessionForChild(*stranger), nullptr);
+  EXPECT_EQ(agent->parentSessionIDStringForSession(*stranger), std::nullopt);
+  EXPECT_EQ(loggedAsError(daemontexts::kNotFoundForParent, stranger->number, "tree"), 1);
+  EXPECT_EQ(logged(daemontexts::kNotFoundForChain, stranger->number, "tree"), 1);
+  EXPECT_EQ(loggedAsError(daemontexts::kNotFoundForChain, stranger->number, "tree"), 0);
+}
+
+TEST_F(CorrelatedSessionsTest, TheAggregatorNearestTheRootWins) {
+  const auto root = add(0, "A", true);
+  add(1, "B", true);
+  const auto grandchild = add(2, "C");
+  EXPECT_EQ(agent->getAncestorWithAggregatorForSession(*grandchild), root);
+  EXPECT_EQ(agent->getAncestorWithAggregatorForSession(*root), nullptr);
+}
+
+TEST_F(CorrelatedSessionsTest, OnlyTheFirstSessionOfALevelCountsAsAggregator) {
+  add(0, "A");
+  add(0, "A2", true);
+  const auto child = add(1, "B");
+  EXPECT_EQ(agent->getAncestorWithAggregatorForSession(*child), nullptr);
+}
+
+TEST_F(CorrelatedSessionsTest, TheFirstSessionOfALevelIsTheParentOfAll) {
+  add(0, "A");
+  const auto first = add(1, "B1");
+  const auto second = add(1, "B2");
+  const auto child = add(2, "C");
+  EXPECT_EQ(agent->parentSessionForChild(*child), first);
+  EXPECT_EQ(agent->parentSessionIDStringForSession(*child), "A.B1");
+  // Registering again moves it behind its sibling.
+  agent->updateCorrelatedSessions(*first);
+  EXPECT_EQ(agent->parentSessionForChild(*child), second);
+}
+
+TEST_F(CorrelatedSessionsTest, ASessionThatChangesItsTokenLeavesItsOldRelatives) {
+  const auto root = add(0, "A");
+  const auto child = add(1, "B");
+  root->token = "elsewhere";
+  agent->updateCorrelatedSessions(*root);
+  EXPECT_EQ(agent->parentSessionForChild(*child), nullptr);
+}
+
+TEST_F(CorrelatedSessionsTest, ALevelThatAClientMadeUpCostsNoMoreThanTheSessionsThereAre) {
+  add(0, "A", true);
+  const auto deep = add(UINT32_MAX, "Z");
+  EXPECT_EQ(agent->getAncestorWithAggregatorForSession(*deep), relatives.front());
+  EXPECT_EQ(agent->parentSessionIDStringForSession(*deep), std::nullopt);
+}
+
+TEST_F(CorrelatedSessionsTest, UpdatesEveryDeeperSessionDownstream) {
+  const auto root = add(0, "A");
+  const auto sibling = add(0, "A2");
+  const auto child = add(1, "B", true);
+  const auto grandchild = add(2, "C");
+  agent->updateDownstreamSessions(*root);
+  const std::vector<std::string> updated{"updateCombinedSessionID", "syncReportingStates"};
+  EXPECT_EQ(root->calls, updated);
+  EXPECT_EQ(child->calls, updated);
+  EXPECT_EQ(grandchild->calls, updated);
+  EXPECT_TRUE(sibling->calls.empty());
+  EXPECT_EQ(logged(daemontexts::kUpdatingDownstream, child->number), 1);
+  EXPECT_EQ(logged(daemontexts::kUpdatingDownstream, root->number), 0);
+}
+
+TEST_F(CorrelatedSessionsTest, LeavesTheTopmostAggregatorAlone) {
+  const auto root = add(0, "A", true);
+  const auto child = add(1, "B", true);
+  const auto grandchild = add(2, "C");
+  agent->updateDownstreamSessions(*root);
+  EXPECT_EQ(root->calls.size(), 2U);
+  EXPECT_EQ(child->calls.back(), "shutdownSessionAggregation");
+  EXPECT_EQ(grandchild->calls.back(), "syncReportingStates");
+}
+
+TEST_F(CorrelatedSessionsTest, AnAggregatingAncestorShutsTheWholeBranchDown) {
+  add(0, "A", true);
+  const auto child = add(1, "B");
+  const auto grandchild = add(2, "C", true);
+  agent->updateDownstreamSessions(*child);
+  EXPECT_EQ(child->calls.back(), "shutdownSessionAggregation");
+  EXPECT_EQ(grandchild->calls.back(), "shutdownSessionAggregation");
+}
+
+TEST_F(CorrelatedSessionsTest, FindsTheFirstSessionWithALevelInAnyList) {
+  const CorrelatedSessions::SessionList list{FakeReportingdSession::relative("t", 1, "B"),
+                                             FakeReportingdSession::relative("t", 0, "A"),
+                                             FakeReportingdSession::relative("t", 1, "C")};
+  EXPECT_EQ(CorrelatedSessions::getFirstSessionWithHierarchy(1, list), list[0]);
+  EXPECT_EQ(CorrelatedSessions::getFirstSessionWithHierarchy(2, list), nullptr);
+}
+
+}  // namespace
+}  // namespace velk

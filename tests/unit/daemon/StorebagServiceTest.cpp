@@ -1,0 +1,307 @@
+#include "tests/unit/daemon/StorebagFixture.h"
+
+namespace velk {
+namespace {
+
+using namespace std::chrono_literals;
+using test::kBramble;
+using test::kConference;
+
+class StorebagServiceTest : public test::StorebagFixture {
+ protected:
+  StorebagServiceTest() { setEnvironment(kEnvironmentRelease); }
+  StorebagSection fetch(std::int32_t clientType = kBramble) {
+    return service->fetchStorebagForEnvironmentAndClientType(clientType);
+  }
+  static std::string url(const std::string& base, const std::string& name) {
+    return base + "/" + name + "?version=8.0";
+  }
+  std::string defaultUrl() { return url("https://storebags.tavrin.example/bags/vindle", "bramble"); }
+  std::string headerOf(const HttpRequest& asked, std::string_view name) {
+    for (const auto& [key, value] : asked.headers) {
+      if (key == name) return value;
+    }
+    return "none";
+  }
+};
+
+TEST_F(StorebagServiceTest, FetchesVerifiesAndKeepsAStorebagThatIsNotOnDisk) {
+  serveBag(bagWithSections("7"), {{"Cache-Control", "max-age=600"}, {"Last-Modified", "Monday"}});
+  const auto fetched = fetch();
+  EXPECT_EQ(sectionName(fetched.section), "release");
+  EXPECT_EQ(fetched.version, "7");
+  EXPECT_EQ(fetched.maxAge, 600);
+  EXPECT_FALSE(fetched.handled);
+  EXPECT_EQ(files.bytes("bramble"), key.envelope(bagWithSections("7")));
+  EXPECT_EQ(logged(daemontexts::kServerUrl, defaultUrl()), 1);
+  EXPECT_EQ(logged(daemontexts::kStorebagSaved, "bramble"), 1);
+}
+
+TEST_F(StorebagServiceTest, AsksOverHttpsWithoutCacheWithinFifteenSeconds) {
+  serveBag(bagWithSections());
+  fetch();
+  const auto asked = request(0);
+  EXPECT_EQ(asked.method, "GET");
+  EXPECT_EQ(asked.url, defaultUrl());
+  EXPECT_EQ(asked.timeout, 15s);
+  EXPECT_TRUE(asked.ignoresLocalCache);
+  EXPECT_TRUE(asked.requiresHttps);
+  EXPECT_EQ(headerOf(asked, "If-Modified-Since"), "none");
+}
+
+TEST_F(StorebagServiceTest, AsksTheServerOfTheSettingAndReadsItEveryTime) {
+  serveBag(bagWithSections());
+  fakes.defaults.put("velkreporting_storebag_url", "https://one.example/x");
+  fetch();
+  fakes.defaults.put("velkreporting_storebag_url", "https://two.example");
+  fetch(6);
+  fakes.defaults.put("velkreporting_storebag_url", 5);
+  fetch(8);
+  EXPECT_EQ(request(0).url, url("https://one.example/x", "bramble"));
+  EXPECT_EQ(request(1).url, url("https://two.example", "clover"));
+  EXPECT_EQ(request(2).url, url("https://storebags.tavrin.example/bags/vindle", "fennel"));
+}
+
+TEST_F(StorebagServiceTest, InternalBuildsAskTheInternalServer) {
+  fakes.device.set("ReleaseType", "Internal");
+  serveBag(bagWithSections());
+  fetch();
+  EXPECT_EQ(request(0).url, url("https://storebags.internal.tavrin.example/storebags/vindle", "bramble"));
+}
+
+TEST_F(StorebagServiceTest, TheStorebagsOwnCycleOverridesTheServersAgeUpToADay) {
+  const auto maxAgeWith = [&](const PropertyValue& cycle) {
+    auto bag = bagWithSections();
+    bag.set("refresh_cycle", cycle);
+    putOnDisk("bramble", bag, 600);
+    return fetch().maxAge;
+  };
+  EXPECT_EQ(maxAgeWith(60), 60);
+  EXPECT_EQ(maxAgeWith(100000), 86400);
+  EXPECT_EQ(maxAgeWith(86400), 86400);
+  EXPECT_EQ(maxAgeWith(-5), -5);
+  EXPECT_EQ(maxAgeWith(INT64_MAX), 86400);
+  EXPECT_EQ(maxAgeWith("120 seconds"), 120);
+  EXPECT_EQ(logged(daemontexts::kMaxAgeOverride, 60), 1);
+}
+
+TEST_F(StorebagServiceTest, HandsTheReleaseTimeoutIntoTheSection) {
+  auto bag = bagWithSections();
+  bag.set("release_timeout", "5");
+  putOnDisk("bramble", bag, 600);
+  EXPECT_EQ(*fetch().section->string("release_timeout"), "5");
+}
+
+TEST_F(StorebagServiceTest, TakesTheReleaseSectionWhenTheSeedsIsMissing) {
+  setEnvironment(kEnvironmentSeed);
+  auto bag = bagWithSections();
+  bag.remove("seed");
+  putOnDisk("bramble", bag, 600);
+  EXPECT_EQ(sectionName(fetch().section), "release");
+  EXPECT_EQ(loggedAsError(daemontexts::kSeedMissing), 1);
+  bag.set("release", "not a dictionary");
+  putOnDisk("bramble", bag, 600);
+  EXPECT_EQ(fetch().section, std::nullopt);
+  EXPECT_EQ(loggedAsError(daemontexts::kNoSection, kBramble, "seed"), 1);
+}
+
+TEST_F(StorebagServiceTest, ReportsAnEnvironmentWithoutSection) {
+  auto bag = bagWithSections();
+  bag.remove("development");
+  putOnDisk("bramble", bag, 600);
+  setEnvironment(kEnvironmentDevelopment);
+  EXPECT_EQ(fetch().section, std::nullopt);
+  EXPECT_EQ(loggedAsError(daemontexts::kNoSection, kBramble, "development"), 1);
+  setEnvironment(kEnvironmentNone);
+  EXPECT_EQ(fetch().section, std::nullopt);
+  EXPECT_EQ(loggedAsError(daemontexts::kNoSection, kBramble, nullptr), 1);
+}
+
+TEST_F(StorebagServiceTest, SurvivesStorebagsOfWrongTypes) {
+  for (const PropertyValue& bag :
+       {PropertyValue(PropertyArray{1}), PropertyValue("text"), PropertyValue(PropertyDictionary{}),
+        PropertyValue(PropertyDictionary{
+            {"release", PropertyArray{}}, {"shared_values", 5}, {"version", 5}, {"refresh_cycle", PropertyArray{}}})}) {
+    putOnDisk("bramble", bag, 600);
+    serveNothing();
+    EXPECT_EQ(fetch().section, std::nullopt);
+    EXPECT_EQ(fetch().version, std::nullopt);
+  }
+}
+
+TEST_F(StorebagServiceTest, KnowsNoStorebagForTypesOutsideTheTable) {
+  EXPECT_EQ(fetch(3).section, std::nullopt);
+  EXPECT_EQ(loggedAsError(daemontexts::kNoStorebagName, 3), 1);
+  EXPECT_EQ(requestCount(), 0U);
+}
+
+TEST_F(StorebagServiceTest, ServesAFreshCopyWithoutAsking) {
+  putOnDisk("bramble", bagWithSections(), 600);
+  advanceSeconds(600);
+  EXPECT_EQ(sectionName(fetch().section), "release");
+  EXPECT_EQ(requestCount(), 0U);
+  EXPECT_EQ(logged(daemontexts::kLoadedFromDisk, "bramble", daemontexts::kDiskValid), 1);
+}
+
+TEST_F(StorebagServiceTest, ServesAnAgedCopyAtOnceAndRefreshesItInTheBackground) {
+  putOnDisk("bramble", bagWithSections("old"), 600);
+  fakes.defaults.put("CACHED_bramble_Last-Modified", "Monday");
+  advanceSeconds(601);
+  serveBag(bagWithSections("new"));
+  EXPECT_EQ(fetch().version, "old");
+  EXPECT_EQ(logged(daemontexts::kLoadedFromDisk, "bramble", daemontexts::kDiskExpired), 1);
+  EXPECT_EQ(logged(daemontexts::kAddingLastModified, "Monday"), 1);
+  EXPECT_EQ(headerOf(request(0), "If-Modified-Since"), "Monday");
+  EXPECT_EQ(fakes.random.bounds(), std::vector<std::uint32_t>{7200});
+}
+
+TEST_F(StorebagServiceTest, AClockThatWasSetBackAgesACopyAsWell) {
+  putOnDisk("bramble", bagWithSections(), 600);
+  fakes.clock().setWallTime({secondsFromTimeValue(fakes.clock().wallTime()) > 700 ? 1'599'999'000 : 0, 0});
+  serveStatus(304);
+  EXPECT_EQ(sectionName(fetch().section), "release");
+  static_cast<void>(request(0));
+}
+
+TEST_F(StorebagServiceTest, AnUnchangedAnswerNeverRenewsTheAge) {
+  putOnDisk("bramble", bagWithSections(), 600);
+  const auto written = files.modificationDate("bramble");
+  advanceSeconds(601);
+  serveStatus(304);
+  fetch();
+  static_cast<void>(request(0));
+  service->startAfresh();
+  pool->stop();
+  EXPECT_EQ(files.modificationDate("bramble"), written);
+  EXPECT_EQ(fakes.defaults.value("CACHED_bramble_max-age"), PropertyValue(600));
+  EXPECT_EQ(logged(daemontexts::kNotChanged, "bramble"), 1);
+}
+
+TEST_F(StorebagServiceTest, ADelayedRefreshBlocksAnImmediateFetchOfTheSameStorebag) {
+  putOnDisk("bramble", bagWithSections(), 600);
+  advanceSeconds(601);
+  fakes.random.setRest(7199);
+  serveBag(bagWithSections());
+  fetch();
+  files.remove("bramble");
+  const auto blocked = fetch();
+  EXPECT_EQ(blocked.section, std::nullopt);
+  EXPECT_EQ(requestCount(), 0U);
+  EXPECT_EQ(loggedAsError(daemontexts::kCouldNotFetch, kBramble), 1);
+  EXPECT_TRUE(log.contains("fetchNetworkStorebag: Error resolving with lookup server " + defaultUrl()));
+  // A new transport has been asked for nothing yet.
+  service->startAfresh();
+  EXPECT_EQ(sectionName(fetch().section), "release");
+}
+
+TEST_F(StorebagServiceTest, ASecondFetchOfAStorebagThatWasFetchedIsIgnoredAndFailsAtOnce) {
+  serveStatus(500);
+  EXPECT_EQ(fetch().section, std::nullopt);
+  EXPECT_EQ(logged(daemontexts::kErrorResolving, defaultUrl(), "status 500"), 1);
+  serveBag(bagWithSections());
+  EXPECT_EQ(fetch().section, std::nullopt);
+  EXPECT_EQ(requestCount(), 1U);
+  EXPECT_EQ(logged(daemontexts::kNotChanged, "bramble"), 2);
+}
+
+TEST_F(StorebagServiceTest, ATransportThatCannotMakeATaskFailsTheFetchAtOnce) {
+  http.failTaskCreation(Error{"HttpErrorDomain", 3, "no such address"});
+  EXPECT_EQ(fetch().section, std::nullopt);
+  EXPECT_TRUE(log.contains("fetchNetworkStorebag: Error resolving with lookup server "));
+}
+
+TEST_F(StorebagServiceTest, AnUnreachableServerLeavesOthersWithoutAStorebag) {
+  serveNothing();
+  EXPECT_EQ(fetch().section, std::nullopt);
+  EXPECT_EQ(logged(daemontexts::kErrorResolving, defaultUrl(), "could not connect"), 1);
+  EXPECT_EQ(logged(daemontexts::kLoadingDefault, "bramble"), 0);
+}
+
+TEST_F(StorebagServiceTest, TheConferencingFallbackIsLoadedAndThenFailsVerification) {
+  serveNothing();
+  EXPECT_EQ(fetch(kConference).section, std::nullopt);
+  EXPECT_EQ(logged(daemontexts::kLoadingDefault, "sorrel"), 1);
+  EXPECT_EQ(loggedAsError(daemontexts::kSignatureMissing), 1);
+  EXPECT_EQ(loggedAsError(daemontexts::kCouldNotFetch, kConference), 1);
+  EXPECT_EQ(files.bytes("sorrel"), std::nullopt);
+}
+
+TEST_F(StorebagServiceTest, ATamperedAnswerIsNeitherKeptNorServedButItsMetricsAre) {
+  auto envelope = test::textOf(key.envelope(bagWithSections()));
+  const auto bag = envelope.find("<key>bag</key>");
+  ASSERT_NE(bag, std::string::npos);
+  const auto digits = envelope.find("<string>", bag) + 60;
+  envelope[digits] = envelope[digits] == 'A' ? 'B' : 'A';
+  serve({200, envelope, {{"Cache-Control", "max-age=42"}, {"Last-Modified", "Monday"}}, std::nullopt});
+  EXPECT_EQ(fetch().section, std::nullopt);
+  EXPECT_EQ(files.bytes("bramble"), std::nullopt);
+  EXPECT_TRUE(log.contains("Signature can not be verified"));
+  EXPECT_EQ(fakes.defaults.value("CACHED_bramble_max-age"), PropertyValue(42));
+  EXPECT_EQ(fakes.defaults.value("CACHED_bramble_Last-Modified"), PropertyValue("Monday"));
+}
+
+TEST_F(StorebagServiceTest, AnEmptyAnswerCountsAsUnchanged) {
+  serve({200, "", {{"Cache-Control", "max-age=42"}}, std::nullopt});
+  EXPECT_EQ(fetch().section, std::nullopt);
+  EXPECT_EQ(
+      log.count("fetchNetworkStorebag: received zero-length storebag for 'bramble\xE2\x80\x98, treat as unchanged"), 1);
+  EXPECT_EQ(fakes.defaults.value("CACHED_bramble_max-age"), PropertyValue(42));
+}
+
+TEST_F(StorebagServiceTest, ACopyThatDoesNotVerifyIsSetAsideAndFetchedAnew) {
+  files.put("bramble", test::bytesOf("torn"));
+  fakes.defaults.put("CACHED_bramble_max-age", 600);
+  serveBag(bagWithSections("new"));
+  EXPECT_EQ(fetch().version, "new");
+  EXPECT_EQ(files.setAside(), std::set<std::string>{"bramble"});
+  EXPECT_EQ(files.bytes("bramble"), key.envelope(bagWithSections("new")));
+}
+
+TEST_F(StorebagServiceTest, AnAgedCopyThatDoesNotVerifyStartsNoRefreshInItsWay) {
+  files.put("bramble", test::bytesOf("torn"));
+  advanceSeconds(100);
+  serveBag(bagWithSections("new"));
+  EXPECT_EQ(fetch().version, "new");
+  EXPECT_TRUE(fakes.random.bounds().empty());
+}
+
+TEST_F(StorebagServiceTest, LeavesTheProtectionOfCopiesAloneOnReleasedBuilds) {
+  putOnDisk("bramble", bagWithSections(), 600);
+  fetch();
+  EXPECT_TRUE(files.unprotected().empty());
+}
+
+TEST_F(StorebagServiceTest, LiftsTheProtectionOfCopiesOnInternalBuilds) {
+  fakes.device.set("ReleaseType", "Internal");
+  putOnDisk("bramble", bagWithSections(), 600);
+  EXPECT_EQ(sectionName(fetch().section), "release");
+  EXPECT_EQ(files.unprotected(), std::set<std::string>{"bramble"});
+}
+
+TEST_F(StorebagServiceTest, AStoppedServiceServesItsCopiesAndMakesNoTransport) {
+  putOnDisk("bramble", bagWithSections("old"), 600);
+  advanceSeconds(601);
+  service->stop();
+  EXPECT_EQ(fetch().version, "old");
+  EXPECT_TRUE(http.sessions().empty());
+}
+
+TEST_F(StorebagServiceTest, TypesThatShareANameShareTheFile) {
+  serveBag(bagWithSections());
+  fetch(7);
+  EXPECT_EQ(sectionName(fetch(20).section), "release");
+  EXPECT_EQ(requestCount(), 1U);
+}
+
+TEST_F(StorebagServiceTest, KeepsACopyThatOnlyLacksAKeyToVerifyItWith) {
+  putOnDisk("bramble", bagWithSections(), 600);
+  const auto keyless = StorebagService::make(platform(), environment, files.cache(), [] { return nullptr; });
+  serveBag(bagWithSections());
+  EXPECT_EQ(keyless->fetchStorebagForEnvironmentAndClientType(kBramble).section, std::nullopt);
+  EXPECT_TRUE(files.setAside().empty());
+  EXPECT_TRUE(files.bytes("bramble").has_value());
+  keyless->startAfresh();
+}
+
+}  // namespace
+}  // namespace velk

@@ -1,0 +1,232 @@
+#include "platform/UserDefaults.h"
+
+#include <gtest/gtest.h>
+#include <sys/stat.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <thread>
+#include <vector>
+
+#include "platform/Files.h"
+#include "platform/Platform.h"
+#include "tests/support/FakeUserDefaults.h"
+#include "tests/support/RecordingLog.h"
+#include "tests/support/TemporaryDirectory.h"
+
+namespace velk {
+namespace {
+
+class UserDefaultsTest : public testing::Test {
+ protected:
+  [[nodiscard]] std::unique_ptr<UserDefaults> open() const {
+    return openUserDefaults("suite", directory / "state", directory / "etc");
+  }
+  [[nodiscard]] unsigned modeOf(std::string_view name) const {
+    struct stat status {};
+    EXPECT_EQ(::stat((directory / name).c_str(), &status), 0) << name;
+    return status.st_mode & 07777;
+  }
+
+  test::RecordingLog log;
+  const test::TemporaryDirectory directory;
+};
+
+TEST_F(UserDefaultsTest, IsEmptyWithoutAFile) {
+  const auto suite = open();
+  EXPECT_EQ(suite->value("key"), std::nullopt);
+  EXPECT_TRUE(suite->allValues().empty());
+  EXPECT_FALSE(files::exists(directory / "state"));
+  EXPECT_TRUE(log.lines().empty());
+}
+
+TEST_F(UserDefaultsTest, KeepsEveryKindOfValue) {
+  const PropertyDictionary value{
+      {"date", Date{1'600'000'000.25}}, {"data", ByteData{1, 2}}, {"list", PropertyArray{1, -2, 2.5}}};
+  ASSERT_TRUE(open()->set("key", value));
+  EXPECT_EQ(open()->value("key"), PropertyValue(value));
+}
+
+TEST_F(UserDefaultsTest, LetsNobodyElseIn) {
+  ASSERT_TRUE(open()->set("key", 1));
+  EXPECT_EQ(modeOf("state"), 0700U);
+  EXPECT_EQ(modeOf("state/suite.json"), 0600U);
+  EXPECT_EQ(modeOf("state/suite.lock"), 0600U);
+}
+
+TEST_F(UserDefaultsTest, SeesWhatOthersWroteLast) {
+  const auto reader = open();
+  const auto writer = open();
+  // Versions of equal length, written within one tick of the file system's clock.
+  for (int number = 10; number < 99; ++number) {
+    ASSERT_TRUE(writer->set("key", number));
+    ASSERT_EQ(reader->value("key"), PropertyValue(number));
+  }
+  ASSERT_TRUE(writer->remove("key"));
+  EXPECT_EQ(reader->value("key"), std::nullopt);
+}
+
+TEST_F(UserDefaultsTest, SeesFilesEditedByHand) {
+  const auto suite = open();
+  ASSERT_TRUE(suite->set("key", 1));
+  directory.write("state/suite.json", "{\"key\": \"edited by hand\"}");
+  EXPECT_EQ(suite->value("key"), PropertyValue("edited by hand"));
+}
+
+TEST_F(UserDefaultsTest, FallsBackToTheAdministratorsDefaults) {
+  directory.write("etc/suite.json", R"({"a": 1, "b": 2})");
+  const auto suite = open();
+  ASSERT_TRUE(suite->set("b", 3));
+  EXPECT_EQ(suite->value("a"), PropertyValue(1));
+  EXPECT_EQ(suite->value("b"), PropertyValue(3));
+  EXPECT_EQ(suite->allValues(), (PropertyDictionary{{"a", 1}, {"b", 3}}));
+  ASSERT_TRUE(suite->remove("b"));
+  EXPECT_EQ(suite->value("b"), PropertyValue(2));
+  EXPECT_EQ(suite->valueOrStore("a", [] { return PropertyValue(9); }), PropertyValue(1));
+}
+
+TEST_F(UserDefaultsTest, IgnoresAdministratorsDefaultsThatOthersCanWrite) {
+  const auto path = directory.write("etc/suite.json", R"({"a": 1})");
+  const auto suite = open();
+  EXPECT_EQ(suite->value("a"), PropertyValue(1));
+  ASSERT_EQ(::chmod(path.c_str(), 0666), 0);
+  EXPECT_EQ(suite->value("a"), std::nullopt);
+  EXPECT_EQ(suite->value("a"), std::nullopt);
+  EXPECT_EQ(log.count(log::Level::error, "UserDefaults: Ignoring " + path + ": others can write it"), 1);
+}
+
+TEST_F(UserDefaultsTest, ReportsUnusableAdministratorsDefaultsOnce) {
+  directory.write("etc/suite.json", "nonsense");
+  const auto suite = open();
+  EXPECT_EQ(suite->value("a"), std::nullopt);
+  EXPECT_EQ(suite->value("b"), std::nullopt);
+  EXPECT_EQ(log.lines().size(), 1U);
+  EXPECT_EQ(directory.read("etc/suite.json"), "nonsense");
+}
+
+TEST_F(UserDefaultsTest, SetsACorruptFileAsideOnce) {
+  for (const std::string_view text : {"", "{\"key\": ", "[1, 2]", "\xff\xfe", "{\"a\": 1} and more"}) {
+    log.clear();
+    directory.write("state/suite.json", text);
+    const auto suite = open();
+    EXPECT_EQ(suite->value("key"), std::nullopt);
+    EXPECT_EQ(suite->value("key"), std::nullopt);
+    EXPECT_FALSE(files::exists(directory / "state/suite.json"));
+    ASSERT_EQ(log.lines().size(), 1U) << text;
+    EXPECT_EQ(log.lines()[0].level, log::Level::error);
+    EXPECT_TRUE(log.contains("suite.json.corrupt-"));
+    ASSERT_TRUE(suite->set("key", 1));
+    EXPECT_EQ(suite->value("key"), PropertyValue(1));
+  }
+}
+
+TEST_F(UserDefaultsTest, ReportsACorruptFileThatCannotBeSetAsideOnce) {
+  for (int number = 1; number <= 5; ++number) {
+    directory.write("state/suite.json.corrupt-" + std::to_string(number) + "/taken", "");
+  }
+  directory.write("state/suite.json", "corrupt");
+  const auto suite = open();
+  EXPECT_EQ(suite->value("key"), std::nullopt);
+  EXPECT_EQ(suite->value("key"), std::nullopt);
+  ASSERT_EQ(log.lines().size(), 1U);
+  EXPECT_TRUE(log.contains("UserDefaults: Cannot use "));
+  EXPECT_EQ(directory.read("state/suite.json"), "corrupt");
+}
+
+TEST_F(UserDefaultsTest, WritesOverACorruptFileAfterSettingItAside) {
+  directory.write("state/suite.json", "corrupt");
+  ASSERT_TRUE(open()->set("key", 1));
+  EXPECT_EQ(directory.read("state/suite.json.corrupt-1"), "corrupt");
+  EXPECT_EQ(open()->value("key"), PropertyValue(1));
+}
+
+TEST_F(UserDefaultsTest, RefusesWhatCannotBeStored) {
+  const auto suite = open();
+  ASSERT_TRUE(suite->set("key", 1));
+  EXPECT_FALSE(suite->set("key", std::numeric_limits<double>::quiet_NaN()));
+  EXPECT_FALSE(suite->set("key", "\xff"));
+  EXPECT_FALSE(suite->set("key", std::string(5 * 1024 * 1024, 'x')));
+  EXPECT_EQ(suite->value("key"), PropertyValue(1));
+}
+
+TEST_F(UserDefaultsTest, TellsWhenItCannotWrite) {
+  directory.write("state", "a file where the directory should be");
+  const auto suite = open();
+  const auto stored = suite->set("key", 1);
+  ASSERT_FALSE(stored);
+  EXPECT_FALSE(stored.error().description.empty());
+  EXPECT_EQ(suite->value("key"), std::nullopt);
+}
+
+TEST_F(UserDefaultsTest, DoesNotReplaceWhatItCannotRead) {
+  ASSERT_TRUE(files::createDirectories(directory / "state/suite.json"));
+  const auto suite = open();
+  EXPECT_EQ(suite->value("key"), std::nullopt);
+  EXPECT_EQ(suite->value("key"), std::nullopt);
+  EXPECT_FALSE(suite->set("key", 1));
+  EXPECT_EQ(log.lines().size(), 1U);
+}
+
+TEST_F(UserDefaultsTest, StoresAValueOnlyWhereThereIsNone) {
+  const auto suite = open();
+  EXPECT_EQ(suite->valueOrStore("key", [] { return PropertyValue("first"); }), PropertyValue("first"));
+  EXPECT_EQ(open()->valueOrStore("key", [] { return PropertyValue("second"); }), PropertyValue("first"));
+}
+
+TEST_F(UserDefaultsTest, LosesNoKeyOfProcessesThatWriteAtOnce) {
+  constexpr int kProcesses = 2;
+  constexpr int kKeys = 40;
+  std::vector<pid_t> children;
+  for (int process = 0; process < kProcesses; ++process) {
+    const pid_t child = ::fork();
+    ASSERT_GE(child, 0);
+    if (child == 0) {
+      const auto suite = open();
+      bool stored = true;
+      for (int key = 0; key < kKeys; ++key) {
+        stored = suite->set(std::to_string(process) + "-" + std::to_string(key), key).has_value() && stored;
+      }
+      ::_exit(stored ? 0 : 1);
+    }
+    children.push_back(child);
+  }
+  for (const pid_t child : children) {
+    int status = -1;
+    ASSERT_EQ(::waitpid(child, &status, 0), child);
+    EXPECT_EQ(status, 0);
+  }
+  EXPECT_EQ(open()->allValues().size(), static_cast<std::size_t>(kProcesses * kKeys));
+}
+
+TEST_F(UserDefaultsTest, LosesNoKeyOfThreadsThatWriteAtOnce) {
+  const auto suite = open();
+  std::vector<std::thread> threads;
+  for (int thread = 0; thread < 4; ++thread) {
+    threads.emplace_back([&suite, thread] {
+      for (int key = 0; key < 10; ++key) {
+        const auto name = std::to_string(thread) + "-" + std::to_string(key);
+        EXPECT_TRUE(suite->set(name, key));
+        EXPECT_EQ(suite->value(name), PropertyValue(key));
+      }
+    });
+  }
+  for (auto& thread : threads) thread.join();
+  EXPECT_EQ(suite->allValues().size(), 40U);
+}
+
+TEST(Consent, IsOffUnlessTurnedOn) {
+  test::FakeUserDefaults defaults;
+  const auto consent = makeConsent(defaults);
+  EXPECT_FALSE(consent->diagnosticsAndUsageEnabled());
+  defaults.put(kDiagnosticsAndUsageSetting, true);
+  EXPECT_TRUE(consent->diagnosticsAndUsageEnabled());
+  defaults.put(kDiagnosticsAndUsageSetting, "YES");
+  EXPECT_TRUE(consent->diagnosticsAndUsageEnabled());
+  defaults.put(kDiagnosticsAndUsageSetting, "off");
+  EXPECT_FALSE(consent->diagnosticsAndUsageEnabled());
+  defaults.put(kDiagnosticsAndUsageSetting, PropertyArray{1});
+  EXPECT_FALSE(consent->diagnosticsAndUsageEnabled());
+}
+
+}  // namespace
+}  // namespace velk

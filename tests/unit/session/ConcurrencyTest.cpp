@@ -1,0 +1,55 @@
+// What other threads may do to a session while its own queue works. Meant for the thread sanitizer.
+#include <atomic>
+#include <thread>
+
+#include "tests/unit/session/SessionFixture.h"
+
+namespace velk::test {
+namespace {
+
+class ConcurrencyTest : public SessionTest {};
+
+TEST_F(ConcurrencyTest, OthersReadWhileOneShotsReplaceTheBackends) {
+  serveBackends({"splunk", "korrin"});
+  delegate.parentID = "A";
+  std::atomic<bool> stop{false};
+  std::vector<std::thread> readers;
+  for (int number = 0; number < 3; ++number) {
+    readers.emplace_back([&] {
+      while (!stop) {
+        (void)session->statusDictionary();
+        (void)session->batchedEventsSize();
+        (void)session->description();
+        (void)session->hasValidUserInfoKeys();
+        session->updateCombinedSessionID();
+        session->syncReportingStates();
+      }
+    });
+  }
+  for (int count = 0; count < 100; ++count) {
+    sendOnce(PropertyDictionary{{kVelkReportingSessionInfoClientType, 8},
+                                {kVelkReportingSessionInfoSessionID, count},
+                                {kVelkReportingSessionInfoHierarchyToken,
+                                 PropertyDictionary{{kVelkReportingHierarchyTokenTokenID, "T"},
+                                                    {kVelkReportingHierarchyTokenLevel, 1}}}},
+             userNamed(count % 2 == 0 ? "a" : "c", "b"), PropertyDictionary{{"p", count}});
+  }
+  session->teardown();
+  stop = true;
+  for (auto& reader : readers) reader.join();
+  EXPECT_EQ(made.size(), 200U);
+  EXPECT_EQ(session->backends(), nullptr);
+}
+
+TEST_F(ConcurrencyTest, SessionMayBeEndedFromAnyThread) {
+  start({"splunk"}, {}, std::nullopt, true);
+  std::thread agent([this] { session->invalidate(); });
+  for (int count = 0; count < 100; ++count) send(message(1, 2, PropertyDictionary{{"p", count}}));
+  agent.join();
+  session->teardown();
+  EXPECT_EQ(connection->invalidations, 1);
+  EXPECT_EQ(backend("splunk").sent.size(), 101U);
+}
+
+}  // namespace
+}  // namespace velk::test
