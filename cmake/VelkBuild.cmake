@@ -4,7 +4,7 @@ include(CheckCXXCompilerFlag)
 find_package(PkgConfig REQUIRED)
 find_package(Threads REQUIRED)
 
-add_compile_options(-Wall -Wextra -Werror $<$<COMPILE_LANG_AND_ID:CXX,GNU>:-Wshadow=compatible-local> -Wnon-virtual-dtor -Woverloaded-virtual
+add_compile_options(-Wall -Wextra -Werror $<$<COMPILE_LANG_AND_ID:CXX,GNU>:-Wshadow=compatible-local> $<$<COMPILE_LANGUAGE:CXX>:-Wnon-virtual-dtor> $<$<COMPILE_LANGUAGE:CXX>:-Woverloaded-virtual>
                     $<$<COMPILE_LANGUAGE:CXX>:-Wno-missing-field-initializers>)
 if(CMAKE_CXX_COMPILER_ID MATCHES "Clang")
   add_compile_options(-Wthread-safety -Wno-error=unused-command-line-argument)
