@@ -33,27 +33,36 @@ std::map<std::uint32_t, std::shared_ptr<ReportingdSession>> firstSessionsBelow(s
 
 }  // namespace
 
-void CorrelatedSessions::add(ReportingdSession& session) {
+std::vector<std::string> CorrelatedSessions::add(ReportingdSession& session) {
   const auto token = session.hierarchyToken();
   if (!token) {
     log::standard(daemontexts::kStandaloneSession, session.sessionID());
-    return;
+    return {};
   }
-  for (auto& [otherToken, list] : _sessions) removeFrom(list, session);
+  std::size_t deserted = 0;
+  for (auto& [otherToken, list] : _sessions) {
+    removeFrom(list, session);
+    if (list.empty() && otherToken != *token) ++deserted;
+  }
   auto& list = _sessions[*token];
   log::standard(daemontexts::kAddingCorrelatedSession, session.sessionID(), *token, session.hierarchyLevel());
   list.push_back(session.shared_from_this());
+  return deserted > kMaximumDesertedLists ? dropEmptyLists() : std::vector<std::string>();
 }
 
 std::vector<std::string> CorrelatedSessions::remove(const ReportingdSession& session) {
-  std::vector<std::string> emptied;
-  for (auto& [token, list] : _sessions) {
-    // Under every token: the session may have forgotten its own since it registered.
-    removeFrom(list, session);
-    if (list.empty()) emptied.push_back(token);
+  // Under every token: the session may have forgotten its own since it registered.
+  for (auto& [token, list] : _sessions) removeFrom(list, session);
+  return dropEmptyLists();
+}
+
+std::vector<std::string> CorrelatedSessions::dropEmptyLists() {
+  std::vector<std::string> dropped;
+  for (const auto& [token, list] : _sessions) {
+    if (list.empty()) dropped.push_back(token);
   }
-  for (const auto& token : emptied) _sessions.erase(token);
-  return emptied;
+  for (const auto& token : dropped) _sessions.erase(token);
+  return dropped;
 }
 
 const SessionList* CorrelatedSessions::sessions(const std::string& token) const {

@@ -19,11 +19,16 @@ class CorrelatedSessions {
  public:
   using SessionList = std::vector<std::shared_ptr<ReportingdSession>>;
 
-  /// Puts the session at the end of its token's list, out of any other. Standalone sessions are not listed.
-  void add(ReportingdSession& session);
+  /// Lists that the last session left for another token stay until a session ends, but no more than this many: a
+  /// client may make up tokens for as long as it likes.
+  static constexpr std::size_t kMaximumDesertedLists = 16;
+
+  /// Puts the session at the end of its token's list, out of any other. Standalone sessions are not listed. Returns
+  /// the tokens whose deserted lists were dropped for it.
+  [[nodiscard]] std::vector<std::string> add(ReportingdSession& session);
   /// Takes the session out of the list where it stands, under whatever token. Returns the tokens that are now without
   /// sessions; they have been dropped.
-  std::vector<std::string> remove(const ReportingdSession& session);
+  [[nodiscard]] std::vector<std::string> remove(const ReportingdSession& session);
 
   /// The identifier strings of the ancestors from the root to the parent, joined by "."; those above a gap are missing.
   [[nodiscard]] std::optional<std::string> parentSessionIDString(const ReportingdSession& session) const;
@@ -39,6 +44,7 @@ class CorrelatedSessions {
                                                                                        const SessionList& sessionList);
 
  private:
+  [[nodiscard]] std::vector<std::string> dropEmptyLists();
   /// Null when the token has no list or an empty one.
   [[nodiscard]] const SessionList* sessions(const std::string& token) const;
 

@@ -156,7 +156,7 @@ void ReportingdAgent::refreshStorebags() {
 
 void ReportingdAgent::updateCorrelatedSessions(ReportingdSession& session) {
   Guard guard(_monitor);
-  _correlatedSessions.add(session);
+  for (const auto& token : _correlatedSessions.add(session)) _sharedData.drop(token);
 }
 
 std::optional<std::string> ReportingdAgent::parentSessionIDStringForSession(ReportingdSession& session) {

@@ -130,6 +130,41 @@ TEST_F(CorrelatedSessionsTest, ALevelThatAClientMadeUpCostsNoMoreThanTheSessions
   EXPECT_EQ(agent->parentSessionIDStringForSession(*deep), std::nullopt);
 }
 
+TEST_F(CorrelatedSessionsTest, MadeUpTokensAreBounded) {
+  const auto wanderer = add(0, "A");
+  agent->updateSharedDataForSession(*wanderer, {{"first", 1}});
+  constexpr std::size_t kMoves = 10 * CorrelatedSessions::kMaximumDesertedLists;
+  for (std::size_t move = 0; move < kMoves; ++move) {
+    wanderer->token = "made up " + std::to_string(move);
+    agent->updateCorrelatedSessions(*wanderer);
+    agent->updateSharedDataForSession(*wanderer, {{"move", move}});
+    ASSERT_LE(integerValue(agent->copyStatus().find("hierarchies")), CorrelatedSessions::kMaximumDesertedLists + 1);
+  }
+  EXPECT_EQ(agent->sharedDataForSession(*wanderer), (PropertyDictionary{{"move", kMoves - 1}}));
+  wanderer->token = "tree";
+  EXPECT_EQ(agent->sharedDataForSession(*wanderer), std::nullopt) << "dropped with its deserted hierarchy";
+}
+
+TEST_F(CorrelatedSessionsTest, ASessionThatComesBackFindsItsSharedData) {
+  const auto wanderer = add(0, "A");
+  agent->updateSharedDataForSession(*wanderer, {{"first", 1}});
+  wanderer->token = "elsewhere";
+  agent->updateCorrelatedSessions(*wanderer);
+  wanderer->token = "tree";
+  agent->updateCorrelatedSessions(*wanderer);
+  EXPECT_EQ(agent->sharedDataForSession(*wanderer), (PropertyDictionary{{"first", 1}}));
+}
+
+TEST_F(CorrelatedSessionsTest, AParentThatClosesUpdatesNoChild) {
+  const auto root = add(0, "A", true);
+  const auto child = add(1, "B");
+  const auto grandchild = add(2, "C");
+  agent->invalidateReportingSession(root);
+  EXPECT_TRUE(child->calls.empty());
+  EXPECT_TRUE(grandchild->calls.empty());
+  EXPECT_EQ(agent->getAncestorWithAggregatorForSession(*grandchild), nullptr);
+}
+
 TEST_F(CorrelatedSessionsTest, UpdatesEveryDeeperSessionDownstream) {
   const auto root = add(0, "A");
   const auto sibling = add(0, "A2");
@@ -153,6 +188,20 @@ TEST_F(CorrelatedSessionsTest, LeavesTheTopmostAggregatorAlone) {
   EXPECT_EQ(root->calls.size(), 2U);
   EXPECT_EQ(child->calls.back(), "shutdownSessionAggregation");
   EXPECT_EQ(grandchild->calls.back(), "syncReportingStates");
+}
+
+TEST_F(CorrelatedSessionsTest, ASessionThatDoesNotAggregateLeavesDeeperAggregatorsAlone) {
+  const auto root = add(0, "A");
+  const auto child = add(1, "B", true);
+  agent->updateDownstreamSessions(*root);
+  EXPECT_EQ(child->calls, (std::vector<std::string>{"updateCombinedSessionID", "syncReportingStates"}));
+}
+
+TEST_F(CorrelatedSessionsTest, ARootIsNotShutDownForAnotherRoot) {
+  add(0, "A", true);
+  const auto second = add(0, "A2", true);
+  agent->updateDownstreamSessions(*second);
+  EXPECT_EQ(second->calls, (std::vector<std::string>{"updateCombinedSessionID", "syncReportingStates"}));
 }
 
 TEST_F(CorrelatedSessionsTest, AnAggregatingAncestorShutsTheWholeBranchDown) {
