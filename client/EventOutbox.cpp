@@ -28,7 +28,7 @@ std::size_t estimatedSize(const PropertyDictionary& message) {
   return size;
 }
 
-bool EventOutbox::reserve(std::size_t size) noexcept {
+bool EventRoom::reserve(std::size_t size) noexcept {
   const std::size_t events = _events.fetch_add(1, std::memory_order_relaxed) + 1;
   const std::size_t bytes = _bytes.fetch_add(size, std::memory_order_relaxed) + size;
   if (events <= kMaximumEvents && bytes <= kMaximumBytes) return true;
@@ -37,7 +37,7 @@ bool EventOutbox::reserve(std::size_t size) noexcept {
   return false;
 }
 
-void EventOutbox::release(std::size_t size) noexcept {
+void EventRoom::release(std::size_t size) noexcept {
   _events.fetch_sub(1, std::memory_order_relaxed);
   _bytes.fetch_sub(size, std::memory_order_relaxed);
 }

@@ -13,22 +13,46 @@ VelkReportingAggregationObject::VelkReportingAggregationObject(VelkReportingAggr
   }
 }
 
+bool VelkReportingAggregationObject::Event::endsAggregation() const {
+  return !sessionInfo && !payload && timestamp == 0 && category == 0 && type == 0;
+}
+
+std::size_t VelkReportingAggregationObject::Event::size() const {
+  return (sessionInfo ? estimatedSize(*sessionInfo) : 0) + (payload ? estimatedSize(*payload) : 0);
+}
+
 void VelkReportingAggregationObject::sendMessageToClient(std::optional<PropertyDictionary> sessionInfo,
                                                          double timestamp, std::uint16_t category, std::uint16_t type,
                                                          std::optional<PropertyDictionary> payload) {
   log::standard(texts::kSendMessageToClient, category, type);
   if (!hasAggregationBlock()) return;
-  _callbackQueue->async([self = shared_from_this(), sessionInfo = std::move(sessionInfo), timestamp, category, type,
-                         payload = std::move(payload)] {
-    const SharedBlock current = self->block();
-    if (!current) return;
-    try {
-      (*current)(sessionInfo, timestamp, category, type, payload);
-    } catch (...) {  // the client's own code: whatever it throws must not end its process
-      log::standard(texts::kAggregationBlockThrew);
-      self->releaseAggregationBlock();
+  Event event{std::move(sessionInfo), timestamp, category, type, std::move(payload)};
+  // The end needs no room, so that it is heard however far behind the block is; one of them is enough.
+  const bool ends = event.endsAggregation();
+  const std::size_t size = event.size();
+  if (ends ? _endIsWaiting.exchange(true) : !_waiting.reserve(size)) return;
+  _callbackQueue->async([self = shared_from_this(), event = std::move(event), ends, size] {
+    if (ends) {
+      self->_endIsWaiting = false;
+    } else {
+      self->_waiting.release(size);
     }
+    self->runBlock(event);
   });
+}
+
+void VelkReportingAggregationObject::runBlock(const Event& event) {
+  const SharedBlock current = block();
+  if (!current) return;
+  try {
+    (*current)(event.sessionInfo, event.timestamp, event.category, event.type, event.payload);
+  } catch (...) {  // the client's own code: whatever it throws must not end its process
+    log::standard(texts::kAggregationBlockThrew);
+    releaseAggregationBlock();
+  }
+  if (const std::size_t lost = _waiting.takeOverflowCount()) {
+    log::error("sendMessageToClient: %u events were dropped: the aggregation block is slower than they come", lost);
+  }
 }
 
 bool VelkReportingAggregationObject::hasAggregationBlock() const { return block() != nullptr; }
