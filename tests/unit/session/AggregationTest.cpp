@@ -94,6 +94,83 @@ TEST_F(AggregationTest, EventThatBackendsDropIsStillAggregated) {
   EXPECT_EQ(backend("korrin").sent.size(), 1U);
 }
 
+/// Looks, at each event that it is handed, at what a backend has seen so far.
+class WatchingConnection : public FakeConnection {
+ public:
+  Result<void> sendMessageToClient(const std::optional<PropertyDictionary>& sessionInfo, double timestamp,
+                                   std::uint16_t category, std::uint16_t type,
+                                   const std::optional<PropertyDictionary>& payload) override {
+    if (look) seenByBackend.push_back(look());
+    return FakeConnection::sendMessageToClient(sessionInfo, timestamp, category, type, payload);
+  }
+  std::function<std::size_t()> look;
+  std::vector<std::size_t> seenByBackend;
+};
+
+TEST_F(AggregationTest, AggregatorHearsOfAnEventBeforeAnyBackend) {
+  const auto watching = std::make_shared<WatchingConnection>();
+  session = makeSession(watching);
+  start({"splunk"}, {}, std::nullopt, true);
+  watching->look = [this] { return backend("splunk").sent.size(); };
+  send(message(5, 6));
+  send(message(5, 7));
+  EXPECT_EQ(watching->seenByBackend, (std::vector<std::size_t>{0, 1}));
+}
+
+TEST_F(AggregationTest, EventThatIsNoneIsNotAggregated) {
+  start({"splunk"}, {}, std::nullopt, true);
+  forgetStartMessages();
+  send(PropertyDictionary{{kVelkReportingMessageParametersType, 1}});
+  send(PropertyDictionary{{kVelkReportingMessageParametersCategory, 1}});
+  EXPECT_TRUE(received().empty());
+}
+
+TEST_F(AggregationTest, SessionWithoutBackendsAggregatesNothing) {
+  describe({}, std::nullopt, true);
+  send(message(5, 6));
+  EXPECT_TRUE(connection->calls().empty());
+}
+
+TEST_F(AggregationTest, HealthMessagesObeyListsAsCategoryZeroAndAreAggregatedAllTheSame) {
+  prepareBackend = [](FakeBackend& each) { each.setWhitelist(numbers({5})); };
+  start({"splunk"}, {}, std::nullopt, true);
+  forgetStartMessages();
+  session->teardown();
+  EXPECT_TRUE(backend("splunk").sent.empty());
+  EXPECT_EQ(recordedLog.count("sendMessageWithDictionary: Dropping event with category 0 as it is not whitelisted for "
+                              "backend splunk"),
+            2)
+      << "the start message was the first";
+  ASSERT_EQ(received().size(), 2U);
+  EXPECT_EQ(received()[0].type, 1);
+  EXPECT_TRUE(received()[1].isEndMarker());
+}
+
+TEST_F(AggregationTest, EndThatDoesNotFitIsLoggedAndStillAnEnd) {
+  start({"splunk"}, {}, std::nullopt, true);
+  connection->full = true;
+  session->shutdownSessionAggregation();
+  EXPECT_EQ(recordedLog.count("sendMessageWithDictionary: Failed to get remote object proxy: outbox full"), 1);
+  EXPECT_FALSE(session->hasAggregator());
+  connection->full = false;
+  forgetStartMessages();
+  send(message(5, 6));
+  EXPECT_TRUE(received().empty());
+}
+
+TEST_F(AggregationTest, ClearedAggregatorStaysClearedWhenItsAncestorIsGone) {
+  describe(level(0), std::nullopt, true);
+  delegate.ancestor = session;
+  session = makeSession(childConnection);
+  start({"splunk"}, level(1), std::nullopt, true);
+  session->shutdownSessionAggregation();
+  delegate.ancestor = nullptr;
+  const auto before = childConnection->calls().size();
+  fetchStates(userNamed("New", "Name"));
+  send(message(5, 6));
+  EXPECT_EQ(childConnection->calls().size(), before);
+}
+
 TEST_F(AggregationTest, StartAndHealthMessagesAreAggregated) {
   serveBackends({});
   describe({}, std::nullopt, true);
