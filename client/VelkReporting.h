@@ -18,22 +18,15 @@
 #include <optional>
 #include <string>
 
+#include "client/UpdateAndReportServices.h"
+#include "client/VelkReportingMessageSentDelegate.h"
 #include "foundation/ErrorValue.h"
 #include "foundation/Export.h"
 #include "foundation/PropertyValue.h"
 
 namespace velk {
 
-class VelkReporting;
 class VelkReportingImplementation;
-
-/// Hears of every valid message that a client hands over, filtered or not. Called in order, on the library's threads.
-class VelkReportingMessageSentDelegate {
- public:
-  virtual ~VelkReportingMessageSentDelegate() = default;
-  virtual void didSendMessageForReportingClient(const std::shared_ptr<VelkReporting>& client,
-                                                const PropertyDictionary& event) = 0;
-};
 
 /// Session info of the client that an event came from (absent in the call that ends the aggregation), time in seconds
 /// since 1970, category, type, payload with the sender's user info merged in. One that throws is never called again.
@@ -101,6 +94,30 @@ class VELK_EXPORT VelkReporting : public std::enable_shared_from_this<VelkReport
   bool uploadDataArray(const std::optional<PropertyArray>& logData, UploadCallback completionHandler);
   /// The key of the digest that goes with each post of the "qrs" backend. False without a key.
   bool setDigestKey(const std::optional<ByteData>& digestKey, std::uint32_t algorithm);
+
+  // Periodic tasks: while the log timer runs, each tick asks the modules that want it to update their measurements;
+  // each tick of number `reportingMultiplier` asks the reporting modules for statistics instead, merges these and sends
+  // them as one realtime event. Callbacks run in parallel, at most four at once, on threads that exist only while they
+  // are needed; calls that are made during a tick reach the daemon after it, so a slow module delays them.
+
+  /// Registers a module, in place of an earlier registration under its number; a tick that has begun does not know it
+  /// yet. False without a callback, and (with an error line) beyond 4,096 modules. What the callback owns ends once,
+  /// after its last call, never on the library's permanent thread: when the module is replaced or unregistered, or with
+  /// the client, at the latest as soon as calls that have begun are over.
+  bool registerPeriodicTaskForModule(std::uint32_t module, bool needToUpdate, bool needToReport,
+                                     VelkReportingServiceBlock serviceBlock);
+  /// Always true, also for a module that is not registered. Waits until the tick that has begun is over: the module's
+  /// callback does not run after this returned, and what it owns has ended. Called from a callback of one of this
+  /// client's modules it does not wait, and the tick may still call the module once; do not let such a callback wait
+  /// for another thread that unregisters.
+  bool unregisterPeriodTaskForModule(std::uint32_t module);
+  /// Ticks at once, and then every `interval` seconds; ticks that are missed while one takes long are made up for by
+  /// one. With a multiplier of 0 there are only updates. Does nothing when the timer runs already, nor, with an error
+  /// line, for an interval of 0. Stops by itself with the client.
+  void startLogTimerWithInterval(std::uint32_t interval, std::uint32_t reportingMultiplier, std::uint16_t category,
+                                 std::uint16_t type);
+  /// No tick begins after calls that are made from here on; does not wait for one that has begun.
+  void stopLogTimer();
 
   // Services that need no client object.
 
