@@ -1,0 +1,275 @@
+/* The C interface of the reporting library. Compiles as C11 and as C++; link with libvelkreporting.
+ *
+ *   VelkReportingValue *session = VelkReportingDictionaryCreateFromJSON(
+ *       "{\"ComponentType\": 9, \"ClientVersion\": 3, \"SessionID\": 1, \"BatchEvents\": true}", NULL);
+ *   VelkReportingValue *user = VelkReportingDictionaryCreateFromJSON("{\"_clientName\": \"Sampler\"}", NULL);
+ *   VelkReportingClient *client = VelkReportingClientCreate(session, user, NULL);
+ *   VelkReportingClientStartConfiguration(client, NULL, NULL, NULL);
+ *   VelkReportingSendMessageWithError(client, 2, 1, payload, NULL);
+ *   VelkReportingClientRelease(client);
+ *
+ * Handles. Functions with Create, Copy or New in their name answer a handle that the caller owns and releases, once;
+ * Retain adds an owner, Release takes one away. Handles given to a function stay the caller's. Null handles are
+ * allowed everywhere: nothing happens, and the answer is false, 0 or null; an error out-parameter stays untouched.
+ *
+ * Errors. An out-parameter `error` may be null. Otherwise it is set to null, or to an error that the caller owns and
+ * releases: look at it even when the answer is true (VelkReportingSendMessageWithError says why).
+ *
+ * Callbacks. A callback comes with a `context`, handed back to it as it is, and a `destroy` function for that context;
+ * callback, context and destroy may each be null. Callbacks run on threads of the library that are there only while
+ * they are needed, never on the calling thread and never before the daemon answered or proved to be away. They may
+ * block, and may call any function here. What they are given is borrowed: it is gone when they return, unless they
+ * retain it. `destroy` is called exactly once, after the last use of the context, also when the callback is never
+ * called: on a thread of the library or, when there is nothing to wait for, on the calling thread. A callback must not
+ * throw; only an aggregation callback may, and is then never called again.
+ *
+ * Threads. Any thread may call any function on clients and errors. A value is used by one thread at a time while one
+ * of them changes it. No function waits for the daemon but the last VelkReportingClientRelease, within a bound.
+ * In a child made by fork(), clients of the parent do nothing. */
+#pragma once
+
+#include <stdbool.h>
+#include <stddef.h>
+#include <stdint.h>
+
+#include "client/VelkReportingKeys.h"
+#include "foundation/Export.h"
+
+#ifdef __cplusplus
+extern "C" {
+#endif
+
+typedef struct VelkReportingClient VelkReportingClient;
+typedef struct VelkReportingError VelkReportingError;
+/* A property value: a dictionary, an array, or what they hold. */
+typedef struct VelkReportingValue VelkReportingValue;
+
+/* Ends a callback's context; see above. */
+typedef void (*VelkReportingDestroyFunction)(void* context);
+
+/* ---- Errors ---- */
+
+/* Codes in kVelkReportingErrorDomain. The daemon's own errors are -1 or a status of HTTP. */
+enum {
+  kVelkReportingErrorNoSessionInfo = 2,
+  kVelkReportingErrorInvalidClientType = 3, /* outside 5 to 30 */
+  kVelkReportingErrorInvalidCategory = 4,   /* 0, after cutting to 16 bits */
+  kVelkReportingErrorMissingParameter = 7,  /* no "ParametersCategory" or no "ParametersType" */
+  kVelkReportingErrorOutboxFull = 8,        /* the daemon is away or slow, and the event was not taken */
+  kVelkReportingErrorForkedChild = 9,       /* the client belongs to the parent of this process */
+  kVelkReportingErrorWrongType = 10,        /* an argument is no dictionary where one is needed */
+  kVelkReportingErrorInvalidJSON = 11       /* text that is no JSON, or a value that has no form in it */
+};
+
+/* Adds an owner; answers `error`. */
+VELK_EXPORT VelkReportingError* VelkReportingErrorRetain(VelkReportingError* error);
+VELK_EXPORT void VelkReportingErrorRelease(VelkReportingError* error);
+/* Texts are the error's and last as long as it does. The description is empty where there is none. */
+VELK_EXPORT const char* VelkReportingErrorGetDomain(const VelkReportingError* error);
+VELK_EXPORT int32_t VelkReportingErrorGetCode(const VelkReportingError* error);
+VELK_EXPORT const char* VelkReportingErrorGetDescription(const VelkReportingError* error);
+/* A new dictionary: the description under "description", or nothing. */
+VELK_EXPORT VelkReportingValue* VelkReportingErrorCopyUserInfo(const VelkReportingError* error);
+
+/* ---- Values ---- */
+
+typedef enum {
+  kVelkReportingValueTypeNull = 0,
+  kVelkReportingValueTypeBoolean = 1,
+  kVelkReportingValueTypeInteger = 2,
+  kVelkReportingValueTypeUnsignedInteger = 3, /* only what does not fit into a signed one */
+  kVelkReportingValueTypeReal = 4,
+  kVelkReportingValueTypeDate = 5,
+  kVelkReportingValueTypeString = 6,
+  kVelkReportingValueTypeData = 7,
+  kVelkReportingValueTypeArray = 8,
+  kVelkReportingValueTypeDictionary = 9
+} VelkReportingValueType;
+
+/* New values; the caller owns them. Text must be UTF-8. Null for a null or malformed text, for null data of a size
+ * above 0, and when memory is short. Contents are copied. */
+VELK_EXPORT VelkReportingValue* VelkReportingValueCreateNull(void);
+VELK_EXPORT VelkReportingValue* VelkReportingValueCreateBoolean(bool value);
+VELK_EXPORT VelkReportingValue* VelkReportingValueCreateInteger(int64_t value);
+VELK_EXPORT VelkReportingValue* VelkReportingValueCreateUnsignedInteger(uint64_t value);
+VELK_EXPORT VelkReportingValue* VelkReportingValueCreateReal(double value);
+VELK_EXPORT VelkReportingValue* VelkReportingValueCreateDate(double secondsSince1970);
+VELK_EXPORT VelkReportingValue* VelkReportingValueCreateString(const char* text);
+VELK_EXPORT VelkReportingValue* VelkReportingValueCreateStringWithLength(const char* text, size_t length);
+VELK_EXPORT VelkReportingValue* VelkReportingValueCreateData(const void* bytes, size_t size);
+VELK_EXPORT VelkReportingValue* VelkReportingArrayCreate(void);
+VELK_EXPORT VelkReportingValue* VelkReportingDictionaryCreate(void);
+
+/* From JSON; dates and data stand in it as {"$date": seconds} and {"$data": "base64"}. Null, with error code 11 that
+ * names the place, for text that is no JSON, nests deeper than 64, or (Dictionary) is no object at the top. */
+VELK_EXPORT VelkReportingValue* VelkReportingValueCreateFromJSON(const char* text, VelkReportingError** error);
+VELK_EXPORT VelkReportingValue* VelkReportingDictionaryCreateFromJSON(const char* text, VelkReportingError** error);
+/* The same form, compact; the caller frees the text with VelkReportingTextFree (or free). Null, with error code 11,
+ * for a number that is not finite. */
+VELK_EXPORT char* VelkReportingValueCopyJSON(const VelkReportingValue* value, VelkReportingError** error);
+VELK_EXPORT void VelkReportingTextFree(char* text);
+
+/* Adds an owner; answers `value`. Retaining a borrowed value makes the caller an owner. */
+VELK_EXPORT VelkReportingValue* VelkReportingValueRetain(const VelkReportingValue* value);
+VELK_EXPORT void VelkReportingValueRelease(VelkReportingValue* value);
+/* A value of its own with equal contents: changes of the one are not seen in the other. */
+VELK_EXPORT VelkReportingValue* VelkReportingValueCopy(const VelkReportingValue* value);
+/* Two null handles are equal. Dictionaries are equal when they hold equal values under the same keys. */
+VELK_EXPORT bool VelkReportingValueIsEqual(const VelkReportingValue* left, const VelkReportingValue* right);
+
+/* Null handles are of type null. */
+VELK_EXPORT VelkReportingValueType VelkReportingValueGetType(const VelkReportingValue* value);
+/* Lenient: numbers are converted (towards zero, to the nearest bound), text is read as a number from its beginning,
+ * everything else is false or 0. */
+VELK_EXPORT bool VelkReportingValueGetBoolean(const VelkReportingValue* value);
+VELK_EXPORT int64_t VelkReportingValueGetInteger(const VelkReportingValue* value);
+VELK_EXPORT double VelkReportingValueGetReal(const VelkReportingValue* value);
+/* Strict: 0 for a value of another type or, for the first, below 0. */
+VELK_EXPORT uint64_t VelkReportingValueGetUnsignedInteger(const VelkReportingValue* value);
+VELK_EXPORT double VelkReportingValueGetDate(const VelkReportingValue* value);
+/* Strict: null for a value of another type. The text (with a zero behind it) and the bytes are the value's: they last
+ * until it is changed or released. `length` and `size`, when not null, are set, to 0 with a null answer. */
+VELK_EXPORT const char* VelkReportingValueGetString(const VelkReportingValue* value, size_t* length);
+VELK_EXPORT const void* VelkReportingValueGetData(const VelkReportingValue* value, size_t* size);
+
+/* Arrays. A value is copied into the array. False, and nothing changes, when `array` is no array, `value` is null,
+ * the result would nest deeper than 64, or memory is short. */
+VELK_EXPORT bool VelkReportingArrayAppend(VelkReportingValue* array, const VelkReportingValue* value);
+VELK_EXPORT size_t VelkReportingArrayGetCount(const VelkReportingValue* array);
+/* The caller owns the answer; changes of it are not seen in the array. Null beyond the end. */
+VELK_EXPORT VelkReportingValue* VelkReportingArrayCopyValue(const VelkReportingValue* array, size_t index);
+
+/* Dictionaries keep the order of insertion. A value is copied into the dictionary and replaces what was under the key.
+ * False, and nothing changes, when `dictionary` is no dictionary, the key or value is null, key or text is not UTF-8,
+ * the result would nest deeper than 64, or memory is short. */
+VELK_EXPORT bool VelkReportingDictionarySet(VelkReportingValue* dictionary, const char* key,
+                                            const VelkReportingValue* value);
+VELK_EXPORT bool VelkReportingDictionarySetBoolean(VelkReportingValue* dictionary, const char* key, bool value);
+VELK_EXPORT bool VelkReportingDictionarySetInteger(VelkReportingValue* dictionary, const char* key, int64_t value);
+VELK_EXPORT bool VelkReportingDictionarySetReal(VelkReportingValue* dictionary, const char* key, double value);
+VELK_EXPORT bool VelkReportingDictionarySetString(VelkReportingValue* dictionary, const char* key, const char* text);
+/* False when there was nothing under the key. */
+VELK_EXPORT bool VelkReportingDictionaryRemove(VelkReportingValue* dictionary, const char* key);
+VELK_EXPORT size_t VelkReportingDictionaryGetCount(const VelkReportingValue* dictionary);
+/* Null beyond the end. The text is the dictionary's and lasts until that is changed or released. */
+VELK_EXPORT const char* VelkReportingDictionaryGetKey(const VelkReportingValue* dictionary, size_t index);
+/* The caller owns the answer; changes of it are not seen in the dictionary. Null when there is nothing. */
+VELK_EXPORT VelkReportingValue* VelkReportingDictionaryCopyValue(const VelkReportingValue* dictionary, const char* key);
+/* As VelkReportingValueGetInteger, ...GetBoolean, ...GetReal and ...GetString of the value under the key. */
+VELK_EXPORT bool VelkReportingDictionaryGetBoolean(const VelkReportingValue* dictionary, const char* key);
+VELK_EXPORT int64_t VelkReportingDictionaryGetInteger(const VelkReportingValue* dictionary, const char* key);
+VELK_EXPORT double VelkReportingDictionaryGetReal(const VelkReportingValue* dictionary, const char* key);
+VELK_EXPORT const char* VelkReportingDictionaryGetString(const VelkReportingValue* dictionary, const char* key);
+
+/* ---- Creating a client ---- */
+
+/* The names of the backends that are enabled (an array of text), or null when the daemon could not be asked. */
+typedef void (*VelkReportingStatesCallback)(const VelkReportingValue* enabledBackends, void* context);
+/* An event of this client or of a session below it: session info of its client (null, with everything else null or 0,
+ * in the call that ends the aggregation), time in seconds since 1970, category, type, payload with the sender's user
+ * info merged in. Called in order, one at a time. */
+typedef void (*VelkReportingAggregationCallback)(const VelkReportingValue* client, double timestamp, uint16_t category,
+                                                 uint16_t type, const VelkReportingValue* payload, void* context);
+
+/* A client for this session info and user info (dictionaries; user info may be null) and the names of frameworks that
+ * are handed to the daemon (an array of text, or null). The caller owns it. The daemon need not be running. Null, and
+ * a line in the log, without session info, with a client type outside 5 to 30, or with an "EnableFlag" of 0. */
+VELK_EXPORT VelkReportingClient* VelkReportingClientCreate(const VelkReportingValue* sessionInfo,
+                                                           const VelkReportingValue* userInfo,
+                                                           const VelkReportingValue* frameworksToCheck);
+/* The same, with a callback that is handed the client's events and those of the sessions below it in its hierarchy.
+ * Without a callback it is VelkReportingClientCreate. The context ends with the client. */
+VELK_EXPORT VelkReportingClient* VelkReportingClientCreateWithAggregation(const VelkReportingValue* sessionInfo,
+                                                                          const VelkReportingValue* userInfo,
+                                                                          const VelkReportingValue* frameworksToCheck,
+                                                                          VelkReportingAggregationCallback callback,
+                                                                          void* context,
+                                                                          VelkReportingDestroyFunction destroy);
+/* Has the daemon build the session's backends: once, before events are sent. The callback hears which are enabled. */
+VELK_EXPORT void VelkReportingClientStartConfiguration(VelkReportingClient* client,
+                                                       VelkReportingStatesCallback callback, void* context,
+                                                       VelkReportingDestroyFunction destroy);
+/* Adds an owner; answers `client`. */
+VELK_EXPORT VelkReportingClient* VelkReportingClientRetain(VelkReportingClient* client);
+/* The last owner's release sends what is queued (for at most a second), finishes the session and closes the
+ * connection. It may be called from a callback of the client itself. */
+VELK_EXPORT void VelkReportingClientRelease(VelkReportingClient* client);
+
+/* ---- Reporting ---- */
+
+/* Gives the session a new user info (a dictionary, or null to leave it as it is) and asks which backends are enabled
+ * now. */
+VELK_EXPORT void VelkReportingFetchStatesWithUserInfo(VelkReportingClient* client, const VelkReportingValue* userInfo,
+                                                      VelkReportingStatesCallback callback, void* context,
+                                                      VelkReportingDestroyFunction destroy);
+
+/* The text of each message that left, and the address at which reports can be viewed; in order, one at a time. */
+typedef void (*VelkReportingMessageCallback)(const char* text, void* context);
+/* Replaces the callback of before, whose context is then destroyed; a null callback ends it. The context ends with the
+ * client at the latest. */
+VELK_EXPORT void VelkReportingSetMessageBlock(VelkReportingClient* client, VelkReportingMessageCallback callback,
+                                              void* context, VelkReportingDestroyFunction destroy);
+
+/* Sends an event; `payload` is a dictionary or null. Never blocks. False for category 0 (code 4), and for a payload
+ * that is no dictionary (10). True otherwise, even when the storebag filters the event, then without an error, and when
+ * it was not taken: then with an error (8 or 9), which the caller releases like any other. */
+VELK_EXPORT bool VelkReportingSendMessageWithError(VelkReportingClient* client, uint16_t category, uint16_t type,
+                                                   const VelkReportingValue* payload, VelkReportingError** error);
+/* Sends an event given as a message dictionary. Never blocks. False without an error when the storebag filters it;
+ * false with one for a missing category or type (code 7, without a text), category 0 (4), when it was not taken (8, 9),
+ * and for a message that is no dictionary (10). */
+VELK_EXPORT bool VelkReportingSendMessageWithDictionary(VelkReportingClient* client, const VelkReportingValue* message,
+                                                        VelkReportingError** error);
+
+/* Has the daemon post what it batched for this session. */
+VELK_EXPORT void VelkReportingFlushMessages(VelkReportingClient* client);
+/* Why it failed, or null. */
+typedef void (*VelkReportingFlushCallback)(const VelkReportingError* error, void* context);
+VELK_EXPORT void VelkReportingFlushMessagesWithCompletion(VelkReportingClient* client,
+                                                          VelkReportingFlushCallback callback, void* context,
+                                                          VelkReportingDestroyFunction destroy);
+/* Marks the session as finished gracefully. Overtakes what is still queued, and awaits nothing. */
+VELK_EXPORT void VelkReportingClientFinishSession(VelkReportingClient* client);
+
+/* Data that the sessions of one hierarchy share: it travels with the events of all of them. */
+VELK_EXPORT void VelkReportingUpdateSharedDataWithDictionary(VelkReportingClient* client,
+                                                             const VelkReportingValue* dictionary);
+/* A null value removes the key. */
+VELK_EXPORT void VelkReportingUpdateSharedDataForKey(VelkReportingClient* client, const char* key,
+                                                     const VelkReportingValue* value);
+
+/* Uploads log data, an array of dictionaries. True: handed over. False for an empty array and for no array. */
+VELK_EXPORT bool VelkReportingUploadLogWithArray(VelkReportingClient* client, const VelkReportingValue* logData);
+typedef void (*VelkReportingUploadCallback)(bool uploaded, void* context);
+/* Uploads a file (a path or a file URL): opened here, with the caller's rights, without following links. True: handed
+ * over, and the callback hears how it ended, unless the daemon went away meanwhile. False when it cannot be opened. */
+VELK_EXPORT bool VelkReportingClientUploadFile(VelkReportingClient* client, const char* path,
+                                               VelkReportingUploadCallback callback, void* context,
+                                               VelkReportingDestroyFunction destroy);
+/* Whether the daemon said that files may be uploaded. */
+VELK_EXPORT bool VelkReportingClientServerSupportsFileUpload(VelkReportingClient* client);
+/* The key of the digest that goes with each post of the "qrs" backend. False without a key. */
+VELK_EXPORT bool VelkReportingClientSetDigestKey(VelkReportingClient* client, const void* key, size_t size,
+                                                 uint32_t algorithm);
+
+/* ---- Without a client ---- */
+
+/* A token for a session below that of `parentToken` (null: a new root of level 0), for the session info. The caller
+ * owns it. Null when the parent is no dictionary or has no "token". The two names are synonyms. */
+VELK_EXPORT VelkReportingValue* VelkReportingNewHierarchyTokenFromParentToken(const VelkReportingValue* parentToken);
+VELK_EXPORT VelkReportingValue* VelkReportingCreateHierarchyTokenFromParentToken(const VelkReportingValue* parentToken);
+
+/* Reports a single event. True: it was taken; delivery is not reported. False, with an error: 2, 3, 4, 10, or 8 when
+ * too many are waiting. */
+VELK_EXPORT bool VelkReportingSendOneMessage(const VelkReportingValue* sessionInfo, const VelkReportingValue* userInfo,
+                                             uint16_t category, uint16_t type, const VelkReportingValue* payload,
+                                             VelkReportingError** error);
+
+/* A random identifier of this user that lasts until it is regenerated: one for use while the user's consent to
+ * diagnostics and usage data is respected, one for use regardless of it. Freed with VelkReportingTextFree. */
+VELK_EXPORT char* VelkReportingCopyPersistentIdentifier(bool respectConsent);
+VELK_EXPORT void VelkReportingRegeneratePersistentIdentifier(bool respectConsent);
+
+#ifdef __cplusplus
+}
+#endif
