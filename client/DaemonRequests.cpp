@@ -82,7 +82,7 @@ void VelkReportingImplementation::fetchDisplayURL(const std::shared_ptr<Connecti
 void VelkReportingImplementation::fetchReportingStates(const std::optional<PropertyDictionary>& userInfo,
                                                        VelkReporting::StatesCallback fetchComplete) {
   const auto connection = _link->connect();
-  if (userInfo) _link->description().userInfo = userInfo;
+  _link->description().receiveUserInfo(userInfo);
   const SharedCallback<const std::optional<PropertyArray>&> onError(_runtime, fetchComplete);
   const auto failed = [onError](const Error& error) {
     log::standard(texts::kFetchStatesProxyFailure, error);

@@ -1,11 +1,13 @@
 #include "client/SessionLink.h"
 
 #include <algorithm>
+#include <utility>
 
 #include "client/ClientRuntime.h"
 #include "client/DaemonConnection.h"
 #include "client/EventLists.h"
 #include "client/LogTexts.h"
+#include "ipc/Vocabulary.h"
 #include "platform/Log.h"
 
 namespace velk {
@@ -13,9 +15,20 @@ namespace velk {
 namespace {
 
 constexpr Duration kFirstPause = std::chrono::milliseconds(100);
+/// Of somebody who has something to say.
 constexpr Duration kLongestPause = std::chrono::seconds(10);
+/// Of somebody who only wants to be known: a device without a daemon is not kept awake.
+constexpr Duration kLongestQuietPause = std::chrono::minutes(5);
+/// A connection that ends sooner was not wanted: this session is one too many, or the daemon cannot live.
+constexpr Duration kFairLife = std::chrono::seconds(1);
 
 }  // namespace
+
+void SessionDescription::receiveUserInfo(const std::optional<PropertyDictionary>& newUserInfo) {
+  const PropertyValue* required = sessionInfo.find(kVelkReportingSessionInfoRequireUserInfo);
+  // None takes the place of one only where none is required.
+  if (newUserInfo || (required != nullptr && !booleanValue(required))) userInfo = newUserInfo;
+}
 
 SessionLink::SessionLink(ClientRuntime& runtime, std::shared_ptr<Queue> queue, SessionDescription description,
                          std::shared_ptr<ClientSessionReplyInterface> exported,
@@ -34,17 +47,31 @@ void SessionLink::open(std::function<void()> whenInterrupted) {
 std::shared_ptr<Connection> SessionLink::connect() {
   auto connection = current();
   if (connection && !connection->hasEnded()) return connection;
+  if (connection) forgetConnection();
   if (_isClosed || pauseLeft() > Duration::zero()) return nullptr;
   connection = makeConnection();
   if (!connection) {
-    _pause = std::clamp(2 * _pause, kFirstPause, kLongestPause);
-    _nextAttempt = _runtime.loop().clock().steadyTime() + _pause;
+    growPause();
     return nullptr;
   }
-  _pause = Duration::zero();
+  _connectedAt = now();
   setCurrent(connection);
   describeSession(connection);
   return connection;
+}
+
+SteadyTime SessionLink::now() const { return _runtime.loop().clock().steadyTime(); }
+
+void SessionLink::forgetConnection() {
+  setCurrent(nullptr);
+  if (now() - _connectedAt < kFairLife) return growPause();
+  _pause = Duration::zero();
+  _quietPause = Duration::zero();
+}
+
+void SessionLink::growPause() {
+  _pause = std::clamp(2 * _pause, kFirstPause, kLongestPause);
+  _nextAttempt = now() + _pause;
 }
 
 std::shared_ptr<Connection> SessionLink::current() const {
@@ -59,7 +86,7 @@ void SessionLink::setCurrent(std::shared_ptr<Connection> connection) {
 
 Duration SessionLink::pauseLeft() const {
   if (_pause == Duration::zero()) return Duration::zero();
-  return std::max<Duration>(Duration::zero(), _nextAttempt - _runtime.loop().clock().steadyTime());
+  return std::max<Duration>(Duration::zero(), _nextAttempt - now());
 }
 
 std::shared_ptr<Connection> SessionLink::makeConnection() {
@@ -75,7 +102,10 @@ std::shared_ptr<Connection> SessionLink::makeConnection() {
   }
   const std::shared_ptr<Connection> connection = std::move(*made);
   connection->setExportedDispatcher(std::make_shared<ReplyInterfaceDispatcher>(_exported));
-  connection->setInvalidationHandler([] { log::standard(texts::kConnectionInvalidated); });
+  connection->setInvalidationHandler([self = weak_from_this(), invalidated = std::weak_ptr(connection)] {
+    log::standard(texts::kConnectionInvalidated);
+    if (const auto link = self.lock()) link->wasInvalidated(invalidated);
+  });
   connection->setInterruptionHandler([self = weak_from_this(), interrupted = std::weak_ptr(connection)] {
     log::standard(texts::kConnectionInterrupted);
     if (const auto link = self.lock()) link->wasInterrupted(interrupted);
@@ -88,22 +118,48 @@ void SessionLink::describeSession(const std::shared_ptr<Connection>& connection)
   SessionInterfaceProxy proxy(connection, loggingHandler(texts::kInitProxyFailure));
   proxy.setSessionInfo(_description.sessionInfo, _description.userInfo, _description.frameworksToCheck,
                        _description.hasAggregationBlock);
+  if (_description.isConfigured) {
+    proxy.startConfigWithCompletionHandler([lists = _lists](const std::optional<PropertyArray>& enabled,
+                                                            const std::optional<PropertyArray>& whitelist,
+                                                            const std::optional<PropertyArray>& blacklist) {
+      lists->replace(std::make_shared<const EventLists>(enabled, whitelist, blacklist));
+      log::standard(texts::kCachedLists, enabled ? enabled->size() : 0, whitelist, blacklist);
+    });
+  }
+  // Backends take a digest key when it arrives, and are made by the configuration.
   if (_description.digestKey) proxy.setDigestKey(*_description.digestKey, _description.digestAlgorithm);
-  if (!_description.isConfigured) return;
-  proxy.startConfigWithCompletionHandler([lists = _lists](const std::optional<PropertyArray>& enabled,
-                                                          const std::optional<PropertyArray>& whitelist,
-                                                          const std::optional<PropertyArray>& blacklist) {
-    lists->replace(std::make_shared<const EventLists>(enabled, whitelist, blacklist));
-    log::standard(texts::kCachedLists, enabled ? enabled->size() : 0, whitelist, blacklist);
-  });
 }
 
 void SessionLink::wasInterrupted(const std::weak_ptr<Connection>& connection) {
   const auto interrupted = connection.lock();
   if (!interrupted) return;
   interrupted->invalidate();  // drops its handlers
-  if (current() == interrupted) setCurrent(nullptr);
+  if (current() == interrupted) forgetConnection();
   _whenInterrupted();
+  reconnectLater();
+}
+
+// Ends that were asked for here, and interruptions, need nothing more.
+void SessionLink::wasInvalidated(const std::weak_ptr<Connection>& connection) {
+  const auto invalidated = connection.lock();
+  if (!invalidated) return;
+  const auto end = invalidated->end();
+  if (end != Connection::End::goodbye && end != Connection::End::badFrame) return;
+  if (current() == invalidated) forgetConnection();
+  _whenInterrupted();
+  reconnectLater();
+}
+
+// Even when there is nothing to say: this session's relatives need it, and its aggregation block listens.
+void SessionLink::reconnectLater() {
+  if (_isClosed || std::exchange(_reconnects, true)) return;
+  _quietPause = std::clamp(2 * _quietPause, kFirstPause, kLongestQuietPause);
+  _queue->asyncAfter(std::max(_quietPause, pauseLeft()), [self = weak_from_this()] {
+    const auto link = self.lock();
+    if (!link) return;
+    link->_reconnects = false;
+    if (!link->connect()) link->reconnectLater();
+  });
 }
 
 void SessionLink::close() {

@@ -1,7 +1,7 @@
-// A client's link to its session in the daemon: connects at first use, and again after the daemon went away. To each
-// connection the session is described with all that has been said of it so far: its description with the latest user
-// info, the digest key, and its configuration if it was asked for, even while no daemon was there to hear of it. Other
-// calls that were already written are not made again.
+// A client's link to its session in the daemon: connects at first use, and again after the daemon went away, whether or
+// not there is something to say. To each connection the session is described with all that has been said of it so far,
+// even while no daemon was there to hear of it: its description with the latest user info, its configuration if it was
+// asked for, the digest key. Other calls that were already written are not made again.
 //
 // All methods run on the client's reporting queue, except where they say otherwise. Owned by the implementation.
 #pragma once
@@ -30,6 +30,9 @@ struct SessionDescription {
   PropertyArray frameworksToCheck;
   bool hasAggregationBlock = false;
 
+  /// Keeps what a daemon that is asked for its states with this user info holds afterwards.
+  void receiveUserInfo(const std::optional<PropertyDictionary>& newUserInfo);
+
   bool isConfigured = false;
   std::optional<ByteData> digestKey;
   std::int32_t digestAlgorithm = 0;
@@ -42,11 +45,12 @@ class SessionLink : public std::enable_shared_from_this<SessionLink> {
               std::shared_ptr<ClientSessionReplyInterface> exported, std::shared_ptr<CurrentEventLists> lists);
 
   /// The first connection, made on the creator's thread before anything is on the queue. Fine when nobody answers.
-  /// `whenInterrupted` runs on the queue, each time.
+  /// `whenInterrupted` runs on the queue, each time that a connection was lost.
   void open(std::function<void()> whenInterrupted);
 
-  /// A connection that works, made now if need be; null when nobody answers. After a failed attempt the next one is
-  /// made at the earliest after a pause that grows from 100 ms to 10 s.
+  /// A connection that works, made now if need be; null when nobody answers. After an attempt that failed, or a
+  /// connection that ended within a second, the next one is made at the earliest after a pause that grows from 100 ms
+  /// to 10 s.
   [[nodiscard]] std::shared_ptr<Connection> connect();
 
   /// The connection as it is, or null. Any thread.
@@ -65,6 +69,11 @@ class SessionLink : public std::enable_shared_from_this<SessionLink> {
   [[nodiscard]] std::shared_ptr<Connection> makeConnection();
   void describeSession(const std::shared_ptr<Connection>& connection);
   void wasInterrupted(const std::weak_ptr<Connection>& connection);
+  void wasInvalidated(const std::weak_ptr<Connection>& connection);
+  void forgetConnection();
+  void growPause();
+  void reconnectLater();
+  [[nodiscard]] SteadyTime now() const;
   void setCurrent(std::shared_ptr<Connection> connection);
 
   ClientRuntime& _runtime;
@@ -79,8 +88,11 @@ class SessionLink : public std::enable_shared_from_this<SessionLink> {
   SessionDescription _description;
   std::function<void()> _whenInterrupted;
   bool _isClosed = false;
+  SteadyTime _connectedAt{};
   SteadyTime _nextAttempt{};
   Duration _pause{};
+  Duration _quietPause{};
+  bool _reconnects = false;
 };
 
 }  // namespace velk

@@ -13,8 +13,10 @@ struct FakeDaemon::State {
   std::vector<Call> calls VELK_GUARDED_BY(lock);
   std::vector<std::shared_ptr<Connection>> connections VELK_GUARDED_BY(lock);
   std::size_t accepted VELK_GUARDED_BY(lock) = 0;
+  std::size_t forgotten VELK_GUARDED_BY(lock) = 0;  ///< of those that were accepted
   std::size_t ends VELK_GUARDED_BY(lock) = 0;
   bool holds VELK_GUARDED_BY(lock) = false;
+  bool refuses VELK_GUARDED_BY(lock) = false;
   std::optional<PropertyArray> enabled VELK_GUARDED_BY(lock) = PropertyArray{"splunk"};
   std::optional<PropertyArray> whitelist VELK_GUARDED_BY(lock);
   std::optional<PropertyArray> blacklist VELK_GUARDED_BY(lock);
@@ -39,6 +41,12 @@ class FakeDaemon::Session : public ClientSessionInterface {
   void setSessionInfo(PropertyDictionary sessionInfo, std::optional<PropertyDictionary> userInfo,
                       PropertyArray frameworksToCheck, bool hasAggregationBlock) override {
     record("setSessionInfo", {sessionInfo, orNull(userInfo), frameworksToCheck, hasAggregationBlock});
+    std::shared_ptr<Connection> refused;
+    {
+      Guard guard(_state->lock);
+      if (_state->refuses) refused = _state->connections[_connection - 1 - _state->forgotten];
+    }
+    if (refused) refused->invalidate();
   }
   void startConfigWithCompletionHandler(ConfigurationReply reply) override {
     record("startConfigWithCompletionHandler", {});
@@ -169,8 +177,23 @@ void FakeDaemon::stop() {
   {
     Guard guard(_state->lock);
     _state->connections.clear();
+    _state->forgotten = _state->accepted;
   }
   _loop.reset();
+}
+
+void FakeDaemon::endConnections() {
+  std::vector<std::shared_ptr<Connection>> connections;
+  {
+    Guard guard(_state->lock);
+    connections = _state->connections;
+  }
+  for (const auto& connection : connections) connection->invalidate();
+}
+
+void FakeDaemon::refuseSessions() {
+  Guard guard(_state->lock);
+  _state->refuses = true;
 }
 
 void FakeDaemon::setConfiguration(std::optional<PropertyArray> enabled, std::optional<PropertyArray> whitelist,

@@ -32,6 +32,10 @@ class FakeDaemon {
   void start();
   /// Goes away as a crash would: connections end without a goodbye.
   void stop();
+  /// Ends every connection with a goodbye, and goes on.
+  void endConnections();
+  /// From now on every session is ended as soon as it is described.
+  void refuseSessions();
 
   /// What configuration calls answer from now on.
   void setConfiguration(std::optional<PropertyArray> enabled, std::optional<PropertyArray> whitelist,

@@ -115,7 +115,7 @@ TEST_F(LifecycleTest, TellsADaemonThatComesLaterWhatWasSaidBefore) {
   ASSERT_TRUE(_daemon.waitForCalls("sendMessageWithDictionary", 1));
   std::vector<std::string> methods;
   for (const auto& call : _daemon.calls()) methods.push_back(call.method);
-  EXPECT_EQ(methods, (std::vector<std::string>{"setSessionInfo", "setDigestKey", "startConfigWithCompletionHandler",
+  EXPECT_EQ(methods, (std::vector<std::string>{"setSessionInfo", "startConfigWithCompletionHandler", "setDigestKey",
                                                "sendMessageWithDictionary"}));
 }
 
@@ -138,9 +138,67 @@ TEST_F(LifecycleTest, ReconnectsAndDescribesTheSessionAgain) {
   for (const auto& call : _daemon.calls()) {
     if (call.connection == 2 && call.method != "flushMessagesWithCompletion") again.push_back(call.method);
   }
-  EXPECT_EQ(again, (std::vector<std::string>{"setSessionInfo", "setDigestKey", "startConfigWithCompletionHandler",
+  EXPECT_EQ(again, (std::vector<std::string>{"setSessionInfo", "startConfigWithCompletionHandler", "setDigestKey",
                                              "sendMessageWithDictionary"}));
   EXPECT_EQ(answers.load(), 1) << "callbacks do not fire twice";
+}
+
+TEST_F(LifecycleTest, ReconnectsAlthoughThereIsNothingToSay) {
+  _daemon.start();
+  auto heard = std::make_shared<Semaphore>();
+  const auto client = makeClient([heard](auto&&...) { heard->signal(); });
+  EXPECT_TRUE(configure(*client));
+  _daemon.stop();
+  _daemon.start();
+  ASSERT_TRUE(_daemon.waitForCalls("startConfigWithCompletionHandler", 2));
+  EXPECT_EQ(_daemon.count("setSessionInfo"), 2U);
+  _daemon.sendToClient(PropertyDictionary{{"SessionID", 8}}, 1, 2, 3, std::nullopt);
+  EXPECT_TRUE(heard->waitFor(kPatience));
+}
+
+TEST_F(LifecycleTest, ReconnectsAfterAGoodbyeToo) {
+  _daemon.start();
+  const auto client = makeClient();
+  ASSERT_TRUE(_daemon.waitForCalls("setSessionInfo", 1));
+  _daemon.endConnections();
+  EXPECT_TRUE(_daemon.waitForCalls("setSessionInfo", 2));
+  EXPECT_FALSE(flush(*client));
+}
+
+TEST_F(LifecycleTest, DaemonThatEndsEveryConnectionIsNotAskedForOneWithEveryCall) {
+  _daemon.refuseSessions();
+  _daemon.start();
+  const auto client = makeClient();
+  for (int call = 0; call < 1000; ++call) {
+    client->sendMessageWithCategory(1, 1);
+    flush(*client);
+  }
+  EXPECT_LT(_daemon.count("setSessionInfo"), 300U);
+}
+
+TEST_F(LifecycleTest, DescribesTheSessionWithItsLatestUserInfo) {
+  _daemon.start();
+  const auto fetch = [](VelkReporting& client, const std::optional<PropertyDictionary>& userInfo) {
+    auto answered = std::make_shared<Semaphore>();
+    client.fetchReportingStatesWithUserInfo(userInfo, [answered](const auto&) { answered->signal(); });
+    EXPECT_TRUE(answered->waitFor(kPatience));
+  };
+  const auto requiring = makeClient();
+  const auto notRequiring = VelkReporting::initWithSessionInfo(
+      PropertyDictionary{{"ComponentType", 9}, {"RequireUserDict", false}}, userInfo(), {}, nullptr);
+  for (const auto& client : {requiring, notRequiring}) {
+    fetch(*client, PropertyDictionary{{"_clientName", "Later"}});
+    fetch(*client, std::nullopt);
+  }
+  _daemon.stop();
+  _daemon.start();
+  ASSERT_TRUE(_daemon.waitForCalls("setSessionInfo", 4));
+  for (const auto& call : _daemon.calls()) {
+    if (call.method != "setSessionInfo" || call.connection <= 2) continue;
+    const bool needsNone = call.arguments[0].dictionary()->contains("RequireUserDict");
+    EXPECT_EQ(call.arguments[1],
+              needsNone ? PropertyValue() : PropertyValue(PropertyDictionary{{"_clientName", "Later"}}));
+  }
 }
 
 TEST_F(LifecycleTest, WhatCallbacksOwnMayWaitForTheLibraryWhenItEnds) {
