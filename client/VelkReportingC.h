@@ -252,6 +252,34 @@ VELK_EXPORT bool VelkReportingClientServerSupportsFileUpload(VelkReportingClient
 VELK_EXPORT bool VelkReportingClientSetDigestKey(VelkReportingClient* client, const void* key, size_t size,
                                                  uint32_t algorithm);
 
+/* ---- Periodic tasks ---- */
+
+/* While the log timer runs, each tick asks the modules that want it to update their measurements (`statistics` is
+ * null); each tick of number `reportingMultiplier` asks the reporting modules to fill in theirs instead: `statistics`
+ * is then an empty dictionary, what all modules put in is merged and sent as one realtime event. Callbacks run in
+ * parallel, at most four at once. Calls that are made during a tick reach the daemon after it, so a slow module delays
+ * them. */
+typedef void (*VelkReportingServiceCallback)(VelkReportingValue* statistics, void* context);
+/* Registers a module, in place of an earlier registration under its number. False without a callback, and beyond
+ * 4,096 modules. The context ends when the module is replaced or unregistered, or with the client, after the last call
+ * that has begun. */
+VELK_EXPORT bool VelkReportingClientRegisterPeriodicTask(VelkReportingClient* client, uint32_t module,
+                                                         bool needToUpdate, bool needToReport,
+                                                         VelkReportingServiceCallback callback, void* context,
+                                                         VelkReportingDestroyFunction destroy);
+/* True for every client, also for a module that is not registered. Waits until the tick that has begun is over: then
+ * the module's callback runs no more, and its context has been destroyed. From a callback of one of this client's
+ * modules it does not wait, and the tick may still call the module once; such a callback must not wait for another
+ * thread that unregisters. */
+VELK_EXPORT bool VelkReportingClientUnregisterPeriodicTask(VelkReportingClient* client, uint32_t module);
+/* Ticks at once, and then every `interval` seconds; missed ticks are made up for by one. With a multiplier of 0 there
+ * are only updates. Nothing happens when the timer runs already, nor (but for a line in the log) for an interval of 0.
+ * It stops with the client. */
+VELK_EXPORT void VelkReportingClientStartLogTimer(VelkReportingClient* client, uint32_t interval,
+                                                  uint32_t reportingMultiplier, uint16_t category, uint16_t type);
+/* No tick begins for calls made from here on; one that has begun is not waited for. */
+VELK_EXPORT void VelkReportingClientStopLogTimer(VelkReportingClient* client);
+
 /* ---- Without a client ---- */
 
 /* A token for a session below that of `parentToken` (null: a new root of level 0), for the session info. The caller
