@@ -39,6 +39,7 @@ class EventBatch {
   /// Sets "_sessionID" in every event.
   void setSessionID(const std::string& sessionID);
   [[nodiscard]] std::uint64_t estimatedSize() const;
+  [[nodiscard]] std::size_t count() const noexcept { return _events.size(); }
 
  private:
   std::vector<PropertyDictionary> _events;

@@ -308,4 +308,8 @@ std::uint64_t HTTPSPostBackend::batchedEventsSize() const {
   return _state.queue().sync([this] { return _batch->estimatedSize(); });
 }
 
+std::uint64_t HTTPSPostBackend::batchedEventsCount() const {
+  return _state.queue().sync([this] { return _batch->count(); });
+}
+
 }  // namespace velk

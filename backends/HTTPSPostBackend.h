@@ -37,6 +37,7 @@ class HTTPSPostBackend final : public VelkReportingBackend {
   std::optional<std::string> flushMessagesWithCompletion(BackendFlushCompletion completion) override;
   void setCorrelatedSessionID(const std::string& combinedSessionID) override;
   [[nodiscard]] std::uint64_t batchedEventsSize() const override;
+  [[nodiscard]] std::uint64_t batchedEventsCount() const override;
   [[nodiscard]] bool isHTTPSPostBackend() const override { return true; }
 
   /// Where ordinary posts go; nothing: nowhere.

@@ -76,6 +76,8 @@ bool VelkReportingBackend::isBlacklistedEvent(std::uint32_t event) const {
 
 std::uint64_t VelkReportingBackend::batchedEventsSize() const { return 0; }
 
+std::uint64_t VelkReportingBackend::batchedEventsCount() const { return 0; }
+
 void VelkReportingBackend::setReportingSessionConnectivityDelegate(
     std::weak_ptr<ReportingSessionConnectivityInterface> transport) {
   _transport = std::move(transport);

@@ -86,6 +86,8 @@ class VelkReportingBackend : public std::enable_shared_from_this<VelkReportingBa
   [[nodiscard]] bool isBlacklistedEvent(std::uint32_t event) const;
   /// Estimated bytes of the events that wait. Any thread; waits for the state queue.
   [[nodiscard]] virtual std::uint64_t batchedEventsSize() const;
+  /// How many those are. Any thread; waits for the state queue.
+  [[nodiscard]] virtual std::uint64_t batchedEventsCount() const;
 
   void setReportingSessionConnectivityDelegate(std::weak_ptr<ReportingSessionConnectivityInterface> transport);
   /// "major.middle.minor", each cut to 8 bits; what is missing is 0.

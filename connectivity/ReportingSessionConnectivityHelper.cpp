@@ -1,5 +1,7 @@
 #include "connectivity/ReportingSessionConnectivityHelper.h"
 
+#include <algorithm>
+
 #include "connectivity/LogTexts.h"
 #include "connectivity/UploadStorage.h"
 #include "device/DeviceEnvironment.h"
@@ -145,6 +147,12 @@ void ReportingSessionConnectivityHelper::incrementTotalSessionsServedCount() {
   log::standard(texts::kServedCountIncremented, sessionIdentifier());
 }
 
+// A timer that is about to fire, or has and was not served yet, has nothing left.
+PropertyValue ReportingSessionConnectivityHelper::secondsUntil(SteadyTime time) const {
+  const std::chrono::duration<double> left = time - _platform.clock.steadyTime();
+  return std::max(left.count(), 0.0);
+}
+
 PropertyDictionary ReportingSessionConnectivityHelper::status() const {
   PropertyDictionary status;
   const auto identifier = sessionIdentifier();
@@ -153,7 +161,10 @@ PropertyDictionary ReportingSessionConnectivityHelper::status() const {
   status.set("usageCount", _usageCount.load());
   status.set("totalSessionsServedCount", _totalSessionsServedCount.load());
   status.set("active", _isActive.load());
-  status.set("releaseTimerRuns", _releaseTimerRuns.load());
+  const SteadyTime releaseTime = _releaseTime;
+  status.set("releaseTimeout", _releaseTimeout.load());
+  status.set("releaseTimerRuns", releaseTime != kNoTimer);
+  status.set("releaseInSeconds", releaseTime != kNoTimer ? secondsUntil(releaseTime) : PropertyValue());
   status.set("runningTasks", _runningTasks.load());
   return status;
 }
@@ -216,10 +227,11 @@ void ReportingSessionConnectivityHelper::startConnectivityHelperReleaseTimerWith
   _releaseTimer = _platform.scheduler.makeTimer(_stateQueue, [weak = weak_from_this()] {
     if (const auto self = weak.lock()) self->releaseTimerFired();
   });
-  _releaseTimerRuns = true;
   _releaseTimerBlock = std::move(block);
   _releaseTimerQueue = std::move(queue);
-  _releaseTimer->start(std::chrono::seconds(_releaseTimeout), std::nullopt, kReleaseTimerLeeway);
+  const std::chrono::seconds timeout(_releaseTimeout.load());
+  _releaseTime = _platform.clock.steadyTime() + timeout;
+  _releaseTimer->start(timeout, std::nullopt, kReleaseTimerLeeway);
   log::standard(texts::kTimerStarted, sessionIdentifier());
 }
 
@@ -239,7 +251,7 @@ void ReportingSessionConnectivityHelper::stopConnectivityHelperReleaseTimer() {
 
 void ReportingSessionConnectivityHelper::releaseTimerFired() {
   if (!_releaseTimer) return;
-  log::standard(texts::kTimerFired, sessionIdentifier(), _releaseTimeout);
+  log::standard(texts::kTimerFired, sessionIdentifier(), _releaseTimeout.load());
   cancelReleaseTimer();
 }
 
@@ -247,7 +259,7 @@ void ReportingSessionConnectivityHelper::releaseTimerFired() {
 void ReportingSessionConnectivityHelper::cancelReleaseTimer() {
   const auto timer = std::move(_releaseTimer);
   timer->cancel();
-  _releaseTimerRuns = false;
+  _releaseTime = kNoTimer;
   auto block = std::move(_releaseTimerBlock);
   auto queue = std::move(_releaseTimerQueue);
   if (!block) return;

@@ -19,6 +19,7 @@
 #include "connectivity/ConnectivityInterface.h"
 #include "connectivity/RequestWindow.h"
 #include "foundation/Function.h"
+#include "platform/Clock.h"
 #include "platform/Platform.h"
 #include "platform/Queue.h"
 
@@ -85,8 +86,8 @@ class ReportingSessionConnectivityHelper : public ReportingSessionConnectivityIn
 
   [[nodiscard]] HttpSessionConfiguration privateURLSessionConfigWithMode(std::int32_t mode) const;
 
-  /// For people: identifier, counts, whether it is active, whether the release timer runs, running tasks. A snapshot
-  /// that waits for nothing.
+  /// For people: identifier, counts, whether it is active, its release timeout, whether the release timer runs and the
+  /// seconds it has left, running tasks. A snapshot that waits for nothing.
   [[nodiscard]] PropertyDictionary status() const;
 
   // Events of the HTTP session.
@@ -123,9 +124,12 @@ class ReportingSessionConnectivityHelper : public ReportingSessionConnectivityIn
   void setRequestInProgress(const std::string& url, bool inProgress);
   [[nodiscard]] bool takeRequest(const std::string& url);
 
+  [[nodiscard]] PropertyValue secondsUntil(SteadyTime time) const;
   [[nodiscard]] std::optional<std::string> sessionIdentifier() const;
   void setSessionIdentifier(std::string identifier);
   [[nodiscard]] bool hasDelegate() const { return !_reportingdSessionDelegate.expired(); }
+
+  static constexpr SteadyTime kNoTimer{SteadyTime::duration::min()};
 
   // Constant after construction.
   const Platform _platform;
@@ -140,14 +144,15 @@ class ReportingSessionConnectivityHelper : public ReportingSessionConnectivityIn
   std::atomic<std::uint32_t> _totalSessionsServedCount{0};
   std::atomic<std::uint32_t> _usageCount{0};
   std::atomic<bool> _isActive{false};
-  std::atomic<bool> _releaseTimerRuns{false};
+  std::atomic<std::uint32_t> _releaseTimeout;
+  /// When the release timer fires; `kNoTimer` while it does not run.
+  std::atomic<SteadyTime> _releaseTime{kNoTimer};
   std::atomic<std::uint32_t> _runningTasks{0};
 
   // On the state queue.
   std::shared_ptr<Queue> _urlDelegateQueue;
   std::shared_ptr<HttpSession> _privateURLSession;
   std::unordered_map<std::string, std::unique_ptr<ConnectivityHelperTask>> _tasks;
-  std::uint32_t _releaseTimeout = 30;
   std::unique_ptr<Timer> _releaseTimer;
   ReleaseBlock _releaseTimerBlock;
   std::shared_ptr<Queue> _releaseTimerQueue;

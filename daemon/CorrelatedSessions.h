@@ -7,6 +7,7 @@
 #include <memory>
 #include <optional>
 #include <string>
+#include <utility>
 #include <vector>
 
 namespace velk {
@@ -39,6 +40,10 @@ class CorrelatedSessions {
   [[nodiscard]] SessionList descendants(const ReportingdSession& session) const;
 
   [[nodiscard]] std::size_t tokenCount() const noexcept { return _sessions.size(); }
+  /// Every token with its sessions in list order; deserted lists are there as well.
+  [[nodiscard]] std::vector<std::pair<std::string, SessionList>> snapshot() const {
+    return {_sessions.begin(), _sessions.end()};
+  }
 
   [[nodiscard]] static std::shared_ptr<ReportingdSession> getFirstSessionWithHierarchy(std::uint32_t level,
                                                                                        const SessionList& sessionList);

@@ -46,14 +46,15 @@ bool ReportingdAgent::shouldAcceptNewConnection(const std::shared_ptr<IncomingCo
     log::standard(daemontexts::kConnectionAccepted, connection->description(), _sessionList.size(),
                   _correlatedSessions.tokenCount());
   }
-  StatusHandler status;
-  if (connection->valueOfEntitlement(kStatusEntitlement)) {
-    status = [weak = weak_from_this()](StatusReply reply) {
-      if (const auto agent = weak.lock()) reply(agent->copyStatus());
-    };
-  }
   _census.add();
   const auto session = createReportingSessionWithDelegate(*this, connection);
+  StatusHandler status;
+  if (connection->valueOfEntitlement(kStatusEntitlement)) {
+    // The reply is encoded and sent on the reader's queue, when no lock is held any more.
+    status = [weak = weak_from_this(), reader = std::weak_ptr(session)](StatusReply reply) {
+      if (const auto agent = weak.lock()) reply(agent->copyStatus(reader.lock().get()));
+    };
+  }
   connection->setExportedObject(session, std::move(status));
   connection->setInterruptionHandler(
       [session] { log::standard(daemontexts::kConnectionInterrupted, session->description()); });
@@ -249,27 +250,22 @@ ReportingAgentState ReportingdAgent::copyReportingAgentState() {
   return state;
 }
 
-PropertyDictionary ReportingdAgent::copyStatus() {
-  std::vector<std::shared_ptr<ReportingdSession>> sessions;
-  PropertyDictionary status;
-  {
-    Guard guard(_monitor);
-    sessions = _sessionList;
-    status.set("keepAliveCount", _keepAlive.count());
-    status.set("hierarchies", _correlatedSessions.tokenCount());
-    status.set("storebags", _cachedStorebags.status());
-    PropertyDictionary activeClients;
-    for (std::int32_t type = 0; type < ActiveClientCounter::kFirstUncountedType; ++type) {
-      if (const auto count = _activeClients.count(type)) activeClients.set(std::to_string(type), count);
-    }
-    status.set("activeClients", std::move(activeClients));
+AgentSnapshot ReportingdAgent::snapshot() {
+  AgentSnapshot snapshot;
+  Guard guard(_monitor);
+  snapshot.sessions = _sessionList;
+  snapshot.hierarchies = _correlatedSessions.snapshot();
+  snapshot.storebags = _cachedStorebags.status();
+  for (std::int32_t type = 0; type < ActiveClientCounter::kFirstUncountedType; ++type) {
+    if (const auto count = _activeClients.count(type)) snapshot.activeClients.set(std::to_string(type), count);
   }
-  PropertyArray rows;
-  for (const auto& session : sessions) rows.append(session->statusDictionary());
-  status.set("sessions", std::move(rows));
-  status.set("helpers", _connectivityHelpers->status());
-  status.set("processMemory", _platform.process.anonymousMemory());
-  return status;
+  snapshot.keepAliveCount = _keepAlive.count();
+  return snapshot;
+}
+
+// The lock is free again while everybody is asked: a backend may have to be waited for.
+PropertyDictionary ReportingdAgent::copyStatus(const ReportingdSession* reader) {
+  return statusReport(snapshot(), reader, *_connectivityHelpers, _platform.process.anonymousMemory());
 }
 
 }  // namespace velk

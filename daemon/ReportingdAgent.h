@@ -26,6 +26,7 @@
 #include "daemon/SessionCensus.h"
 #include "daemon/SharedConnectivityHelpers.h"
 #include "daemon/SharedDataTable.h"
+#include "daemon/StatusReport.h"
 #include "daemon/StorebagMemoryCache.h"
 #include "platform/Platform.h"
 #include "session/ReportingdSession.h"
@@ -65,8 +66,9 @@ class ReportingdAgent final : public ReportingdSessionDelegate,
   /// After the teardowns: transports finish their tasks and give back what they hold. Only posts.
   void invalidateAllConnectivityHelpers() { _connectivityHelpers->invalidateAll(); }
 
-  /// Sessions, transports, storebags and counters, for people. Waits for the lock, and works without it.
-  [[nodiscard]] PropertyDictionary copyStatus();
+  /// Sessions, transports, storebags and counters, for people. Waits for the lock, and works without it. `reader` is
+  /// the session that asks, if one does: see `statusReport`.
+  [[nodiscard]] PropertyDictionary copyStatus(const ReportingdSession* reader = nullptr);
 
   // ReportingdSessionDelegate
   [[nodiscard]] std::optional<PropertyDictionary> storebagForSession(ReportingdSession& session) override;
@@ -95,6 +97,7 @@ class ReportingdAgent final : public ReportingdSessionDelegate,
   ReportingdAgent(const Platform& platform, std::shared_ptr<StorebagService> storebagService,
                   SessionFactory makeSession);
 
+  [[nodiscard]] AgentSnapshot snapshot();
   void connectionWasInvalidated(const std::shared_ptr<ReportingdSession>& session);
   void decrementActiveClientsLocked(const ReportingdSession& session) VELK_REQUIRES(_monitor);
 

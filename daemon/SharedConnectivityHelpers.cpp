@@ -75,10 +75,15 @@ void SharedConnectivityHelpers::invalidateAll() {
   });
 }
 
-PropertyArray SharedConnectivityHelpers::status() {
+std::size_t SharedConnectivityHelpers::count() {
+  return _stateQueue->sync([&] { return _helpers.size(); });
+}
+
+PropertyArray SharedConnectivityHelpers::status(std::size_t limit) {
   return _stateQueue->sync([&] {
     PropertyArray rows;
     for (const auto& [key, entry] : _helpers) {
+      if (rows.size() == limit) break;
       PropertyDictionary row{{"key", key}, {"usage", entry.uses}};
       row.merge(entry.helper->status());
       rows.append(std::move(row));

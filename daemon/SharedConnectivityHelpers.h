@@ -32,8 +32,10 @@ class SharedConnectivityHelpers : public std::enable_shared_from_this<SharedConn
   /// For the process's end: every transport finishes its tasks and gives its keep-alive references back. Asynchronous.
   void invalidateAll();
 
-  /// Key and usage of each, and what it says of itself. Waits for the state queue.
-  [[nodiscard]] PropertyArray status();
+  /// Key and usage of each, and what it says of itself; no more than `limit` of them. Waits for the state queue.
+  [[nodiscard]] PropertyArray status(std::size_t limit = SIZE_MAX);
+  /// Waits for the state queue.
+  [[nodiscard]] std::size_t count();
 
  private:
   struct Entry {

@@ -69,17 +69,21 @@ std::string ClientSession::description() const {
 
 namespace {
 
-PropertyValue valueOrNull(const std::optional<PropertyDictionary>& dictionary, std::string_view key) {
+// Clients may send anything under these keys; what is neither a number nor a text says nothing to a reader.
+PropertyValue textOrNumber(const std::optional<PropertyDictionary>& dictionary, std::string_view key) {
   const PropertyValue* value = dictionary ? dictionary->find(key) : nullptr;
-  return value != nullptr ? *value : PropertyValue();
+  const bool isShown = value != nullptr && (value->isNumber() || value->string() != nullptr);
+  return isShown ? *value : PropertyValue();
 }
 
 PropertyArray statusOfBackends(const SessionBackends* backends) {
   PropertyArray list;
   if (backends == nullptr) return list;
   for (const auto& entry : *backends) {
-    list.append(PropertyDictionary{
-        {"name", entry.name}, {"state", entry.backend->state()}, {"batchedBytes", entry.backend->batchedEventsSize()}});
+    list.append(PropertyDictionary{{"name", entry.name},
+                                   {"state", entry.backend->state()},
+                                   {"batchedEvents", entry.backend->batchedEventsCount()},
+                                   {"batchedBytes", entry.backend->batchedEventsSize()}});
   }
   return list;
 }
@@ -92,10 +96,11 @@ PropertyDictionary ClientSession::statusDictionary() const {
   const auto token = hierarchyToken();
   return PropertyDictionary{{"sessionID", sessionID()},
                             {"sessionIDString", _sessionIDString},
-                            {"clientType", valueOrNull(info, kVelkReportingSessionInfoClientType)},
-                            {"clientVersion", valueOrNull(info, kVelkReportingSessionInfoClientVersion)},
-                            {"clientName", valueOrNull(user, kVelkReportingUserInfoClientName)},
-                            {"serviceName", valueOrNull(user, kVelkReportingUserInfoServiceName)},
+                            {"described", info.has_value()},
+                            {"clientType", textOrNumber(info, kVelkReportingSessionInfoClientType)},
+                            {"clientVersion", textOrNumber(info, kVelkReportingSessionInfoClientVersion)},
+                            {"clientName", textOrNumber(user, kVelkReportingUserInfoClientName)},
+                            {"serviceName", textOrNumber(user, kVelkReportingUserInfoServiceName)},
                             {"level", hierarchyLevel()},
                             {"token", token ? PropertyValue(*token) : PropertyValue()},
                             {"counted", isCounted()},

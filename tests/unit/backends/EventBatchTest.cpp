@@ -92,6 +92,7 @@ TEST(EventBatch, EstimatesItsSize) {
   batch.append(event);
   batch.append(event);
   EXPECT_EQ(batch.estimatedSize(), 2U * memoryEstimate(event));
+  EXPECT_EQ(batch.count(), 2U);
 }
 
 }  // namespace

@@ -259,6 +259,7 @@ TEST_F(SendingTest, BatchesARealtimeEventWhileWaiting) {
   EXPECT_EQ(send(*backend, {{"n", 1}}, 7, 3, 1), std::nullopt);
   EXPECT_EQ(transport->count(), 0U);
   EXPECT_GT(backend->batchedEventsSize(), 0U);
+  EXPECT_EQ(backend->batchedEventsCount(), 1U);
   EXPECT_EQ(backend->state(), kBackendWaiting);
   EXPECT_EQ(log.count("HTTPSPostBackend(sendMessage): Batching 3, 0, 1"), 1);
 }

@@ -161,15 +161,19 @@ TEST_F(ConnectivityHelperTest, TheReleaseTimerTellsTheOwnerThatNobodyIsLeft) {
   scheduler().runUntilIdle();
   EXPECT_TRUE(counts.empty());
   EXPECT_EQ(*helper->status().find("releaseTimerRuns"), PropertyValue(true));
+  EXPECT_EQ(integerValue(helper->status().find("releaseTimeout")), 12);
+  EXPECT_EQ(*helper->status().find("releaseInSeconds"), PropertyValue(12.0));
   EXPECT_EQ(logged(texts::kUsageZero, {identifier()}), 1);
   EXPECT_EQ(logged(texts::kTimerStarted, {identifier()}), 1);
   scheduler().advance(11900ms);
   EXPECT_TRUE(counts.empty());
+  EXPECT_NEAR(doubleValue(helper->status().find("releaseInSeconds")), 0.1, 0.001);
   scheduler().advance(200ms);
   EXPECT_EQ(counts, (std::vector<std::uint32_t>{0}));
   EXPECT_EQ(logged(texts::kTimerFired, {identifier(), 12}), 1);
   EXPECT_EQ(logged(texts::kTimerCallsOwner, {0}), 1);
   EXPECT_EQ(*helper->status().find("releaseTimerRuns"), PropertyValue(false));
+  EXPECT_TRUE(helper->status().find("releaseInSeconds")->isNull());
   scheduler().advance(1h);
   EXPECT_EQ(counts.size(), 1u);
 }

@@ -138,7 +138,7 @@ TEST_F(CorrelatedSessionsTest, MadeUpTokensAreBounded) {
     wanderer->token = "made up " + std::to_string(move);
     agent->updateCorrelatedSessions(*wanderer);
     agent->updateSharedDataForSession(*wanderer, {{"move", move}});
-    ASSERT_LE(integerValue(agent->copyStatus().find("hierarchies")), CorrelatedSessions::kMaximumDesertedLists + 1);
+    ASSERT_LE(integerValue(agent->copyStatus().find("hierarchyCount")), CorrelatedSessions::kMaximumDesertedLists + 1);
   }
   EXPECT_EQ(agent->sharedDataForSession(*wanderer), (PropertyDictionary{{"move", kMoves - 1}}));
   wanderer->token = "tree";

@@ -2,6 +2,7 @@
 #pragma once
 
 #include <atomic>
+#include <functional>
 #include <memory>
 #include <optional>
 #include <string>
@@ -63,7 +64,10 @@ class FakeReportingdSession : public ReportingdSession {
   bool isCounted() const override { return counted; }
   void setCounted(bool value) override { counted = value; }
   std::uint64_t batchedEventsSize() const override { return 0; }
-  PropertyDictionary statusDictionary() const override { return {{"sessionID", number}}; }
+  PropertyDictionary statusDictionary() const override {
+    if (whenAskedForStatus) whenAskedForStatus();
+    return status.empty() ? PropertyDictionary{{"sessionID", number}} : status;
+  }
   std::string description() const override { return "<session " + idString + ">"; }
 
   void updateCombinedSessionID() override { calls.push_back("updateCombinedSessionID"); }
@@ -84,6 +88,8 @@ class FakeReportingdSession : public ReportingdSession {
   std::uint32_t level = 0;
   bool aggregates = false;
   bool counted = false;
+  PropertyDictionary status;
+  std::function<void()> whenAskedForStatus;
   std::vector<std::string> calls;
   std::atomic<int> invalidations{0};
   std::atomic<int> teardowns{0};

@@ -175,7 +175,7 @@ TEST_F(ReportingdAgentTest, DropsTheSharedDataWithTheLastSessionOfAHierarchy) {
   EXPECT_TRUE(agent->sharedDataForSession(*child).has_value());
   agent->invalidateReportingSession(child);
   EXPECT_EQ(agent->sharedDataForSession(*child), std::nullopt);
-  EXPECT_EQ(integerValue(agent->copyStatus().find("hierarchies")), 0);
+  EXPECT_EQ(integerValue(agent->copyStatus().find("hierarchyCount")), 0);
 }
 
 TEST_F(ReportingdAgentTest, LeavesNothingOfASessionThatForgotItsTokenBeforeItEnded) {
@@ -186,7 +186,7 @@ TEST_F(ReportingdAgentTest, LeavesNothingOfASessionThatForgotItsTokenBeforeItEnd
   session->token = std::nullopt;
   agent->updateCorrelatedSessions(*session);
   agent->invalidateReportingSession(session);
-  EXPECT_EQ(integerValue(agent->copyStatus().find("hierarchies")), 0);
+  EXPECT_EQ(integerValue(agent->copyStatus().find("hierarchyCount")), 0);
   session->token = "tree";
   EXPECT_EQ(agent->sharedDataForSession(*session), std::nullopt);
 }
@@ -248,9 +248,9 @@ TEST_F(ReportingdAgentTest, AnswersTheStatusToPeersThatMayReadItOnly) {
   std::optional<PropertyDictionary> status;
   entitled->statusHandler([&](PropertyDictionary answer) { status = std::move(answer); });
   ASSERT_TRUE(status.has_value());
-  EXPECT_EQ(status->array("sessions")->size(), 2U);
+  EXPECT_EQ(status->array("sessions")->size(), 1U) << "the reader's own has described nothing";
   EXPECT_EQ(integerValue(status->find("processMemory")), 4711);
-  EXPECT_EQ(integerValue(status->find("keepAliveCount")), 2);
+  EXPECT_EQ(integerValue(status->find("keepAliveCount")), 1);
 }
 
 TEST_F(ReportingdAgentTest, SnapshotsSessionsInTheirOrderAndStorebagsByName) {

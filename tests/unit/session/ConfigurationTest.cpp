@@ -379,6 +379,7 @@ TEST_F(ConfigurationTest, AbsentRepliesAreNoMatter) {
 TEST_F(ConfigurationTest, StatusTellsWhatASessionIs) {
   start({"splunk"}, hierarchy("T", 1), userNamed("Media", "Calls"));
   backend("splunk").batchedSize = 12;
+  backend("splunk").batchedCount = 3;
   const auto status = session->statusDictionary();
   EXPECT_EQ(integerValue(status.find("sessionID")), 7);
   EXPECT_EQ(integerValue(status.find("clientType")), 8);
@@ -386,9 +387,10 @@ TEST_F(ConfigurationTest, StatusTellsWhatASessionIs) {
   EXPECT_EQ(*status.string("serviceName"), "Calls");
   EXPECT_EQ(*status.string("token"), "T");
   EXPECT_EQ(integerValue(status.find("level")), 1);
+  EXPECT_TRUE(booleanValue(status.find("described")));
   EXPECT_FALSE(booleanValue(status.find("finished")));
   EXPECT_EQ((*status.array("backends"))[0],
-            PropertyValue(PropertyDictionary{{"name", "splunk"}, {"state", 2}, {"batchedBytes", 12}}));
+            PropertyValue(PropertyDictionary{{"name", "splunk"}, {"state", 2}, {"batchedEvents", 3}, {"batchedBytes", 12}}));
 }
 
 }  // namespace

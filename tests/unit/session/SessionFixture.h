@@ -94,6 +94,7 @@ class FakeBackend : public VelkReportingBackend {
   [[nodiscard]] bool uploadFileAtPath(const std::string& path, const std::string& extensionToken) override;
   [[nodiscard]] bool uploadLogData(const PropertyArray& logData) override;
   [[nodiscard]] std::uint64_t batchedEventsSize() const override { return batchedSize; }
+  [[nodiscard]] std::uint64_t batchedEventsCount() const override { return batchedCount; }
   [[nodiscard]] bool isHTTPSPostBackend() const override { return isPost; }
 
   void setWhitelist(std::optional<PropertyArray> whitelist) { _eventWhitelist = std::move(whitelist); }
@@ -116,6 +117,7 @@ class FakeBackend : public VelkReportingBackend {
   std::vector<BackendFlushCompletion> flushes;
   std::optional<std::string> text;
   std::uint64_t batchedSize = 0;
+  std::uint64_t batchedCount = 0;
   std::int32_t nextState = kBackendEnabled;
   int stateUpdates = 0;
   bool isPost = false;
