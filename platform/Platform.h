@@ -17,6 +17,8 @@ class UserDefaults;
 class DeviceInformation;
 class Locale;
 class HttpSessionService;
+class AdaptorBundle;
+class PowerLog;
 
 /// Uniform random numbers.
 class RandomSource {
@@ -77,6 +79,9 @@ struct Platform {
   const Consent& consent;
   const ProcessStatistics& process;
   LogSubmission& logSubmission;
+  // Null where there is no such service.
+  AdaptorBundle* adaptorBundle = nullptr;
+  PowerLog* powerLog = nullptr;
 };
 
 }  // namespace velk

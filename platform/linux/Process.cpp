@@ -40,6 +40,8 @@ void limitHeaps() { ::mallopt(M_ARENA_MAX, 2); }
 
 void returnFreeMemory() { ::malloc_trim(0); }
 
+void endNow(int status) { ::_exit(status); }
+
 void setUtilityPriority() {
   static_cast<void>(::setpriority(PRIO_PROCESS, 0, kUtilityNice));
   static_cast<void>(::syscall(SYS_ioprio_set, kIoPriorityOfProcess, 0,
