@@ -4,6 +4,8 @@
 
 #include "backends/HTTPSPostBackend.h"
 #include "backends/LogTexts.h"
+#include "backends/PowerLogBackend.h"
+#include "backends/QuillBackend.h"
 #include "backends/VelkReportingBackend.h"
 #include "device/DeviceEnvironment.h"
 #include "ipc/Vocabulary.h"
@@ -30,6 +32,15 @@ std::shared_ptr<VelkReportingBackend> makeHTTPSPostBackend(const Section& sectio
   return HTTPSPostBackend::initWithName(section.context, section.name, section.profile, section.productFamily);
 }
 
+std::shared_ptr<VelkReportingBackend> makePowerLogBackend(const Section& section) {
+  return PowerLogBackend::initWithName(section.context, section.name, section.profile, section.productFamily);
+}
+
+std::shared_ptr<VelkReportingBackend> makeQuillBackend(const Section& section) {
+  return QuillBackend::initWithName(section.context, section.name, section.profile, section.productFamily,
+                                    section.clientType);
+}
+
 /// Stands where a class is known by name but not built into this daemon: its sections are passed over.
 std::shared_ptr<VelkReportingBackend> makeNothingYet(const Section& section) {
   log::debug("VelkReportingBackend(newBackendWithName): this daemon has no %s backend", section.name);
@@ -48,9 +59,9 @@ constexpr std::array kRows{
     Row{kVelkReportingBackendUploadServer, false, makeNothingYet},
     Row{kVelkReportingBackendHTTPPost, true, makeHTTPSPostBackend},
     Row{kVelkReportingBackendHTTPPost2, false, makeHTTPSPostBackend},
-    Row{kVelkReportingBackendPowerlog, false, makeNothingYet},
+    Row{kVelkReportingBackendPowerlog, false, makePowerLogBackend},
     Row{kVelkReportingBackendQRS, false, makeHTTPSPostBackend},
-    Row{kVelkReportingBackendQuill, false, makeNothingYet},
+    Row{kVelkReportingBackendQuill, false, makeQuillBackend},
 };
 
 bool standsFor(const Row& row, const Section& section) {

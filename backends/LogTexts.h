@@ -75,6 +75,15 @@ inline constexpr const char* kUserInfoRequired = "Can not flush: userInfo is req
 inline constexpr const char* kNothingToFlush = "Nothing to flush";
 inline constexpr const char* kEverythingFiltered = "Nothing to flush: batched events were completely filtered out";
 
+// Diagnostics adaptor.
+inline constexpr const char* kLoadingQuillAdaptor =
+    "QuillBackend(initWithName): Loading Quill adaptor class for client type %d";
+inline constexpr const char* kNoQuillBundle = "QuillBackend(initWithName): No matching bundle found for client type %d";
+inline constexpr const char* kQuillDoesNotRespond =
+    "QuillBackend(sendMessage): Quill adaptor %s does not respond to forwarding selector %s";
+inline constexpr const char* kQuillBundleUnusable = "QuillBackend(initWithName): no Quill adaptor: %s";
+inline constexpr const char* kQuillEventLost = "QuillBackend(sendMessage): an event is lost: %s";
+
 // Macro expansion.
 inline constexpr const char* kExpandingMacro = "expandMacroForDataSet: Expanding macro '%@' into '%@'";
 

@@ -11,6 +11,7 @@
 #include "device/DeviceEnvironment.h"
 #include "ipc/Listener.h"
 #include "ipc/Vocabulary.h"
+#include "platform/AdaptorBundle.h"
 #include "platform/DeviceInformation.h"
 #include "platform/Directories.h"
 #include "platform/Entitlements.h"
@@ -19,6 +20,7 @@
 #include "platform/HttpSession.h"
 #include "platform/Launch.h"
 #include "platform/Log.h"
+#include "platform/PowerLog.h"
 #include "platform/Process.h"
 #include "platform/ThreadPool.h"
 #include "platform/UserDefaults.h"
@@ -31,11 +33,15 @@ constexpr Duration kActivatedIdleLimit = std::chrono::seconds(30);
 // How long the end of the process waits for sessions to say goodbye, and then for the network to take their last posts.
 constexpr Duration kTeardownTime = std::chrono::seconds(5);
 constexpr Duration kDeliveryTime = std::chrono::seconds(10);
+// How long calls of the diagnostics adaptor may then still take.
+constexpr Duration kAdaptorTime = std::chrono::seconds(2);
 // How far beyond its usual bound the pool may grow while everybody waits for the agent's lock: more than the
 // connections that a few users may have.
 constexpr std::size_t kEmergencyThreads = 3584;
 // Where retired message logs go for support to collect; without it they are deleted.
 constexpr std::string_view kLogSpoolSetting = "logSubmissionDirectory";
+// The datagram socket of the journal that takes the power log, where it is not the system's own.
+constexpr std::string_view kPowerLogSocketSetting = "powerLogSocket";
 
 std::optional<Duration> idleLimit(const DaemonOptions& options, bool activated) {
   if (options.idleExitSeconds) {
@@ -55,6 +61,11 @@ std::string textSetting(const UserDefaults& defaults, std::string_view key) {
   const auto value = defaults.value(key);
   const auto* text = value ? value->string() : nullptr;
   return text != nullptr ? *text : std::string();
+}
+
+std::unique_ptr<PowerLog> makePowerLog(const UserDefaults& defaults) {
+  const auto socket = textSetting(defaults, kPowerLogSocketSetting);
+  return socket.empty() ? makeJournalPowerLog() : makeJournalPowerLog(socket);
 }
 
 }  // namespace
@@ -88,6 +99,8 @@ struct DaemonProcess::Parts {
   const std::unique_ptr<Consent> consent;
   const std::unique_ptr<ProcessStatistics> statistics;
   const std::unique_ptr<LogSubmission> logSubmission;
+  const std::unique_ptr<AdaptorBundle> adaptorBundle;
+  const std::unique_ptr<PowerLog> powerLog;
   const DeviceEnvironment environment;
   IdleWatch idleWatch;
   Platform platform;
@@ -120,11 +133,14 @@ DaemonProcess::Parts::Parts(const DaemonOptions& options, process::RunLoop& loop
       consent(makeConsent(*defaults)),
       statistics(makeProcessStatistics()),
       logSubmission(makeLogSubmission(textSetting(*defaults, kLogSpoolSetting))),
+      adaptorBundle(makeAdaptorBundle(directories.configuration)),
+      powerLog(makePowerLog(*defaults)),
       environment(*defaults, *device),
       idleWatch(
           *pool, idleLimit(options, activated), [this] { return isOccupied(); }, [this] { runLoop.wakeUp(); }),
-      platform{systemClock(), *pool,     *defaults, *device,     *locale,       *http,
-               *random,       idleWatch, *consent,  *statistics, *logSubmission},
+      platform{systemClock(), *pool,     *defaults, *device,     *locale,        *http,
+               *random,       idleWatch, *consent,  *statistics, *logSubmission, adaptorBundle.get(),
+               powerLog.get()},
       storebagPlatform{systemClock(), *storebagPool, *defaults, *device,     *locale,       *http,
                        *random,       idleWatch,     *consent,  *statistics, *logSubmission},
       messageLog(directories.logs, platform.clock, *logSubmission),
@@ -245,6 +261,10 @@ void DaemonProcess::stop() {
   _parts->agent->invalidateAllConnectivityHelpers();
   if (!_parts->idleWatch.waitUntilReleased(kDeliveryTime)) {
     log::error("stop: posts are still under way after %d s and are cut off", kDeliveryTime / std::chrono::seconds(1));
+  }
+  if (!_parts->adaptorBundle->stop(kAdaptorTime)) {
+    log::error("stop: the diagnostics adaptor does not return from its calls; the process ends without it");
+    process::endNow(kExitSoftware);
   }
   // The threads: first those that hand work over, then those that do it.
   _parts->eventLoop.stop();
