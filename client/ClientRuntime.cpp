@@ -34,12 +34,17 @@ ClientRuntime& ClientRuntime::shared() {
 ClientRuntime::ClientRuntime()
     : _loop("velkreporting"),
       _callbackThreads(makeThreadPool(callbackThreads())),
+      _periodicTaskThreads(makeThreadPool(callbackThreads())),
       _oneMessageQueue(_loop.makeLoopQueue("com.tavrin.VelkReporting.sendOneMessageQueue")) {
   log::setSinkIfNone(log::makeLibrarySink(), log::librarySinkLevel());
 }
 
 void ClientRuntime::runCallback(Task callback) {
   _callbackThreads->makeSerialQueue("velkreporting.callback")->async(std::move(callback));
+}
+
+void ClientRuntime::runPeriodicTask(Task task) {
+  _periodicTaskThreads->makeSerialQueue("com.tavrin.VelkReporting.PeriodicTask")->async(std::move(task));
 }
 
 std::shared_ptr<Queue> ClientRuntime::makeCallbackQueue(std::string label) {

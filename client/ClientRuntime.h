@@ -26,6 +26,8 @@ class ClientRuntime {
 
   /// Runs a callback of the user on a thread of its own choice; it may block for as long as it likes.
   void runCallback(Task callback);
+  /// The same for a module's periodic task, out of the way of the other callbacks: modules may block for long.
+  void runPeriodicTask(Task task);
   /// A queue for callbacks that must arrive in order.
   [[nodiscard]] std::shared_ptr<Queue> makeCallbackQueue(std::string label);
 
@@ -43,6 +45,7 @@ class ClientRuntime {
   const std::uint64_t _generation = processGeneration();
   EventLoop _loop;
   const std::unique_ptr<ThreadPool> _callbackThreads;
+  const std::unique_ptr<ThreadPool> _periodicTaskThreads;
   const std::shared_ptr<Queue> _oneMessageQueue;
   std::atomic<int> _oneMessagesUnderWay{0};
   Lock _lock;

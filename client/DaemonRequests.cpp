@@ -44,7 +44,7 @@ ConfigurationReply VelkReportingImplementation::statesReply(VelkReporting::State
                                            const std::optional<PropertyArray>& whitelist,
                                            const std::optional<PropertyArray>& blacklist) {
     if (const auto strong = self.lock()) {
-      strong->_queue->async([lists = strong->_lists, enabled, whitelist, blacklist] {
+      strong->_reporting->async([lists = strong->_lists, enabled, whitelist, blacklist] {
         lists->replace(std::make_shared<const EventLists>(enabled, whitelist, blacklist));
         log::standard(texts::kCachedLists, enabled ? enabled->size() : 0, whitelist, blacklist);
       });

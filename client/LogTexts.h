@@ -67,6 +67,34 @@ inline constexpr std::string_view kAggregationBlockThrew =
 inline constexpr std::string_view kAboutToDealloc =
     "aboutToDealloc: VelkReporting client session %p is about to dealloc";
 
+// Periodic tasks
+inline constexpr std::string_view kRegisteredModule = "registerPeriodicTaskForModule: %u,%s update,%s reporting";
+inline constexpr std::string_view kTooManyModules =
+    "registerPeriodicTaskForModule: %u is refused: %u modules are there";
+inline constexpr std::string_view kModuleRemoved = "unregisterPeriodTaskForModule: %u removed";
+inline constexpr std::string_view kModuleDoesNotExist = "unregisterPeriodTaskForModule: %u doesn't exist";
+inline constexpr std::string_view kTimerStarted = "startLogTimerWithInterval: %d, %d";
+inline constexpr std::string_view kIntervalIsZero = "startLogTimerWithInterval: the interval is 0: no timer is started";
+inline constexpr std::string_view kTimerStopped = "stopLogTimer.";
+inline constexpr std::string_view kNoTimer = "stopLogTimer: No timer is present.";
+inline constexpr std::string_view kTickStarted = "_myPeriodicTask: Started RT periodic task";
+inline constexpr std::string_view kUpdateSchedulingTimeout =
+    "_myPeriodicTask: Timeout scheduling RT metrics update tasks";
+inline constexpr std::string_view kUpdateTimeout = "_myPeriodicTask: Timeout during RT metrics update";
+inline constexpr std::string_view kUpdatesFinished = "_myPeriodicTask: Finished RT updates for all registered modules.";
+inline constexpr std::string_view kReportSchedulingTimeout =
+    "_myPeriodicTask: Timeout scheduling RT metrics report tasks";
+inline constexpr std::string_view kReportTimeout =
+    "_myPeriodicTask: Timeout during periodic tasks metrics collection. Not all stats will be reported";
+inline constexpr std::string_view kMetricsCollected = "_myPeriodicTask: All RT metrics collected";
+inline constexpr std::string_view kSentRealtimeEvent =
+    "_myPeriodicTask: Sent realtime event after collection all RT metrics";
+inline constexpr std::string_view kCollectionFinished = "_myPeriodicTask: Finished RT metrics collection";
+inline constexpr std::string_view kServiceBlockThrew =
+    "_myPeriodicTask: Exception during invocation of the callback of module %u";
+inline constexpr std::string_view kTooManyCallsWait =
+    "_myPeriodicTask: %u calls wait for a module's callback; later ones no longer do";
+
 // One-shot messages
 inline constexpr std::string_view kOneMessageFailedToConnect =
     "sendOneMessageWithSessionInfo: Failed to connect to daemon";

@@ -5,7 +5,6 @@
 #include <functional>
 #include <utility>
 
-#include "foundation/Export.h"
 #include "foundation/PropertyValue.h"
 
 namespace velk {
@@ -15,7 +14,7 @@ namespace velk {
 using VelkReportingServiceBlock = std::function<void(PropertyDictionary* statistics)>;
 
 /// Immutable: any thread.
-class VELK_EXPORT UpdateAndReportServices {
+class UpdateAndReportServices {
  public:
   UpdateAndReportServices(bool needToUpdate, bool needToReport, VelkReportingServiceBlock service)
       : _update(needToUpdate), _report(needToReport), _block(std::move(service)) {}

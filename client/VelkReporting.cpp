@@ -73,8 +73,9 @@ std::shared_ptr<VelkReporting> VelkReporting::initWithSessionInfo(const std::opt
   description.frameworksToCheck = frameworksToCheck;
   auto implementation =
       std::make_shared<VelkReportingImplementation>(runtime, std::move(description), std::move(aggregationBlock));
-  implementation->open();
-  return std::shared_ptr<VelkReporting>(new VelkReporting(std::move(implementation)));
+  const std::shared_ptr<VelkReporting> client(new VelkReporting(implementation));
+  implementation->open(client);
+  return client;
 }
 
 void VelkReporting::startConfigurationWithCompletionHandler(StatesCallback completionHandler) {
@@ -125,24 +126,16 @@ bool VelkReporting::sendMessageWithDictionary(const PropertyDictionary& dictiona
     return false;
   }
   assign(error, {});
-  if (_implementation->isForeign()) {
+  using Sent = VelkReportingImplementation::Sent;
+  const Sent sent = _implementation->sendMessage(category, dictionary);
+  if (sent == Sent::notFromForkedChild) {
     assign(error, {errorDomain(), VelkReportingImplementation::kForkedChild,
                    "this process was forked from the one that made the client"});
-    return false;
+  } else if (sent == Sent::outboxFull) {
+    assign(error, {errorDomain(), VelkReportingImplementation::kOutboxFull,
+                   "the outbox is full: the daemon is away or too slow, and the event was not taken"});
   }
-  notifyMessageWasSent(dictionary);
-  if (!isWhitelistedEvent(category) || isBlacklistedEvent(category)) {
-    log::standard(texts::kEventIsFiltered, category);
-    return false;
-  }
-  if (_implementation->enqueueEvent(dictionary)) return true;
-  assign(error, {errorDomain(), VelkReportingImplementation::kOutboxFull,
-                 "the outbox is full: the daemon is away or too slow, and the event was not taken"});
-  return false;
-}
-
-void VelkReporting::notifyMessageWasSent(const PropertyDictionary& message) {
-  if (_implementation->mayHaveMessageSentDelegate()) _implementation->notifyMessageWasSent(weak_from_this(), message);
+  return sent == Sent::taken;
 }
 
 bool VelkReporting::flushMessages() {
@@ -244,6 +237,27 @@ bool VelkReporting::uploadDataArray(const std::optional<PropertyArray>& logData,
         self.uploadLogData(logData, std::move(handler));
       });
   return true;
+}
+
+bool VelkReporting::registerPeriodicTaskForModule(std::uint32_t module, bool needToUpdate, bool needToReport,
+                                                  VelkReportingServiceBlock serviceBlock) {
+  return !_implementation->isForeign() &&
+         _implementation->periodicTasks().registerModule(module, needToUpdate, needToReport, std::move(serviceBlock));
+}
+
+bool VelkReporting::unregisterPeriodTaskForModule(std::uint32_t module) {
+  if (!_implementation->isForeign()) _implementation->unregisterPeriodicTask(module);
+  return true;
+}
+
+void VelkReporting::startLogTimerWithInterval(std::uint32_t interval, std::uint32_t reportingMultiplier,
+                                              std::uint16_t category, std::uint16_t type) {
+  if (_implementation->isForeign()) return;
+  _implementation->periodicTasks().startLogTimer(interval, reportingMultiplier, category, type);
+}
+
+void VelkReporting::stopLogTimer() {
+  if (!_implementation->isForeign()) _implementation->periodicTasks().stopLogTimer();
 }
 
 bool VelkReporting::setDigestKey(const std::optional<ByteData>& digestKey, std::uint32_t algorithm) {

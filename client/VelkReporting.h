@@ -107,9 +107,9 @@ class VELK_EXPORT VelkReporting : public std::enable_shared_from_this<VelkReport
   bool registerPeriodicTaskForModule(std::uint32_t module, bool needToUpdate, bool needToReport,
                                      VelkReportingServiceBlock serviceBlock);
   /// Always true, also for a module that is not registered. Waits until the tick that has begun is over: the module's
-  /// callback does not run after this returned, and what it owns has ended. Called from a callback of one of this
-  /// client's modules it does not wait, and the tick may still call the module once; do not let such a callback wait
-  /// for another thread that unregisters.
+  /// callback does not run after this returned. So callbacks must not wait for a thread that is in here, nor for a lock
+  /// that it holds. Called from a callback of one of this client's modules it does not wait: the module's callback is
+  /// not called any more, but a call that has begun goes on.
   bool unregisterPeriodTaskForModule(std::uint32_t module);
   /// Ticks at once, and then every `interval` seconds; ticks that are missed while one takes long are made up for by
   /// one. With a multiplier of 0 there are only updates. Does nothing when the timer runs already, nor, with an error
@@ -140,7 +140,6 @@ class VELK_EXPORT VelkReporting : public std::enable_shared_from_this<VelkReport
 
  private:
   explicit VelkReporting(std::shared_ptr<VelkReportingImplementation> implementation);
-  void notifyMessageWasSent(const PropertyDictionary& message);
 
   const std::shared_ptr<VelkReportingImplementation> _implementation;
 };

@@ -25,6 +25,7 @@ VelkReportingImplementation::VelkReportingImplementation(ClientRuntime& runtime,
                                                          VelkReportingAggregationBlock aggregationBlock)
     : _runtime(runtime),
       _queue(runtime.loop().makeLoopQueue("com.tavrin.VelkReporting.main")),
+      _reporting(std::make_shared<ReportingQueue>(_queue)),
       _orderedCallbacks(runtime.makeCallbackQueue("com.tavrin.VelkReporting.callbacks")),
       _lists(std::make_shared<CurrentEventLists>()),
       _aggregation(std::make_shared<VelkReportingAggregationObject>(std::move(aggregationBlock), _orderedCallbacks)),
@@ -33,17 +34,37 @@ VelkReportingImplementation::VelkReportingImplementation(ClientRuntime& runtime,
   _link = std::make_shared<SessionLink>(runtime, _queue, std::move(description), _aggregation, _lists);
 }
 
-void VelkReportingImplementation::open() {
+void VelkReportingImplementation::open(std::weak_ptr<VelkReporting> client) {
+  _client = std::move(client);
+  _periodicTasks = std::make_shared<PeriodicTasks>(
+      _reporting, _runtime.loop(), [&runtime = _runtime](Task task) { runtime.runPeriodicTask(std::move(task)); },
+      [weak = weak_from_this()](const PropertyDictionary& message) {
+        const auto self = weak.lock();
+        const std::uint16_t category = uint16Value(message.find(kVelkReportingMessageParametersCategory));
+        if (self && category != 0) self->sendMessage(category, message);
+      });
   _link->open([self = weak_from_this()] {
     if (const auto strong = self.lock()) strong->wasInterrupted();
   });
+}
+
+VelkReportingImplementation::Sent VelkReportingImplementation::sendMessage(std::uint16_t category,
+                                                                           const PropertyDictionary& message) {
+  if (isForeign()) return Sent::notFromForkedChild;
+  if (_mayHaveDelegate.load(std::memory_order_relaxed)) notifyMessageWasSent(message);
+  const auto lists = _lists->get();
+  if (!lists->isWhitelisted(category) || lists->isBlacklisted(category)) {
+    log::standard(texts::kEventIsFiltered, category);
+    return Sent::filtered;
+  }
+  return enqueueEvent(message) ? Sent::taken : Sent::outboxFull;
 }
 
 bool VelkReportingImplementation::enqueueEvent(const PropertyDictionary& message) {
   const std::size_t size = estimatedSize(message);
   if (!_outbox.reserve(size)) return false;
   const IncomingEvents::Ticket ticket = _incoming.add(message, size);
-  if (ticket != 0) _queue->async([self = shared_from_this(), ticket] { self->takeIncoming(ticket); });
+  if (ticket != 0) _reporting->async([self = shared_from_this(), ticket] { self->takeIncoming(ticket); });
   return true;
 }
 
@@ -53,7 +74,7 @@ void VelkReportingImplementation::takeIncoming(IncomingEvents::Ticket ticket) {
   auto events = _incoming.take(ticket, lingers);
   if (events.empty()) return;
   _lastTaken = now;
-  if (lingers) _queue->asyncAfter(kLinger, [self = shared_from_this(), ticket] { self->takeIncoming(ticket); });
+  if (lingers) _reporting->asyncAfter(kLinger, [self = shared_from_this(), ticket] { self->takeIncoming(ticket); });
   sendEvents(std::move(events));
 }
 
@@ -154,7 +175,9 @@ void VelkReportingImplementation::finishSession() {
 void VelkReportingImplementation::endOfLife(const void* client) {
   const Clock& clock = _runtime.loop().clock();
   const SteadyTime deadline = clock.steadyTime() + kEndOfLifeBound;
-  const bool mayWait = !_runtime.loop().isCurrent();
+  const bool isOnLoop = _runtime.loop().isCurrent();
+  const bool mayWait = !isOnLoop && !_periodicTasks->isInCallback();  // a tick does not end before its callbacks do
+  _periodicTasks->withdrawAll(!isOnLoop);
   if (mayWait) sendHeldEventsWithin(deadline);
   auto done = std::make_shared<Semaphore>();
   onQueue([client, done](VelkReportingImplementation& self) {
@@ -187,6 +210,8 @@ void VelkReportingImplementation::sendHeldEventsWithin(SteadyTime deadline) {
 
 void VelkReportingImplementation::finishAndClose(const void* client) {
   _isFinished = true;
+  _periodicTasks->end();
+  sendEvents(_incoming.takeForWork());  // what a tick reported that was not over yet when the last reference went
   sendWhatFits();
   std::size_t lost = 0;
   for (auto& waiting : _outbox.held) {
@@ -217,13 +242,16 @@ std::shared_ptr<VelkReportingMessageSentDelegate> VelkReportingImplementation::m
   return _weakMessageSentDelegate.lock();
 }
 
-void VelkReportingImplementation::notifyMessageWasSent(std::weak_ptr<VelkReporting> client,
-                                                       const PropertyDictionary& message) {
-  onQueue([client = std::move(client), message](VelkReportingImplementation& self) {
+void VelkReportingImplementation::unregisterPeriodicTask(std::uint32_t module) {
+  _periodicTasks->unregisterModule(module, !_runtime.loop().isCurrent());
+}
+
+void VelkReportingImplementation::notifyMessageWasSent(const PropertyDictionary& message) {
+  onQueue([message](VelkReportingImplementation& self) {
     auto delegate = self.messageSentDelegate();
     if (!delegate) return;
     log::standard(texts::kNotifyCalled);
-    self._orderedCallbacks->async([client, message, delegate = std::move(delegate)] {
+    self._orderedCallbacks->async([client = self._client, message, delegate = std::move(delegate)] {
       if (const auto strong = client.lock()) delegate->didSendMessageForReportingClient(strong, message);
     });
   });

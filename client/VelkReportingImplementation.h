@@ -2,7 +2,7 @@
 // is done; it joins no thread and waits for nothing that its own thread has to do.
 //
 // Bound to the reporting queue ("com.tavrin.VelkReporting.main", on the library's thread) unless a method says
-// otherwise.
+// otherwise. What a periodic tick does not hold up runs on the queue beneath it, which excludes the former.
 #pragma once
 
 #include <atomic>
@@ -15,6 +15,8 @@
 #include "client/EventLists.h"
 #include "client/EventOutbox.h"
 #include "client/IncomingEvents.h"
+#include "client/PeriodicTasks.h"
+#include "client/ReportingQueue.h"
 #include "client/SessionLink.h"
 #include "client/VelkReporting.h"
 #include "client/VelkReportingAggregationObject.h"
@@ -29,8 +31,8 @@ class VelkReportingImplementation : public std::enable_shared_from_this<VelkRepo
 
   VelkReportingImplementation(ClientRuntime& runtime, SessionDescription description,
                               VelkReportingAggregationBlock aggregationBlock);
-  /// Connects; on the creator's thread, once, before anything else.
-  void open();
+  /// Connects; on the creator's thread, once, before anything else. `client` is the object that this stands behind.
+  void open(std::weak_ptr<VelkReporting> client);
 
   // Any thread.
 
@@ -41,7 +43,7 @@ class VelkReportingImplementation : public std::enable_shared_from_this<VelkRepo
   template <class Work>
   void onQueue(Work work) {
     auto before = _incoming.takeForWork();
-    _queue->async([self = shared_from_this(), before = std::move(before), work = std::move(work)]() mutable {
+    _reporting->async([self = shared_from_this(), before = std::move(before), work = std::move(work)]() mutable {
       self->sendEvents(std::move(before));
       work(*self);
     });
@@ -53,8 +55,9 @@ class VelkReportingImplementation : public std::enable_shared_from_this<VelkRepo
       self.runBehindHeldEvents([&self, work = std::move(work)]() mutable { work(self); });
     });
   }
-  /// Queues an event. False when the outbox is full.
-  [[nodiscard]] bool enqueueEvent(const PropertyDictionary& message);
+  enum class Sent { taken, filtered, outboxFull, notFromForkedChild };
+  /// Tells the delegate of a valid message and queues it, unless the daemon wants no such events.
+  Sent sendMessage(std::uint16_t category, const PropertyDictionary& message);
   /// Directly over the connection, past everything that is queued.
   void finishSession();
   /// The end: what was queued is sent, the session finished, the connection closed. Waits for that within a bound,
@@ -63,12 +66,10 @@ class VelkReportingImplementation : public std::enable_shared_from_this<VelkRepo
 
   /// From here on messages are brought to the queue, which knows the delegate.
   void expectMessageSentDelegate() noexcept { _mayHaveDelegate.store(true, std::memory_order_relaxed); }
-  [[nodiscard]] bool mayHaveMessageSentDelegate() const noexcept {
-    return _mayHaveDelegate.load(std::memory_order_relaxed);
-  }
   [[nodiscard]] std::shared_ptr<VelkReportingMessageSentDelegate> messageSentDelegate() const;
-  /// Tells the delegate of a message, in order, on a thread for callbacks.
-  void notifyMessageWasSent(std::weak_ptr<VelkReporting> client, const PropertyDictionary& message);
+
+  [[nodiscard]] PeriodicTasks& periodicTasks() const { return *_periodicTasks; }
+  void unregisterPeriodicTask(std::uint32_t module);
 
   // On the reporting queue.
 
@@ -87,6 +88,10 @@ class VelkReportingImplementation : public std::enable_shared_from_this<VelkRepo
  private:
   using SharedLoggingBlock = std::shared_ptr<const VelkReporting::LoggingBlock>;
 
+  /// Queues an event. False when the outbox is full.
+  [[nodiscard]] bool enqueueEvent(const PropertyDictionary& message);
+  /// Tells the delegate of a message, in order, on a thread for callbacks.
+  void notifyMessageWasSent(const PropertyDictionary& message);
   void takeIncoming(IncomingEvents::Ticket ticket);
   void sendEvents(std::vector<IncomingEvents::Event> events);
   /// False when it has to wait.
@@ -108,10 +113,13 @@ class VelkReportingImplementation : public std::enable_shared_from_this<VelkRepo
   ClientRuntime& _runtime;
   const ForkGuard _forkGuard;
   const std::shared_ptr<Queue> _queue;
+  const std::shared_ptr<ReportingQueue> _reporting;  ///< over `_queue`
   const std::shared_ptr<Queue> _orderedCallbacks;
   const std::shared_ptr<CurrentEventLists> _lists;
   const std::shared_ptr<VelkReportingAggregationObject> _aggregation;
   std::shared_ptr<SessionLink> _link;
+  std::shared_ptr<PeriodicTasks> _periodicTasks;
+  std::weak_ptr<VelkReporting> _client;
   /// Events are batched on their way anyway, so a moment more or less is nothing to them.
   const bool _mayLinger;
 
