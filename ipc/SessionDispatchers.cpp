@@ -1,6 +1,7 @@
 #include "ipc/ArgumentReader.h"
 #include "ipc/MethodTable.h"
 #include "ipc/SessionProxies.h"
+#include "ipc/Vocabulary.h"
 
 namespace velk {
 namespace {
@@ -242,7 +243,11 @@ Result<void> SessionInterfaceDispatcher::dispatch(IncomingCall& call) {
   if (!method) return Failure(method.error());
   if (*method == Method::sendMessageToClient) return refused("unknown method");
   if (*method == Method::copyStatus) {
-    if (!_status) return refused("the status may not be read");
+    if (!_status) {
+      return refused("reading the status takes the entitlement " + std::string(kStatusEntitlement) +
+                     ": grant it in entitlements.d of the daemon's configuration directory, reload the daemon, and "
+                     "connect again");
+    }
     _status(statusReply(call.reply));
     return {};
   }

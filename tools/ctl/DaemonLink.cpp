@@ -16,13 +16,21 @@ constexpr std::chrono::seconds kLongestSend{60};
 
 DaemonLink::DaemonLink(const std::string& socketPath) : _loop("velk.ctl") {
   auto connection = Connection::connect(socketPath, _loop, _loop.makeLoopQueue("com.tavrin.velkreportingctl"));
-  if (connection) _connection = std::move(*connection);
+  if (connection) {
+    _connection = std::move(*connection);
+  } else {
+    _whyNot = connection.error().description;
+  }
 }
 
 Result<std::unique_ptr<DaemonLink>> DaemonLink::open(const std::string& socketPath) {
   auto link = std::make_unique<DaemonLink>(socketPath);
   if (link->_connection != nullptr) return link;
-  return Failure(connectionError(ConnectionError::notConnected, "no daemon answers at " + socketPath));
+  return Failure(connectionError(ConnectionError::notConnected,
+                                 "no daemon answers at " + socketPath + " (" + link->_whyNot +
+                                     "). Start velkreportingd, with `systemctl start velkreportingd.socket` where it "
+                                     "is installed as a service; a socket elsewhere is named with --socket or "
+                                     "VELKREPORTING_SOCKET"));
 }
 
 DaemonLink::~DaemonLink() {
@@ -67,7 +75,8 @@ Result<void> DaemonLink::call(const MethodDescription& method, const PropertyArr
                                  std::move(descriptors));
 }
 
-Result<PropertyArray> DaemonLink::callAndWait(Method method, const PropertyArray& arguments) {
+Result<PropertyArray> DaemonLink::callAndWait(Method method, const PropertyArray& arguments,
+                                              std::chrono::seconds limit) {
   struct Answer {
     Lock lock;
     Condition changed;
@@ -81,8 +90,13 @@ Result<PropertyArray> DaemonLink::callAndWait(Method method, const PropertyArray
         answer->changed.notifyAll();
       });
   if (!sent) return Failure(sent.error());
+  const auto deadline = std::chrono::steady_clock::now() + limit;
   Guard guard(answer->lock);
-  while (!answer->reply) answer->changed.wait(answer->lock);
+  while (!answer->reply) {
+    if (answer->changed.waitUntil(answer->lock, deadline) || answer->reply) continue;
+    return Failure(connectionError(ConnectionError::dropped,
+                                   "the daemon did not answer within " + std::to_string(limit.count()) + " s"));
+  }
   return *answer->reply;
 }
 

@@ -1,6 +1,7 @@
 // A connection to the daemon as the commands use it: opened, used, closed, all within one command.
 #pragma once
 
+#include <chrono>
 #include <functional>
 #include <memory>
 #include <string>
@@ -34,8 +35,12 @@ class DaemonLink final : public SessionWire {
   Result<void> call(const MethodDescription& method, const PropertyArray& arguments, ReplyHandler reply,
                     std::vector<FileDescriptor> descriptors) override;
 
+  /// The daemon may have to fetch a configuration first, for several callers one after the other.
+  static constexpr std::chrono::seconds kLongestAnswer{300};
+
   /// Calls and blocks until the reply is there, or the reason why there is none.
-  [[nodiscard]] Result<PropertyArray> callAndWait(Method method, const PropertyArray& arguments);
+  [[nodiscard]] Result<PropertyArray> callAndWait(Method method, const PropertyArray& arguments,
+                                                  std::chrono::seconds limit = kLongestAnswer);
 
   /// True once the daemon's side is gone; then the end handler has run, or this waits until it has.
   [[nodiscard]] bool hasEnded();
@@ -50,6 +55,8 @@ class DaemonLink final : public SessionWire {
   EventLoop _loop;
   std::shared_ptr<Connection> _connection;
   EndHandler _endHandler;
+  /// Why there is no connection.
+  std::string _whyNot;
 
   Lock _lock;
   Condition _changed;
