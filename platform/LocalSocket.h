@@ -12,6 +12,7 @@
 #include "foundation/Error.h"
 #include "foundation/TimeValue.h"
 #include "platform/FileDescriptor.h"
+#include "platform/Transfer.h"
 
 namespace velk {
 
@@ -40,15 +41,6 @@ void removeLocalSocket(const std::string& path);
 
 /// Two ends of one connection, non-blocking.
 [[nodiscard]] Result<std::pair<FileDescriptor, FileDescriptor>> makeLocalSocketPair();
-
-/// What one attempt to move bytes did.
-struct Transfer {
-  enum class Status { moved, wouldBlock, ended, failed };
-  Status status = Status::moved;
-  std::size_t bytes = 0;
-  /// The system's error number when it failed.
-  int error = 0;
-};
 
 /// Receives into `buffer`, appends descriptors that came along (close-on-exec) to `descriptors`. Never blocks.
 /// Fails with EMFILE when descriptors were lost on the way in.

@@ -19,6 +19,7 @@ class Locale;
 class HttpSessionService;
 class AdaptorBundle;
 class PowerLog;
+class UdpSocketService;
 
 /// Uniform random numbers.
 class RandomSource {
@@ -82,6 +83,7 @@ struct Platform {
   // Null where there is no such service.
   AdaptorBundle* adaptorBundle = nullptr;
   PowerLog* powerLog = nullptr;
+  UdpSocketService* udpSockets = nullptr;
 };
 
 }  // namespace velk
