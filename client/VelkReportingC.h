@@ -267,10 +267,10 @@ VELK_EXPORT bool VelkReportingClientRegisterPeriodicTask(VelkReportingClient* cl
                                                          bool needToUpdate, bool needToReport,
                                                          VelkReportingServiceCallback callback, void* context,
                                                          VelkReportingDestroyFunction destroy);
-/* True for every client, also for a module that is not registered. Waits until the tick that has begun is over: then
- * the module's callback runs no more, and its context has been destroyed. From a callback of one of this client's
- * modules it does not wait, and the tick may still call the module once; such a callback must not wait for another
- * thread that unregisters. */
+/* True for every client, also for a module that is not registered. Waits until the tick that has begun is over: the
+ * module's callback does not run after this returned; its context is destroyed by then or a moment later. From a
+ * callback of one of this client's modules it does not wait, and the tick may still call the module once; such a
+ * callback must not wait for another thread that unregisters. */
 VELK_EXPORT bool VelkReportingClientUnregisterPeriodicTask(VelkReportingClient* client, uint32_t module);
 /* Ticks at once, and then every `interval` seconds; missed ticks are made up for by one. With a multiplier of 0 there
  * are only updates. Nothing happens when the timer runs already, nor (but for a line in the log) for an interval of 0.
