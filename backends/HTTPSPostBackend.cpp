@@ -256,7 +256,7 @@ void HTTPSPostBackend::postJSONMessage(std::string json, std::uint32_t flag, std
     completion(errorObject(backend_texts::kPostURLMissing, kReportingError));
     return;
   }
-  if (const auto transport = _transport.lock()) transport->waitForRoom();
+  if (const auto sender = transport()) sender->waitForRoom();
   auto compressed = gzipDeflate(std::string_view(json));
   const bool isCompressed = compressed && !compressed->empty() && compressed->size() < json.size();
   const auto plain = std::make_shared<const std::string>(std::move(json));
@@ -282,9 +282,9 @@ void HTTPSPostBackend::postJSONMessage(std::string json, std::uint32_t flag, std
                                   .digestKey = isDigested ? &*_digestKey : nullptr,
                                   .wifiOnly = _shouldUseWiFiOnly});
   // A transport that has gone, or that drops the request, drops the completion as well: whoever waits learns of it.
-  const auto transport = _transport.lock();
-  if (!transport) return;
-  transport->postURLRequestWithCompletionHandler(
+  const auto sender = transport();
+  if (!sender) return;
+  sender->postURLRequestWithCompletionHandler(
       std::move(request), [state = _state, name = _name, completion = std::move(completion)](
                               const ByteData&, const std::shared_ptr<const HttpResponse>& response,
                               const std::optional<Error>& error) mutable {

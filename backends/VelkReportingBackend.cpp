@@ -80,7 +80,13 @@ std::uint64_t VelkReportingBackend::batchedEventsCount() const { return 0; }
 
 void VelkReportingBackend::setReportingSessionConnectivityDelegate(
     std::weak_ptr<ReportingSessionConnectivityInterface> transport) {
-  _transport = std::move(transport);
+  Guard guard(_lock);
+  _transport.swap(transport);
+}
+
+std::shared_ptr<ReportingSessionConnectivityInterface> VelkReportingBackend::transport() const {
+  Guard guard(_lock);
+  return _transport.lock();
 }
 
 void VelkReportingBackend::setSelfVersion(std::string_view version) {

@@ -123,6 +123,9 @@ class VelkReportingBackend : public std::enable_shared_from_this<VelkReportingBa
  protected:
   /// Any thread.
   [[nodiscard]] std::optional<std::string> combinedSessionIDString() const;
+  /// The session's transport as it is now; null when there is none or it has gone. Any thread: uploads run beside the
+  /// session's queue, which replaces the transport when the user changes.
+  [[nodiscard]] std::shared_ptr<ReportingSessionConnectivityInterface> transport() const;
 
   // Constant after construction.
   const BackendContext _context;
@@ -136,16 +139,15 @@ class VelkReportingBackend : public std::enable_shared_from_this<VelkReportingBa
   const BackendStateHandle _state;
   std::atomic<std::uint32_t> _totalBytesSent{0};            ///< since the last stop message
   std::atomic<std::uint32_t> _bytesSentSinceLastReport{0};  ///< since the last periodic report
+  std::atomic<std::uint16_t> _eventID{0};                   ///< the last event's number
 
   // Used on the owning session's queue only.
-  std::weak_ptr<ReportingSessionConnectivityInterface> _transport;
   DottedVersion _selfVersion;
   std::string _reportVersion = _selfVersion.reportVersion();
   double _startTimestamp = 0;  ///< seconds since 1970
   std::uint32_t _sessionID = 0;
   std::int32_t _compType = 0;
   std::uint16_t _clientVersion = 0;
-  std::uint16_t _eventID = 0;
   std::string _udid;
   std::optional<std::string> _productVersion;
   std::optional<std::string> _buildVersion;
@@ -161,8 +163,9 @@ class VelkReportingBackend : public std::enable_shared_from_this<VelkReportingBa
   bool _allowNestedData = false;
 
  private:
-  // Guarded by _lock: other sessions write these when sessions join a hierarchy.
+  // Guarded by _lock: other sessions write these when sessions join a hierarchy, and uploads read the transport.
   mutable Lock _lock;
+  std::weak_ptr<ReportingSessionConnectivityInterface> _transport VELK_GUARDED_BY(_lock);
   std::optional<std::string> _combinedSessionIDString VELK_GUARDED_BY(_lock);
   std::optional<double> _samplingThreshold VELK_GUARDED_BY(_lock);
 };

@@ -107,7 +107,7 @@ class FakeBackend : public VelkReportingBackend {
   [[nodiscard]] const std::optional<ByteData>& heldDigestKey() const { return _digestKey; }
   [[nodiscard]] std::int32_t heldDigestAlgorithm() const { return _digestAlgorithm; }
   [[nodiscard]] bool nestedDataAllowed() const { return _allowNestedData; }
-  [[nodiscard]] std::shared_ptr<ReportingSessionConnectivityInterface> transport() const { return _transport.lock(); }
+  using VelkReportingBackend::transport;
   /// Its attributes as one line.
   [[nodiscard]] std::string attributes() const;
 
