@@ -49,12 +49,13 @@ std::uint64_t PeriodicModules::handOver(Module module) {
   return _lastTicket;
 }
 
-bool PeriodicModules::store(std::uint64_t ticket, Module& replaced) {
+bool PeriodicModules::store(std::uint64_t ticket, std::vector<Module>& replaced) {
   Guard guard(_lock);
   auto arrived = _handedOver.extract(ticket);
   if (!arrived) return false;
-  replaced = std::move(arrived.mapped());
-  _stored[replaced->number()].swap(replaced);
+  Module& place = _stored[arrived.mapped()->number()];
+  if (place) replaced.push_back(std::move(place));
+  place = std::move(arrived.mapped());
   return true;
 }
 

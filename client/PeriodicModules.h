@@ -53,7 +53,7 @@ class PeriodicModules {
   /// A ticket for `store`, or 0 when there is no more room.
   [[nodiscard]] std::uint64_t handOver(Module module);
   /// Puts what was handed over in its place. False when it was taken away meanwhile; else `replaced` is what was there.
-  [[nodiscard]] bool store(std::uint64_t ticket, Module& replaced);
+  [[nodiscard]] bool store(std::uint64_t ticket, std::vector<Module>& replaced);
   /// All there is under that number, withdrawn.
   [[nodiscard]] std::vector<Module> take(std::uint32_t number);
   /// The same of all numbers.

@@ -31,17 +31,17 @@ PropertyDictionary realtimeMessage(std::uint16_t category, std::uint16_t type, P
 /// Wakes whoever waits for its turn, also when the turn never comes.
 class Turn {
  public:
-  explicit Turn(std::shared_ptr<Semaphore> ended) : _ended(std::move(ended)) {}
-  Turn(Turn&&) noexcept = default;
+  explicit Turn(Semaphore& ended) : _ended(&ended) {}
+  Turn(Turn&& other) noexcept : _ended(std::exchange(other._ended, nullptr)) {}
   Turn& operator=(Turn&&) = delete;
   Turn(const Turn&) = delete;
   Turn& operator=(const Turn&) = delete;
   ~Turn() {
-    if (_ended) _ended->signal();
+    if (_ended != nullptr) _ended->signal();
   }
 
  private:
-  std::shared_ptr<Semaphore> _ended;
+  Semaphore* _ended;
 };
 
 }  // namespace
@@ -77,21 +77,21 @@ bool PeriodicTasks::registerModule(std::uint32_t module, bool needToUpdate, bool
 }
 
 void PeriodicTasks::store(std::uint64_t ticket, std::uint32_t module, bool needToUpdate, bool needToReport) {
-  PeriodicModules::Module replaced;
+  std::vector<PeriodicModules::Module> replaced;
   if (!_modules.store(ticket, replaced)) return;
   log::standard(texts::kRegisteredModule, module, needToUpdate ? "" : " no", needToReport ? "" : " no");
-  if (replaced) dispose({std::move(replaced)});
+  dispose(std::move(replaced));
 }
 
 void PeriodicTasks::unregisterModule(std::uint32_t module, bool mayWait) {
   if (isInCallback()) return static_cast<void>(takeModule(module));
   if (!mayWait || _queue->beneath()->isCurrent()) return dispose(takeModule(module));
-  const auto ended = std::make_shared<Semaphore>();
-  const auto taken = std::make_shared<std::optional<std::vector<PeriodicModules::Module>>>();
-  _queue->async([self = shared_from_this(), turn = Turn(ended), taken, module] { *taken = self->takeModule(module); });
-  ended->wait();
-  if (!*taken) *taken = takeModule(module);  // no turn ever comes
-  for (const auto& each : **taken) each->waitForCalls();
+  Semaphore ended;
+  std::optional<std::vector<PeriodicModules::Module>> taken;
+  _queue->async([self = shared_from_this(), turn = Turn(ended), &taken, module] { taken = self->takeModule(module); });
+  ended.wait();
+  if (!taken) taken = takeModule(module);  // no turn ever comes
+  for (const auto& each : *taken) each->waitForCalls();
 }
 
 std::vector<PeriodicModules::Module> PeriodicTasks::takeModule(std::uint32_t module) {
