@@ -89,7 +89,9 @@ TEST_F(Examples, EveryFunctionOfTheCInterfaceGivesBackWhatItTook) {
   const std::string file = daemon->directory() + "/upload.txt";
   writeContents(file, "contents");
   for (const bool daemonIsThere : {true, false}) {
-    if (!daemonIsThere) ASSERT_EQ(daemon->stop(), 0);
+    if (!daemonIsThere) {
+      ASSERT_EQ(daemon->stop(), 0);
+    }
     const Finished finished = run({VELK_EVERY_FUNCTION_PROGRAM, "9", file}, {{"XDG_STATE_HOME", daemon->directory()}});
     EXPECT_EQ(finished.status, 0) << finished.output << finished.errors;
     EXPECT_NE(finished.output.find(daemonIsThere ? "backends: 1\n" : "backends: 0\n"), std::string::npos);
