@@ -12,8 +12,10 @@ namespace velk {
 namespace {
 
 constexpr Duration kConnectionLinger = std::chrono::seconds(60);
-constexpr long kMaximumConnectionsPerHost = 8;
-constexpr long kMaximumConnections = 64;
+/// Requests at once, each of which has a connection at most. The library's own bounds are not used: under load it
+/// forgets requests that wait for a connection now and then, until they time out.
+constexpr std::size_t kMaximumRequestsPerServer = 8;
+constexpr std::size_t kMaximumRequests = 64;
 constexpr long kMaximumIdleConnections = 16;
 constexpr std::size_t kMaximumSpareHandles = 4;
 
@@ -95,6 +97,7 @@ void CurlEngine::run() {
     int count = 0;
     curl_multi_perform(_multi.get(), &count);
     collectFinished();
+    serveLines();
     expireWaiting();
     sleep();
   }
@@ -114,7 +117,50 @@ bool CurlEngine::takeCommands(std::vector<Command>& into) {
 void CurlEngine::start(std::shared_ptr<CurlTask> task) {
   _mayHaveConnections = true;
   _idleSince = now();
-  attempt(std::move(task));
+  enter(std::move(task));
+}
+
+void CurlEngine::enter(std::shared_ptr<CurlTask> task) {
+  auto& server = _servers[task->address().server];
+  if (server.line.empty() && hasRoom(server)) return attempt(std::move(task));
+  _lineExpires = std::min(_lineExpires, task->deadline());
+  server.line.push_back(std::move(task));
+  ++_inLine;
+}
+
+bool CurlEngine::hasRoom(const Server& server) const {
+  return server.running < kMaximumRequestsPerServer && _running.size() < kMaximumRequests;
+}
+
+/// Lets those in line go on where others have finished, and forgets servers that nobody talks to.
+void CurlEngine::serveLines() {
+  if (_lineExpires <= now()) expireLines();
+  for (auto& [name, server] : _servers) {
+    while (!server.line.empty() && hasRoom(server)) {
+      auto task = std::move(server.line.front());
+      server.line.pop_front();
+      --_inLine;
+      attempt(std::move(task));
+    }
+  }
+  if (_inLine == 0) _lineExpires = SteadyTime::max();
+  std::erase_if(_servers, [](const auto& entry) { return entry.second.running == 0 && entry.second.line.empty(); });
+}
+
+void CurlEngine::expireLines() {
+  const auto time = now();
+  _lineExpires = SteadyTime::max();
+  for (auto& [name, server] : _servers) {
+    _inLine -= std::erase_if(server.line, [&](const auto& task) {
+      if (task->deadline() > time) {
+        _lineExpires = std::min(_lineExpires, task->deadline());
+        return false;
+      }
+      task->complete(Error{kHttpErrorDomain, CURLE_OPERATION_TIMEDOUT,
+                           task->address().host + ": too many requests before it within the request's time"});
+      return true;
+    });
+  }
 }
 
 void CurlEngine::attempt(std::shared_ptr<CurlTask> task) {
@@ -136,6 +182,7 @@ void CurlEngine::attempt(std::shared_ptr<CurlTask> task) {
     task->complete(outOfMemory(*task));
     return;
   }
+  ++_servers[task->address().server].running;
   CURL* const key = easy.release();
   _running.emplace(key, std::move(transfer));
 }
@@ -161,6 +208,7 @@ void CurlEngine::finished(CURL* handle, CURLcode code) {
   const auto transfer = std::move(found->second);
   _running.erase(found);
   const auto task = transfer->task();
+  --_servers[task->address().server].running;
   const bool waits = task->configuration().waitsForConnectivity && transfer->failedForLackOfNetwork(code);
   const auto error = transfer->error(code);
   curl_multi_remove_handle(_multi.get(), handle);
@@ -171,12 +219,12 @@ void CurlEngine::finished(CURL* handle, CURLcode code) {
     _waiting.push_back(task);
   } else {
     _routes = std::make_unique<RouteMonitor>();
-    attempt(task);
+    enter(task);
   }
 }
 
 void CurlEngine::retryWaiting() {
-  for (auto& task : std::exchange(_waiting, {})) attempt(std::move(task));
+  for (auto& task : std::exchange(_waiting, {})) enter(std::move(task));
 }
 
 void CurlEngine::expireWaiting() {
@@ -210,6 +258,7 @@ int CurlEngine::sleepMilliseconds() const {
   auto until = SteadyTime::max();
   if (_running.empty() && _waiting.empty() && _mayHaveConnections) until = _idleSince + kConnectionLinger;
   for (const auto& task : _waiting) until = std::min(until, task->deadline());
+  until = std::min(until, _lineExpires);
   if (until == SteadyTime::max()) return kForEver;
   const auto left = std::chrono::ceil<std::chrono::milliseconds>(until - now()).count();
   return static_cast<int>(std::clamp<std::int64_t>(left, 0, kForEver));
@@ -222,8 +271,6 @@ void CurlEngine::forgetConnections() {
   _multi.reset(curl_multi_init());
   _mayHaveConnections = false;
   if (!_multi) return;
-  curl_multi_setopt(_multi.get(), CURLMOPT_MAX_HOST_CONNECTIONS, kMaximumConnectionsPerHost);
-  curl_multi_setopt(_multi.get(), CURLMOPT_MAX_TOTAL_CONNECTIONS, kMaximumConnections);
   curl_multi_setopt(_multi.get(), CURLMOPT_MAXCONNECTS, kMaximumIdleConnections);
 }
 
@@ -235,6 +282,9 @@ void CurlEngine::endAll() {
   }
   _running.clear();
   for (const auto& task : std::exchange(_waiting, {})) task->complete(ended(*task));
+  for (const auto& [name, server] : std::exchange(_servers, {})) {
+    for (const auto& task : server.line) task->complete(ended(*task));
+  }
   std::vector<Command> commands;
   {
     Guard guard(_lock);

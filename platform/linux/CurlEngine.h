@@ -4,7 +4,9 @@
 
 #include <curl/curl.h>
 
+#include <deque>
 #include <memory>
+#include <string>
 #include <thread>
 #include <unordered_map>
 #include <vector>
@@ -50,6 +52,12 @@ class CurlEngine {
   using Easy = std::unique_ptr<CURL, EasyFreer>;
   using Multi = std::unique_ptr<CURLM, MultiFreer>;
 
+  /// What goes to one server: so much is sent at once, the rest stands in line.
+  struct Server {
+    std::size_t running = 0;
+    std::deque<std::shared_ptr<CurlTask>> line;
+  };
+
   /// Hands a command to the thread; gives it back when the thread is (or cannot be) there no more.
   [[nodiscard]] bool handOver(Command command);
   bool startThreadLocked() VELK_REQUIRES(_lock);
@@ -58,6 +66,10 @@ class CurlEngine {
   void run();
   [[nodiscard]] bool takeCommands(std::vector<Command>& into);
   void start(std::shared_ptr<CurlTask> task);
+  void enter(std::shared_ptr<CurlTask> task);
+  [[nodiscard]] bool hasRoom(const Server& server) const;
+  void serveLines();
+  void expireLines();
   void attempt(std::shared_ptr<CurlTask> task);
   void resumePaused(const CurlTask& task);
   void collectFinished();
@@ -76,6 +88,10 @@ class CurlEngine {
 
   // The thread's own.
   std::unordered_map<CURL*, std::unique_ptr<CurlTransfer>> _running;
+  /// By the server's name. The number of tasks that stand in line, and when the first of them may have to leave it.
+  std::unordered_map<std::string, Server> _servers;
+  std::size_t _inLine = 0;
+  SteadyTime _lineExpires = SteadyTime::max();
   /// Tasks that wait for a network; while there are any, the monitor is open.
   std::vector<std::shared_ptr<CurlTask>> _waiting;
   std::unique_ptr<RouteMonitor> _routes;

@@ -18,9 +18,9 @@ namespace {
 /// How far a delegate may be behind before its transfer is held up.
 constexpr std::size_t kMaximumUndelivered = 256 * 1024;
 
-std::string urlPart(CURLU* url, CURLUPart part) {
+std::string urlPart(CURLU* url, CURLUPart part, unsigned flags = 0) {
   char* text = nullptr;
-  if (curl_url_get(url, part, &text, 0) != CURLUE_OK) return {};
+  if (curl_url_get(url, part, &text, flags) != CURLUE_OK) return {};
   std::string copy(text);
   curl_free(text);
   return copy;
@@ -69,7 +69,7 @@ Result<HttpAddress> parseHttpAddress(const std::string& url) {
       curl_url_set(handle.get(), CURLUPART_URL, url.c_str(), CURLU_NON_SUPPORT_SCHEME) != CURLUE_OK) {
     return failure(kHttpErrorDomain, CURLE_URL_MALFORMAT, "the address is malformed");
   }
-  HttpAddress address{lowerCased(urlPart(handle.get(), CURLUPART_SCHEME)), urlPart(handle.get(), CURLUPART_HOST)};
+  HttpAddress address{lowerCased(urlPart(handle.get(), CURLUPART_SCHEME)), urlPart(handle.get(), CURLUPART_HOST), {}};
   if (address.scheme != "http" && address.scheme != "https") {
     return failure(kHttpErrorDomain, CURLE_UNSUPPORTED_PROTOCOL,
                    "addresses of the form \"" + address.scheme + ":\" are not spoken");
@@ -78,6 +78,8 @@ Result<HttpAddress> parseHttpAddress(const std::string& url) {
     address.host = address.host.substr(1, address.host.size() - 2);
   }
   if (address.host.empty()) return failure(kHttpErrorDomain, CURLE_URL_MALFORMAT, "the address names no host");
+  address.server = address.scheme + "://" + lowerCased(address.host) + ":" +
+                   urlPart(handle.get(), CURLUPART_PORT, CURLU_DEFAULT_PORT);
   return address;
 }
 

@@ -22,6 +22,8 @@ struct HttpAddress {
   std::string scheme;
   /// Without brackets.
   std::string host;
+  /// Whom it names: scheme, host and port.
+  std::string server;
   [[nodiscard]] bool isLoopback() const;
 };
 /// Fails for anything but an absolute http or https address with a host.

@@ -4,7 +4,9 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
+#include <atomic>
 #include <fstream>
+#include <thread>
 
 #include "tests/support/TlsTestServer.h"
 #include "tests/unit/platform/HttpRecorder.h"
@@ -276,6 +278,52 @@ TEST_F(HttpSessionTest, ManyTasksAtOnceAllEnd) {
   ASSERT_TRUE(waitForCompletions(100));
   for (int i = 0; i < 100; ++i) EXPECT_EQ(_delegate->outcomes[std::to_string(i)].body, "/" + std::to_string(i));
   EXPECT_LE(_server.connectionCount(), 8);
+}
+
+TEST_F(HttpSessionTest, AServerGetsEightRequestsAtOnceAndTheRestInOrder) {
+  std::atomic<int> underWay{0};
+  std::atomic<int> most{0};
+  _server.setHandler([&](const TlsTestServer::Request&) {
+    const int now = ++underWay;
+    int seen = most;
+    while (now > seen && !most.compare_exchange_weak(seen, now)) {
+    }
+    // The first eight answer only when all of them are there.
+    for (; most < 8; std::this_thread::yield()) {
+    }
+    --underWay;
+    return TlsTestServer::Response{};
+  });
+  for (int number = 0; number < 100; ++number) start(request(), std::to_string(number));
+  ASSERT_TRUE(waitForCompletions(100));
+  for (const auto& [name, outcome] : _delegate->outcomes) EXPECT_FALSE(outcome.error) << name;
+  EXPECT_EQ(most, 8);
+  EXPECT_LE(_server.connectionCount(), 8);
+}
+
+TEST_F(HttpSessionTest, ATaskInLineEndsAtItsTimeout) {
+  _server.setResponse({.silent = true});
+  for (int number = 0; number < 8; ++number) start(request(), std::to_string(number));
+  ASSERT_TRUE(_server.waitForRequests(8));
+  auto late = request();
+  late.timeout = 100ms;
+  start(std::move(late), "late");
+  ASSERT_TRUE(waitForCompletions(1));
+  const auto& outcome = _delegate->outcomes["late"];
+  ASSERT_TRUE(outcome.error);
+  EXPECT_EQ(outcome.error->code, 28);
+  EXPECT_EQ(outcome.error->description, "127.0.0.1: too many requests before it within the request's time");
+  EXPECT_EQ(_server.requests().size(), 8U);
+}
+
+TEST_F(HttpSessionTest, TheEndOfTheServiceEndsTasksInLine) {
+  _server.setResponse({.silent = true});
+  for (int number = 0; number < 20; ++number) start(request(), std::to_string(number));
+  ASSERT_TRUE(_server.waitForRequests(8));
+  _session.reset();
+  _service.reset();
+  ASSERT_TRUE(waitForCompletions(20));
+  for (const auto& [name, outcome] : _delegate->outcomes) EXPECT_TRUE(outcome.error) << name;
 }
 
 TEST_F(HttpSessionTest, ASlowDelegateHoldsTheTransferUp) {
