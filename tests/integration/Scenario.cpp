@@ -1,7 +1,10 @@
 #include "tests/integration/Scenario.h"
 
 #include <algorithm>
+#include <cstdlib>
 #include <fstream>
+#include <iostream>
+#include <random>
 #include <sstream>
 
 #include "foundation/Json.h"
@@ -96,6 +99,14 @@ std::vector<std::string> linesWith(const LineCollector& log, const std::string& 
     if (line.find(part) != std::string::npos) found.push_back(line);
   }
   return found;
+}
+
+unsigned testSeed() {
+  const char* given = std::getenv("VELK_TEST_SEED");
+  const unsigned seed =
+      given != nullptr ? static_cast<unsigned>(std::strtoul(given, nullptr, 10)) : std::random_device()();
+  std::cout << "VELK_TEST_SEED=" << seed << std::endl;
+  return seed;
 }
 
 PropertyArray noLists() { return {PropertyValue(), PropertyValue(), PropertyValue()}; }

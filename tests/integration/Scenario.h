@@ -50,6 +50,8 @@ void writeContents(const std::filesystem::path& file, const std::string& content
 
 /// Lines of the log that hold `part`.
 [[nodiscard]] std::vector<std::string> linesWith(const LineCollector& log, const std::string& part);
+/// What a random test is made from: VELK_TEST_SEED, or another one each time; printed.
+[[nodiscard]] unsigned testSeed();
 /// Three absent lists, the answer of a session without configuration.
 [[nodiscard]] PropertyArray noLists();
 
