@@ -129,6 +129,10 @@ std::shared_ptr<ReportingdSession> CorrelatedSessions::ancestorWithAggregator(co
   const auto token = session.hierarchyToken();
   const auto* list = token ? sessions(*token) : nullptr;
   if (list == nullptr) return nullptr;
+  // Asked for every event: most hierarchies have nobody who aggregates.
+  if (std::none_of(list->begin(), list->end(), [](const auto& listed) { return listed->hasAggregator(); })) {
+    return nullptr;
+  }
   for (const auto& [level, ancestor] : firstSessionsBelow(session.hierarchyLevel(), *list)) {
     if (ancestor->hasAggregator()) return ancestor;
   }
