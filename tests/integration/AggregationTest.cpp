@@ -240,6 +240,26 @@ TEST_F(Aggregation, AnAggregatorThatIsKilledHoldsNobodyUp) {
   EXPECT_EQ(child.finish(), 0);
 }
 
+TEST_F(Aggregation, AStoppedAggregatorThatIsKilledLeavesNothingBehind) {
+  start();
+  auto& parent = relative(1, "parent", 0, true);
+  auto& child = relative(2, "child", 1);
+  parent.process().signal(SIGSTOP);
+  const std::string padding(60'000, 'x');
+  for (std::int64_t n = 0; n < 60; ++n) child.sendEvent(7, 1, PropertyDictionary{{"n", n}, {"padding", padding}});
+  ASSERT_TRUE(daemon->log().waitForPart(kProxyFailure)) << "nothing more fits";
+  const std::size_t lines = daemon->log().lines().size();
+  parent.process().signal(SIGKILL);
+  ASSERT_TRUE(daemon->log().waitForPart("invalidateReportingSession: ReportingdSession", lines));
+  ASSERT_TRUE(daemon->log().waitForPart("dealloc: ReportingdSession dealloc: 1", lines));
+
+  ASSERT_TRUE(sendNumber(child, 7, 60));  // what was sent to the parent in vain lies behind it
+  const std::size_t failures = daemon->log().count(kProxyFailure);
+  ASSERT_TRUE(sendNumber(child, 7, 61));
+  EXPECT_EQ(daemon->log().count(kProxyFailure), failures) << "nobody is called any more";
+  ASSERT_TRUE(server.waitForEvents(62, {7}));
+}
+
 std::size_t residentBytes(pid_t process) {
   std::ifstream file("/proc/" + std::to_string(process) + "/statm");
   std::size_t total = 0;
@@ -258,20 +278,20 @@ TEST_F(Aggregation, AStoppedAggregatorDelaysNobodyAndLosesOnlyWhatDoesNotFit) {
   parent.process().signal(SIGSTOP);
 
   constexpr std::int64_t kEvents = 10'000;
-  const std::string padding(600, 'x');
+  const std::string padding(4000, 'x');
   const auto sendEvent = [&](std::int64_t n) {
     return child.sendEvent(7, 1, PropertyDictionary{{"n", n}, {"padding", padding}});
   };
-  std::int64_t n = 0;
-  while (n < kEvents / 2) sendEvent(n++);
-  EXPECT_FALSE(child.reply(sendEvent(n++)).empty());
   const std::size_t before = residentBytes(daemon->process().pid());
+  std::int64_t n = 0;
   while (n < kEvents - 1) sendEvent(n++);
   EXPECT_FALSE(child.reply(sendEvent(n++)).empty()) << "all are answered while the parent stands still";
   const std::size_t after = residentBytes(daemon->process().pid());
 #if !defined(__SANITIZE_ADDRESS__) && !defined(__SANITIZE_THREAD__)
-  // What the second half left behind is less than it would be if it waited for the parent.
-  EXPECT_LT(after, before + 3 * 1024 * 1024);
+  // The parent's share alone would be 40 MiB; batches and posts under way take some.
+  EXPECT_LT(after, before + std::size_t{24} * 1024 * 1024);
+#else
+  static_cast<void>(before + after);  // the sanitizers keep memory of their own
 #endif
   EXPECT_TRUE(sendNumber(stranger, 7, -1)) << "nor does anybody else wait";
   EXPECT_TRUE(daemon->log().waitForPart(kProxyFailure));
@@ -284,7 +304,7 @@ TEST_F(Aggregation, AStoppedAggregatorDelaysNobodyAndLosesOnlyWhatDoesNotFit) {
   ASSERT_TRUE(sendNumber(parent, 8, n + 1));
   const auto numbers = Heard(parent).numbers();
   EXPECT_TRUE(std::is_sorted(numbers.begin() + 1, numbers.end() - 3)) << "the order is kept";
-  EXPECT_GT(numbers.size(), 1000U);
+  EXPECT_GT(numbers.size(), 400U);
   EXPECT_LT(numbers.size() * padding.size(), 3 * 1024 * 1024) << "an outbox and what the socket holds";
   EXPECT_EQ(numbers[numbers.size() - 2], n) << "there is room again";
 }
