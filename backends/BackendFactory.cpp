@@ -2,6 +2,7 @@
 #include <array>
 #include <string_view>
 
+#include "backends/DashboardBackend.h"
 #include "backends/HTTPSPostBackend.h"
 #include "backends/LogTexts.h"
 #include "backends/PowerLogBackend.h"
@@ -32,6 +33,10 @@ std::shared_ptr<VelkReportingBackend> makeHTTPSPostBackend(const Section& sectio
   return HTTPSPostBackend::initWithName(section.context, section.name, section.profile, section.productFamily);
 }
 
+std::shared_ptr<VelkReportingBackend> makeDashboardBackend(const Section& section) {
+  return DashboardBackend::initWithName(section.context, section.name, section.profile, section.productFamily);
+}
+
 std::shared_ptr<VelkReportingBackend> makePowerLogBackend(const Section& section) {
   return PowerLogBackend::initWithName(section.context, section.name, section.profile, section.productFamily);
 }
@@ -55,7 +60,7 @@ struct Row {
 
 // Tested from the top.
 constexpr std::array kRows{
-    Row{kVelkReportingBackendDashboard, false, makeNothingYet},
+    Row{kVelkReportingBackendDashboard, false, makeDashboardBackend},
     Row{kVelkReportingBackendUploadServer, false, makeNothingYet},
     Row{kVelkReportingBackendHTTPPost, true, makeHTTPSPostBackend},
     Row{kVelkReportingBackendHTTPPost2, false, makeHTTPSPostBackend},

@@ -84,6 +84,38 @@ inline constexpr const char* kQuillDoesNotRespond =
 inline constexpr const char* kQuillBundleUnusable = "QuillBackend(initWithName): no Quill adaptor: %s";
 inline constexpr const char* kQuillEventLost = "QuillBackend(sendMessage): an event is lost: %s";
 
+// Dashboard.
+inline constexpr const char* kNoServerIP = "DashboardBackend(initWithName): can't resolve server IP";
+inline constexpr const char* kNoServerPort = "DashboardBackend(initWithName): can't resolve server port";
+inline constexpr const char* kSocketFailed = "DashboardBackend(initWithName): socket() failed (%d)";
+inline constexpr const char* kAllNullParameters = "DashboardBackend(initWithName): initWitName with all null params.";
+inline constexpr const char* kConnectFailed = "DashboardBackend(initWithName): socket connect() failed.";
+inline constexpr const char* kNoTimerSource = "DashboardBackend(initWithName): can't create timer source.";
+inline constexpr const char* kCannotBind = "DashboardBackend(useReliableUDP): can't bind socket, %d";
+inline constexpr const char* kNoReadSource = "DashboardBackend(useReliableUDP): can't create read source";
+inline constexpr const char* kNoMemory = "DashboardBackend(sendMessage): can't malloc.";
+inline constexpr const char* kCleanUpAtTick = "DashboardBackend(myPeriodicTask): clean up at myPeriodicTask.";
+inline constexpr const char* kLastResort = "DashboardBackend(myPeriodicTask): scheduled last resort clean-up in %d ms.";
+inline constexpr const char* kNoLogDataURL = "DashboardBackend(uploadLogData): Post URL for log data array is nil";
+inline constexpr const char* kLogDataNotSerialized =
+    "DashboardBackend(uploadLogData): Failed to serialize log data array for upload";
+inline constexpr const char* kLogDataUploaded = "DashboardBackend(uploadLogData): Log data uploaded to %s";
+inline constexpr const char* kLogDataNotUploaded =
+    "DashboardBackend(uploadLogData): Error uploading log data array (%s)";
+
+// File uploads.
+inline constexpr const char* kNoUploadPostURL = "UploadBackend(initWithName): can't resolve upload post URL.";
+inline constexpr const char* kUploadingFile = "UploadBackend(uploadFileAtPath): Uploading file %s";
+inline constexpr const char* kNotARegularFile = "UploadBackend(uploadFileAtPath): Only upload a regular file.";
+inline constexpr const char* kInputFileIsEmpty = "UploadBackend(uploadFileAtPath): Input file is empty";
+inline constexpr const char* kNoUploadRequest = "UploadBackend(uploadFileAtPath): Unable to create URL request";
+inline constexpr const char* kUploadPostFailed = "UploadBackend(uploadFileAtPath): post %s";
+inline constexpr const char* kUploadAnswered =
+    "UploadBackend(uploadFileAtPath): sending to |%s|, Json output: %s";
+inline constexpr const char* kUploadTooLarge =
+    "UploadBackend(uploadFileAtPath): a file of %llu bytes is larger than the %llu that are taken";
+inline constexpr const char* kUploadNotKept = "UploadBackend(uploadFileAtPath): the compressed file is lost: %s";
+
 // Macro expansion.
 inline constexpr const char* kExpandingMacro = "expandMacroForDataSet: Expanding macro '%@' into '%@'";
 

@@ -23,6 +23,7 @@
 #include "platform/PowerLog.h"
 #include "platform/Process.h"
 #include "platform/ThreadPool.h"
+#include "platform/UdpSocket.h"
 #include "platform/UserDefaults.h"
 
 namespace velk {
@@ -87,6 +88,8 @@ struct DaemonProcess::Parts {
   process::RunLoop& runLoop;
   const Directories directories;
 
+  /// Above the pool, whose last tasks may still let go of sockets.
+  const std::unique_ptr<UdpSocketService> udpSockets;
   const std::unique_ptr<ThreadPool> pool;
   /// For the transport of storebags alone: what a session waits for with the agent's lock held never waits for a thread
   /// behind the sessions that want this lock.
@@ -123,6 +126,7 @@ struct DaemonProcess::Parts {
 DaemonProcess::Parts::Parts(const DaemonOptions& options, process::RunLoop& loop, bool activated)
     : runLoop(loop),
       directories(daemonDirectories()),
+      udpSockets(makeUdpSocketService()),
       pool(makeThreadPool(poolOptions())),
       storebagPool(makeThreadPool()),
       defaults(openUserDefaults(kVelkReportingDefaultsSuite, directories.state, directories.configuration)),
@@ -140,7 +144,7 @@ DaemonProcess::Parts::Parts(const DaemonOptions& options, process::RunLoop& loop
           *pool, idleLimit(options, activated), [this] { return isOccupied(); }, [this] { runLoop.wakeUp(); }),
       platform{systemClock(), *pool,     *defaults, *device,     *locale,        *http,
                *random,       idleWatch, *consent,  *statistics, *logSubmission, adaptorBundle.get(),
-               powerLog.get()},
+               powerLog.get(), udpSockets.get()},
       storebagPlatform{systemClock(), *storebagPool, *defaults, *device,     *locale,       *http,
                        *random,       idleWatch,     *consent,  *statistics, *logSubmission},
       messageLog(directories.logs, platform.clock, *logSubmission),

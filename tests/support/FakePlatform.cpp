@@ -33,8 +33,10 @@ FakePlatform::FakePlatform() = default;
 FakePlatform::~FakePlatform() = default;
 
 Platform FakePlatform::platform() {
-  return Platform{clock(), scheduler, defaults, device,  locale,       _http,
-                  random,  keepAlive, consent,  process, logSubmission};
+  Platform platform{clock(), scheduler, defaults, device,  locale,       _http,
+                    random,  keepAlive, consent,  process, logSubmission};
+  platform.udpSockets = &udpSockets;
+  return platform;
 }
 
 std::shared_ptr<HttpSession> FakePlatform::ForwardingHttpService::makeSession(

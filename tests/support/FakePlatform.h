@@ -11,6 +11,7 @@
 #include "tests/support/FakeDeviceInformation.h"
 #include "tests/support/FakeLocale.h"
 #include "tests/support/FakeRandom.h"
+#include "tests/support/FakeUdpSockets.h"
 #include "tests/support/FakeUserDefaults.h"
 #include "tests/support/ManualScheduler.h"
 
@@ -87,6 +88,7 @@ class FakePlatform {
   FakeKeepAlive keepAlive;
   FakeProcessStatistics process;
   FakeLogSubmission logSubmission;
+  FakeUdpSockets udpSockets;
 
  private:
   /// Hands on to whatever service the test has set.

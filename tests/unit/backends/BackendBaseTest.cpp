@@ -167,7 +167,7 @@ TEST_F(BackendFactoryTest, RefusesUnknownNames) {
 }
 
 TEST_F(BackendFactoryTest, PassesOverNamesWhoseClassesItLacks) {
-  for (const char* name : {"dashboard", "upload_server"}) {
+  for (const char* name : {"upload_server"}) {
     EXPECT_FALSE(make(name, PropertyDictionary{})) << name;
     EXPECT_FALSE(log.contains(std::string("VelkReportingBackend(newBackendWithName): ") + name));
   }
