@@ -2,8 +2,9 @@
 
 #include <ostream>
 
+#include "foundation/Format.h"
+#include "foundation/JsonLine.h"
 #include "platform/Files.h"
-#include "tools/JsonLines.h"
 
 namespace velk::ctl {
 
@@ -19,7 +20,7 @@ bool isFileError(const Error& error, files::Code code) {
 
 void Context::report(const PropertyDictionary& object, const std::string& words) {
   if (json) {
-    out << tools::jsonText(object) << std::endl;
+    out << velk::json::line(object) << std::endl;
   } else if (!words.empty()) {
     out << words << std::endl;
   }
@@ -29,9 +30,9 @@ void Context::report(const PropertyDictionary& object, const std::string& words)
 void Context::fail(ExitCode code, const std::string& sentence) {
   exitCode = code;
   if (json) {
-    error << tools::jsonText({{"error", sentence}, {"status", tools::status(code)}}) << std::endl;
+    error << velk::json::line({{"error", sentence}, {"status", tools::status(code)}}) << std::endl;
   } else {
-    error << "velkreportingctl: " << sentence << std::endl;
+    error << "velkreportingctl: " << withoutControlCharacters(sentence) << std::endl;
   }
 }
 
