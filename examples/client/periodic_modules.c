@@ -22,11 +22,7 @@ static void serve(VelkReportingValue* statistics, void* context) {
     module->measurements++;
     return;
   }
-  /* Entries that several modules put under one key are merged. */
-  VelkReportingValue* own = VelkReportingDictionaryCreate();
-  VelkReportingDictionarySetInteger(own, module->name, module->measurements);
-  VelkReportingDictionarySet(statistics, "measurements", own);
-  VelkReportingValueRelease(own);
+  VelkReportingDictionarySetInteger(statistics, module->name, module->measurements);
   module->reports++;
 }
 
@@ -51,7 +47,7 @@ int main(int argumentCount, char** arguments) {
   while (reader.reports < wanted || writer.reports < wanted) thrd_sleep(&(struct timespec){.tv_nsec = 20000000}, NULL);
 
   VelkReportingClientStopLogTimer(client);
-  /* Modules may be unregistered one by one; the last release ends them all. */
+  /* Waits until the tick is over; the last release ends the other module. */
   VelkReportingClientUnregisterPeriodicTask(client, 1);
   VelkReportingClientRelease(client);
   printf("reported %d times\n", (int)writer.reports);

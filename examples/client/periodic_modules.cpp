@@ -27,8 +27,7 @@ class Module {
       ++_measurements;
       return;
     }
-    // Entries that several modules put under one key are merged.
-    statistics->set("measurements", PropertyDictionary{{_name, _measurements.load()}});
+    statistics->set(_name, _measurements.load());
     if (_left.fetch_sub(1) > 0) _reports->count_down();
   }
   void expectReports(int count) { _left = count; }
@@ -62,6 +61,7 @@ int main(int argumentCount, char** arguments) {
   client->startLogTimerWithInterval(1, 2, 103, 1);
   reports->wait();
   client->stopLogTimer();
+  while (number > 0) client->unregisterPeriodTaskForModule(number--);  // waits until the tick is over
   std::printf("reported %d times\n", wanted);
   return EXIT_SUCCESS;
 }

@@ -73,6 +73,7 @@ int main(int argumentCount, char** arguments) {
                                     argumentCount > 1 ? atoi(arguments[1]) : 9);
   VelkReportingDictionarySetInteger(session, kVelkReportingSessionInfoClientVersion, 1);
   VelkReportingDictionarySetInteger(session, kVelkReportingSessionInfoSessionID, 1);
+  VelkReportingDictionarySetBoolean(session, kVelkReportingSessionInfoBatchEvent, true);
   VelkReportingValue* user = VelkReportingDictionaryCreate();
   VelkReportingDictionarySetString(user, kVelkReportingUserInfoClientName, "Example");
   VelkReportingDictionarySetString(user, kVelkReportingUserInfoServiceName, "report_event");

@@ -14,8 +14,10 @@ using velk::PropertyDictionary;
 
 int main(int argumentCount, char** arguments) {
   const auto client = velk::VelkReporting::initWithSessionInfo(
-      PropertyDictionary{
-          {"ComponentType", argumentCount > 1 ? std::atoi(arguments[1]) : 9}, {"ClientVersion", 1}, {"SessionID", 2}},
+      PropertyDictionary{{"ComponentType", argumentCount > 1 ? std::atoi(arguments[1]) : 9},
+                         {"ClientVersion", 1},
+                         {"SessionID", 2},
+                         {"BatchEvents", true}},
       PropertyDictionary{{"_clientName", "Example"}, {"_serviceName", "report_event"}}, {});
   if (!client) {
     std::fprintf(stderr, "report_event: the session info was refused\n");

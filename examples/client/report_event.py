@@ -85,6 +85,7 @@ def main():
         key("SessionInfoClientType"): client_type,
         key("SessionInfoClientVersion"): 1,
         key("SessionInfoSessionID"): 9,
+        key("SessionInfoBatchEvent"): True,
     }
     user = {key("UserInfoClientName"): "Example", key("UserInfoServiceName"): "report_event.py"}
     with Value(session) as session_info, Value(user) as user_info:

@@ -34,9 +34,10 @@ static void end_context(void* context) {
 
 static void use(void* context) { REQUIRE(*(int*)context == 4711); }
 
+static void wait_a_moment(void) { thrd_sleep(&(struct timespec){.tv_nsec = 10000000}, NULL); }
+
 static void wait_for_contexts(int number) {
-  for (int turn = 0; turn < 6000 && contextsEnded < number; ++turn)
-    thrd_sleep(&(struct timespec){.tv_nsec = 10000000}, NULL);
+  for (int turn = 0; turn < 6000 && contextsEnded < number; ++turn) wait_a_moment();
   REQUIRE(contextsEnded == number);
 }
 
@@ -54,11 +55,13 @@ static void heard_text(const char* text, void* context) {
 }
 
 static VelkReportingError* keptError;
+static atomic_bool flushIsHeard;
 
 static void heard_flush(const VelkReportingError* error, void* context) {
   use(context);
   printf("flushed: %s\n", error == NULL ? "yes" : VelkReportingErrorGetDescription(error));
   keptError = VelkReportingErrorRetain((VelkReportingError*)error);
+  flushIsHeard = true;
 }
 
 static void heard_event(const VelkReportingValue* client, double timestamp, uint16_t category, uint16_t type,
@@ -187,8 +190,11 @@ static void check_client(VelkReportingClient* client, const VelkReportingValue* 
   REQUIRE(VelkReportingClientUnregisterPeriodicTask(client, 1));
   REQUIRE(VelkReportingClientUnregisterPeriodicTask(client, 1)); /* true always */
 
-  VelkReportingFlushMessages(client);
   VelkReportingFlushMessagesWithCompletion(client, heard_flush, make_context(), end_context);
+  for (int turn = 0; turn < 6000 && !flushIsHeard; ++turn) wait_a_moment();
+  REQUIRE(flushIsHeard);
+  VelkReportingErrorRelease(keptError);
+  VelkReportingFlushMessages(client);
   VelkReportingClientFinishSession(client);
 }
 
@@ -197,7 +203,8 @@ int main(int argumentCount, char** arguments) {
   check_values();
   check_errors();
 
-  VelkReportingValue* session = VelkReportingDictionaryCreateFromJSON("{\"SessionID\": 1}", NULL);
+  VelkReportingValue* session =
+      VelkReportingDictionaryCreateFromJSON("{\"SessionID\": 1, \"BatchEvents\": true}", NULL);
   VelkReportingDictionarySetInteger(session, kVelkReportingSessionInfoClientType, atoi(arguments[1]));
   VelkReportingValue* root = VelkReportingNewHierarchyTokenFromParentToken(NULL);
   VelkReportingValue* token = VelkReportingCreateHierarchyTokenFromParentToken(root);
@@ -215,7 +222,6 @@ int main(int argumentCount, char** arguments) {
   VelkReportingClientRelease(client);
   VelkReportingClientRelease(client);
   wait_for_contexts(contextsMade);
-  VelkReportingErrorRelease(keptError);
 
   client = VelkReportingClientCreate(session, user, NULL);
   VelkReportingClientRelease(client);
