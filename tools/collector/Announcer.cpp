@@ -54,11 +54,15 @@ void Announcer::say(const PropertyDictionary& object, const std::string& words) 
   _lines.writeText((_json ? tools::jsonText(object) : words) + "\n");
 }
 
-void Announcer::listening(const std::string& url, int port, const std::string& caPath,
-                          const std::string& databasePath) {
-  say({{"event", "listening"}, {"url", url}, {"port", port}, {"ca", caPath}, {"database", databasePath}},
+void Announcer::listening(const std::string& url, int port, const std::string& caPath, const std::string& databasePath,
+                          std::optional<int> dashboardPort) {
+  PropertyDictionary object{
+      {"event", "listening"}, {"url", url}, {"port", port}, {"ca", caPath}, {"database", databasePath}};
+  if (dashboardPort) object.set("dashboardPort", *dashboardPort);
+  say(object,
       "Listening on " + url + "\n  trust it with: SSL_CERT_FILE=" + caPath +
-          (databasePath.empty() ? std::string("\n  counting only") : "\n  keeping posts in: " + databasePath));
+          (databasePath.empty() ? std::string("\n  counting only") : "\n  keeping posts in: " + databasePath) +
+          (dashboardPort ? "\n  dashboard datagrams on port " + std::to_string(*dashboardPort) : std::string()));
 }
 
 void Announcer::post(std::int64_t number, const std::string& path, const ReceivedPost& post, bool digestChecked) {
@@ -95,6 +99,37 @@ void Announcer::storebag(const std::string& name, int status) {
   if (_quiet) return;
   say({{"event", "storebag"}, {"name", name}, {"status", status}},
       "Storebag " + withoutControlCharacters(name) + ": " + std::to_string(status));
+}
+
+void Announcer::datagram(const ReceivedDatagram& datagram) {
+  if (_quiet) return;
+  const dashboard::Header& header = datagram.header;
+  const std::string_view device(header.deviceIdentifier.data(), header.deviceIdentifier.size());
+  const std::string fate(nameOf(datagram.fate));
+  say({{"event", "datagram"},
+       {"fate", fate},
+       {"eventNumber", header.eventNumber},
+       {"sent", header.seconds + header.fourMilliseconds * dashboard::kFourMilliseconds / 1000.0},
+       {"component", header.component},
+       {"majorVersion", header.majorVersion},
+       {"session", header.sessionID},
+       {"clientVersion", header.clientVersion},
+       {"method", header.method},
+       {"status", header.respCode},
+       {"device", device.substr(0, device.find('\0'))},
+       {"flags", header.flags},
+       {"text", datagram.text}},
+      "Datagram " + std::to_string(header.eventNumber) + " (" + fate + ") of component " +
+          std::to_string(header.component) + ", session " + std::to_string(header.sessionID) + ": " +
+          std::to_string(header.method) + "/" + std::to_string(header.respCode) +
+          withoutControlCharacters(datagram.text));
+}
+
+void Announcer::logData(std::int64_t number, std::size_t entries, std::size_t bytes, const std::string& location) {
+  if (_quiet) return;
+  say({{"event", "logData"}, {"number", number}, {"entries", entries}, {"bytes", bytes}, {"location", location}},
+      "Log data " + std::to_string(number) + ": " + std::to_string(entries) + " entries, " + count(bytes, "byte") +
+          ", to be seen at " + location);
 }
 
 void Announcer::stopped(const Totals& totals) {

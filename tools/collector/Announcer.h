@@ -2,10 +2,12 @@
 #pragma once
 
 #include <cstdint>
+#include <optional>
 #include <string>
 
 #include "foundation/PropertyValue.h"
 #include "tools/JsonLines.h"
+#include "tools/collector/DashboardListener.h"
 #include "tools/collector/ReceivedPost.h"
 
 namespace velk::collector {
@@ -27,11 +29,15 @@ class Announcer {
  public:
   Announcer(tools::JsonLines& lines, bool json, bool quiet) : _lines(lines), _json(json), _quiet(quiet) {}
 
-  void listening(const std::string& url, int port, const std::string& caPath, const std::string& databasePath);
+  void listening(const std::string& url, int port, const std::string& caPath, const std::string& databasePath,
+                 std::optional<int> dashboardPort = std::nullopt);
   void post(std::int64_t number, const std::string& path, const ReceivedPost& post, bool digestChecked);
   /// A post that was not taken, and the sentence that its sender was told.
   void refused(const std::string& path, int status, const std::string& reason);
   void storebag(const std::string& name, int status);
+  /// Every one that arrived, those included that a bad link was to lose.
+  void datagram(const ReceivedDatagram& datagram);
+  void logData(std::int64_t number, std::size_t entries, std::size_t bytes, const std::string& location);
   void stopped(const Totals& totals);
 
  private:

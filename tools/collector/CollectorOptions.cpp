@@ -18,6 +18,8 @@ struct CommandLine {
   std::string digestKey;
   int storebagStatus = 0;
   int postStatus = 0;
+  bool dashboard = false;
+  int dashboardPort = 0;
 };
 
 // A range lets "nan" pass.
@@ -43,6 +45,9 @@ void describe(CLI::App& app, CommandLine& line) {
   certificate->needs(key);
   key->needs(certificate);
   app.add_option("--port-file", options.portFile, "File to write the port to, once connections are taken");
+  app.add_flag("--dashboard", line.dashboard, "Take dashboard datagrams, on a free port, which is printed");
+  app.add_option("--dashboard-port", line.dashboardPort, "Port to take dashboard datagrams on; 0: one that is free")
+      ->check(CLI::Range(0, 65535));
   app.add_flag("--json", options.json, "Print one JSON object a line");
   app.add_flag("--quiet", options.quiet, "Do not print posts, events and storebags");
   app.add_flag("--sink", options.sink, "Only count posts and events: store and show nothing");
@@ -61,7 +66,26 @@ void describeFaults(CLI::App& app, CommandLine& line) {
       ->group("Faults for tests");
 }
 
-void fillDefaults(CommandLine& line) {
+void describeDashboardFaults(CLI::App& app, DashboardFaults& faults) {
+  app.add_option("--dashboard-drop", faults.drop, "Fraction of the datagrams to lose")
+      ->check(CLI::Range(0.0, 1.0))
+      ->check(&whyNoNumber)
+      ->group("Faults for tests");
+  app.add_option("--dashboard-drop-acks", faults.dropAcknowledgements, "Fraction of the acknowledgements to lose")
+      ->check(CLI::Range(0.0, 1.0))
+      ->check(&whyNoNumber)
+      ->group("Faults for tests");
+  app.add_option("--dashboard-seed", faults.seed, "What the losses follow from")
+      ->capture_default_str()
+      ->group("Faults for tests");
+  app.add_option("--dashboard-ack-delay", faults.acknowledgementDelaySeconds,
+                 "Seconds to wait before a datagram is acknowledged")
+      ->check(CLI::Range(0.0, kLongestDelaySeconds))
+      ->check(&whyNoNumber)
+      ->group("Faults for tests");
+}
+
+void fillDefaults(CommandLine& line, bool dashboardPortGiven) {
   CollectorOptions& options = line.options;
   if (options.stateDirectory.empty()) options.stateDirectory = clientDirectories().state + "/collector";
   while (options.stateDirectory.size() > 1 && options.stateDirectory.back() == '/') options.stateDirectory.pop_back();
@@ -72,6 +96,7 @@ void fillDefaults(CommandLine& line) {
   if (!absolute.empty()) options.stateDirectory = absolute.lexically_normal().string();
   if (line.storebagStatus != 0) options.storebagStatus = line.storebagStatus;
   if (line.postStatus != 0) options.postStatus = line.postStatus;
+  if (line.dashboard || dashboardPortGiven) options.dashboardPort = line.dashboardPort;
 }
 
 }  // namespace
@@ -83,13 +108,14 @@ std::variant<CollectorOptions, tools::ExitCode> readCollectorOptions(std::vector
   CommandLine line;
   describe(app, line);
   describeFaults(app, line);
+  describeDashboardFaults(app, line.options.dashboard);
   std::reverse(arguments.begin(), arguments.end());
   try {
     app.parse(std::move(arguments));
   } catch (const CLI::ParseError& problem) {
     return app.exit(problem, out, error) == 0 ? tools::ExitCode::ok : tools::ExitCode::usage;
   }
-  fillDefaults(line);
+  fillDefaults(line, app.count("--dashboard-port") > 0);
   if (!line.digestKey.empty()) {
     Result<ByteData> key = digestKeyFromArgument(line.digestKey);
     if (!key) {

@@ -9,6 +9,7 @@
 
 #include "foundation/PropertyValue.h"
 #include "tools/ExitCode.h"
+#include "tools/collector/DashboardListener.h"
 
 namespace velk::collector {
 
@@ -32,11 +33,14 @@ struct CollectorOptions {
   /// Count only: nothing is parsed, stored or shown.
   bool sink = false;
   int maxAgeSeconds = 600;
+  /// The port of dashboard datagrams; 0: the kernel chooses. Absent: none are taken.
+  std::optional<int> dashboardPort;
 
   // Faults, for tests of the other end.
   double storebagDelaySeconds = 0;
   std::optional<int> storebagStatus;
   std::optional<int> postStatus;
+  DashboardFaults dashboard;
 };
 
 /// Reads the command line (without the program's name). The other answer is the status to end with: the help has been

@@ -57,8 +57,8 @@ void setSocketOptions(int socket) {
 
 class Server final : public HttpsServer {
  public:
-  Server(Collector& collector, const std::string& certificatePath, const std::string& keyPath)
-      : _collector(collector), _server(certificatePath.c_str(), keyPath.c_str()) {}
+  Server(Collector& collector, Dashboard& dashboard, const std::string& certificatePath, const std::string& keyPath)
+      : _collector(collector), _dashboard(dashboard), _server(certificatePath.c_str(), keyPath.c_str()) {}
 
   [[nodiscard]] bool isUsable() const { return _server.is_valid(); }
 
@@ -106,23 +106,38 @@ class Server final : public HttpsServer {
            response);
     });
     _server.Get("/stats", [this](const auto&, auto& response) { send(_collector.stats(), response); });
+    _server.Get("/logdata/([0-9]+)", [this](const auto& request, auto& response) {
+      send(_dashboard.logData(request.matches[1]), response);
+    });
+    _server.Post("/logdata", [this](const httplib::Request& request, httplib::Response& response,
+                                    const httplib::ContentReader& reader) {
+      takeBody(request, response, reader,
+               [&](const std::string& wire) { return _dashboard.postLogData(headersOf(request), wire); });
+    });
     _server.Post("/.*", [this](const httplib::Request& request, httplib::Response& response,
                                const httplib::ContentReader& reader) { takePost(request, response, reader); });
   }
 
   void takePost(const httplib::Request& request, httplib::Response& response, const httplib::ContentReader& reader) {
+    takeBody(request, response, reader,
+             [&](const std::string& wire) { return _collector.post(request.path, headersOf(request), wire); });
+  }
+
+  template <class Take>
+  void takeBody(const httplib::Request& request, httplib::Response& response, const httplib::ContentReader& reader,
+                const Take& take) {
     std::string wire;
     const bool whole = reader([&wire](const char* bytes, std::size_t count) {
       if (wire.size() + count > PostBounds{}.wireBytes) return false;
       wire.append(bytes, count);
       return true;
     });
-    send(whole ? _collector.post(request.path, headersOf(request), wire) : _collector.unreadablePost(request.path),
-         response);
+    send(whole ? take(wire) : _collector.unreadablePost(request.path), response);
     if (!whole) response.set_header("Connection", "close");
   }
 
   Collector& _collector;
+  Dashboard& _dashboard;
   TlsConnections _connections;
   httplib::SSLServer _server;
   std::atomic<bool> _ended = false;
@@ -130,9 +145,9 @@ class Server final : public HttpsServer {
 
 }  // namespace
 
-Result<std::unique_ptr<HttpsServer>> HttpsServer::make(Collector& collector, const std::string& certificatePath,
-                                                       const std::string& keyPath) {
-  auto server = std::make_unique<Server>(collector, certificatePath, keyPath);
+Result<std::unique_ptr<HttpsServer>> HttpsServer::make(Collector& collector, Dashboard& dashboard,
+                                                       const std::string& certificatePath, const std::string& keyPath) {
+  auto server = std::make_unique<Server>(collector, dashboard, certificatePath, keyPath);
   if (!server->isUsable()) {
     return failure("collector", 2,
                    "cannot use the certificate " + certificatePath + " with the key " + keyPath +

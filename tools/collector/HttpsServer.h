@@ -6,17 +6,20 @@
 
 #include "foundation/Error.h"
 #include "tools/collector/Collector.h"
+#include "tools/collector/Dashboard.h"
 
 namespace velk::collector {
 
 /// Lifecycle: make -> bind -> serve (blocks) -> ends after stop. Made, bound and destroyed by one thread.
 ///   GET  /storebags/vindle/NAME, /bags/vindle/NAME   the signed envelope
 ///   GET  /stats                                      counts
+///   POST /logdata, GET /logdata/NUMBER               log data of sessions
 ///   POST anything                                    an event post
 class HttpsServer {
  public:
-  /// The certificate's chain and its key in PEM. Fails when they cannot be used. `collector` outlives the server.
-  [[nodiscard]] static Result<std::unique_ptr<HttpsServer>> make(Collector& collector,
+  /// The certificate's chain and its key in PEM. Fails when they cannot be used. `collector` and `dashboard` outlive
+  /// the server.
+  [[nodiscard]] static Result<std::unique_ptr<HttpsServer>> make(Collector& collector, Dashboard& dashboard,
                                                                  const std::string& certificatePath,
                                                                  const std::string& keyPath);
   virtual ~HttpsServer() = default;

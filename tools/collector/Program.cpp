@@ -11,6 +11,7 @@
 #include "tools/collector/Announcer.h"
 #include "tools/collector/Collector.h"
 #include "tools/collector/CollectorOptions.h"
+#include "tools/collector/Dashboard.h"
 #include "tools/collector/HttpsServer.h"
 #include "tools/collector/PostStore.h"
 #include "tools/collector/TestCertificates.h"
@@ -43,6 +44,19 @@ Result<std::unique_ptr<PostStore>> openStore(const CollectorOptions& options) {
     return Failure(std::move(made).error());
   }
   return PostStore::open(databasePath(options));
+}
+
+/// Log data needs a place also where no datagrams are taken.
+Result<std::unique_ptr<DashboardStore>> openDashboardStore(const CollectorOptions& options) {
+  if (options.sink) return std::unique_ptr<DashboardStore>();
+  return DashboardStore::open(options.stateDirectory + "/dashboard.sqlite");
+}
+
+/// Null when none is asked for.
+Result<std::unique_ptr<DashboardListener>> openListener(const CollectorOptions& options, Dashboard& dashboard) {
+  if (!options.dashboardPort) return std::unique_ptr<DashboardListener>();
+  return DashboardListener::open(options.listenAddress, *options.dashboardPort, options.dashboard,
+                                 [&dashboard](const ReceivedDatagram& datagram) { dashboard.take(datagram); });
 }
 
 std::string urlOf(const std::string& address, int port) {
@@ -87,16 +101,24 @@ ExitCode run(std::vector<std::string> arguments, std::ostream& out, std::ostream
   tools::JsonLines lines(out);
   Announcer announcer(lines, options.json, options.quiet || options.sink);
   Collector collector(options, store->get(), announcer, systemClock());
-  auto server = HttpsServer::make(collector, names->serverPath, names->serverKeyPath);
+  const auto dashboardStore = openDashboardStore(options);
+  if (!dashboardStore) return fail(error, ExitCode::cannotCreate, dashboardStore.error().description);
+  Dashboard dashboard(dashboardStore->get(), announcer, systemClock());
+  auto server = HttpsServer::make(collector, dashboard, names->serverPath, names->serverKeyPath);
   if (!server) return fail(error, ExitCode::configuration, server.error().description);
   const Result<int> port = (*server)->bind(options.listenAddress, options.port);
   if (!port) return fail(error, ExitCode::unavailable, port.error().description);
+  const auto listener = openListener(options, dashboard);
+  if (!listener) return fail(error, ExitCode::unavailable, listener.error().description);
   if (const Result<void> written = writePortFile(options.portFile, *port); !written) {
     return fail(error, ExitCode::cannotCreate, written.error().description);
   }
 
-  announcer.listening(urlOf(options.listenAddress, *port), *port, names->caPath, databasePath(options));
+  const auto dashboardPort = *listener ? std::optional((*listener)->port()) : std::nullopt;
+  announcer.listening(urlOf(options.listenAddress, *port), *port, names->caPath, databasePath(options), dashboardPort);
+  if (*listener) (*listener)->start();
   const bool orderly = serveUntilStopped(**server, signals);
+  if (*listener) (*listener)->stop();
   announcer.stopped(collector.totals());
   return orderly ? ExitCode::ok : fail(error, ExitCode::ioError, "the server can take no connections any longer");
 }

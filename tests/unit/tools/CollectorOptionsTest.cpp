@@ -43,6 +43,24 @@ TEST_F(CollectorOptionsTest, ReadsWhatItIsTold) {
   EXPECT_EQ(options.maxAgeSeconds, 0);
 }
 
+TEST_F(CollectorOptionsTest, TakesDatagramsWhenTold) {
+  EXPECT_FALSE(std::get<CollectorOptions>(read({})).dashboardPort);
+  EXPECT_EQ(std::get<CollectorOptions>(read({"--dashboard"})).dashboardPort, 0);
+  EXPECT_EQ(std::get<CollectorOptions>(read({"--dashboard-port", "7000"})).dashboardPort, 7000);
+  const auto faults = std::get<CollectorOptions>(read({"--dashboard-drop", "0.3", "--dashboard-drop-acks", "1",
+                                                       "--dashboard-seed", "17", "--dashboard-ack-delay", "2.5"}))
+                          .dashboard;
+  EXPECT_EQ(faults.drop, 0.3);
+  EXPECT_EQ(faults.dropAcknowledgements, 1.0);
+  EXPECT_EQ(faults.seed, 17U);
+  EXPECT_EQ(faults.acknowledgementDelaySeconds, 2.5);
+  for (const char* option : {"--dashboard-drop", "--dashboard-drop-acks", "--dashboard-ack-delay"}) {
+    for (const char* value : {"-0.1", "3601", "nan", "x"}) {
+      EXPECT_EQ(std::get<ExitCode>(read({option, value})), ExitCode::usage) << option << " " << value;
+    }
+  }
+}
+
 TEST_F(CollectorOptionsTest, KeepsStorebagsInTheStateDirectoryUnlessTold) {
   EXPECT_EQ(std::get<CollectorOptions>(read({"--state", "/s"})).storebagDirectory, "/s/storebags");
 }

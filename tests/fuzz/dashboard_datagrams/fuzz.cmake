@@ -1,0 +1,1 @@
+velk_fuzz(dashboard_datagrams LINKS velk_collector velk_backends)
