@@ -8,6 +8,7 @@
 #include "daemon/MessageLogFile.h"
 #include "daemon/ReportingdAgent.h"
 #include "daemon/StorebagService.h"
+#include "daemon/WorkingDirectories.h"
 #include "device/DeviceEnvironment.h"
 #include "ipc/Listener.h"
 #include "ipc/Vocabulary.h"
@@ -57,6 +58,8 @@ ThreadPoolOptions poolOptions() {
   options.emergencyThreads = kEmergencyThreads;
   return options;
 }
+
+std::string storebagDirectory(const Directories& directories) { return directories.cache + "/storebags"; }
 
 std::string textSetting(const UserDefaults& defaults, std::string_view key) {
   const auto value = defaults.value(key);
@@ -151,7 +154,7 @@ DaemonProcess::Parts::Parts(const DaemonOptions& options, process::RunLoop& loop
       services{{platform, environment}, messageLog},
       publicKey(storebagPublicKeyFromDirectories(directories.configuration, directories.data)),
       storebagService(StorebagService::make(storebagPlatform, environment,
-                                            makeStorebagDiskCache(directories.cache + "/storebags"), publicKey)),
+                                            makeStorebagDiskCache(storebagDirectory(directories)), publicKey)),
       agent(ReportingdAgent::make(
           platform, storebagService,
           [this](ReportingdSessionDelegate& delegate, std::shared_ptr<SessionConnection> connection) {
@@ -207,12 +210,12 @@ Result<std::unique_ptr<DaemonProcess>> DaemonProcess::make(const DaemonOptions& 
   auto sockets = launch::takeActivatedSockets();
   const bool activated = !sockets.empty();
   auto parts = std::make_unique<Parts>(options, runLoop, activated);
-  for (const auto* directory : {&parts->directories.state, &parts->directories.cache}) {
-    if (const auto made = files::createDirectories(*directory); !made) {
-      return failure("velkreportingd", kExitCannotCreate,
-                     "cannot use the directory " + *directory + ": " + made.error().description +
-                         " (it must belong to the user that the daemon runs as)");
-    }
+  const auto& directories = parts->directories;
+  if (const auto prepared =
+          prepareWorkingDirectories(directories.state, directories.cache, storebagDirectory(directories));
+      !prepared) {
+    return failure("velkreportingd", kExitCannotCreate,
+                   prepared.error().description + " (it must belong to the user that the daemon runs as)");
   }
   auto listener = [&]() -> Result<std::unique_ptr<Listener>> {
     if (activated) return Listener::adopt(std::move(sockets.front()), parts->listenerOptions());

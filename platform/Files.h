@@ -24,6 +24,12 @@ enum class Code : int { notFound = 1, tooLarge = 2, notAllowed = 3, other = 4, i
 /// writes into the directory of another user becomes that user's, who could not read it otherwise.
 [[nodiscard]] Result<void> writeAtomically(const std::string& path, std::span<const std::uint8_t> bytes,
                                            unsigned mode = 0600);
+/// Removes what processes of this user that were cut off in the middle of `writeAtomically` left in the directory
+/// (subdirectories are not looked at), and nothing that is being written. Answers how many files those were; 0 for a
+/// directory that cannot be read.
+std::size_t sweepTemporaries(const std::string& directory);
+/// Makes a file without a name in the directory: the error says why no file can be made there.
+[[nodiscard]] Result<void> probeWritable(const std::string& directory);
 /// Creates the directory and its parents with this mode. Fine when it is there.
 [[nodiscard]] Result<void> createDirectories(const std::string& path, unsigned mode = 0700);
 /// Gives an existing file or directory exactly this mode.

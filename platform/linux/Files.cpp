@@ -2,10 +2,12 @@
 
 #include <dirent.h>
 #include <fcntl.h>
+#include <sys/file.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
 #include <algorithm>
+#include <cctype>
 #include <cerrno>
 #include <cstdlib>
 #include <cstring>
@@ -83,6 +85,47 @@ int fillTemporary(int descriptor, std::span<const std::uint8_t> bytes, unsigned 
   return ::fsync(descriptor) == 0 ? 0 : errno;
 }
 
+constexpr std::string_view kTemporaryMark = ".tmp-";
+constexpr std::string_view kTemporaryPlaces = "XXXXXX";
+
+/// A new file beside `path`, whose name it puts into `temporary`. It is locked for as long as it is open: whoever
+/// sweeps the directory meanwhile leaves it alone.
+FileDescriptor newTemporary(const std::string& path, std::string& temporary) {
+  constexpr int kAttempts = 8;
+  FileDescriptor file;
+  for (int attempt = 0; attempt < kAttempts; ++attempt) {
+    temporary = path;
+    temporary.append(kTemporaryMark).append(kTemporaryPlaces);
+    file = FileDescriptor(::mkostemp(temporary.data(), O_CLOEXEC));
+    struct stat status {};
+    // Best effort: where files cannot be locked, nothing is swept either.
+    if (!file || ::flock(file.get(), LOCK_EX) != 0 || ::fstat(file.get(), &status) != 0) break;
+    if (status.st_nlink > 0) break;
+    // Swept in the instant before it was locked.
+  }
+  return file;
+}
+
+bool isTemporaryName(std::string_view name) {
+  const std::size_t length = kTemporaryMark.size() + kTemporaryPlaces.size();
+  if (name.size() <= length) return false;
+  const auto end = name.substr(name.size() - length);
+  const auto isPlace = [](unsigned char character) { return std::isalnum(character) != 0; };
+  return end.starts_with(kTemporaryMark) &&
+         std::all_of(end.begin() + static_cast<std::ptrdiff_t>(kTemporaryMark.size()), end.end(), isPlace);
+}
+
+/// True when it was ours, nobody was writing it, and it is gone.
+bool sweepTemporary(int directory, const std::string& name) {
+  const FileDescriptor file(
+      ::openat(directory, name.c_str(), O_RDONLY | O_CLOEXEC | O_NOFOLLOW | O_NONBLOCK | O_NOCTTY));
+  struct stat status {};
+  if (!file || ::fstat(file.get(), &status) != 0) return false;
+  if (!S_ISREG(status.st_mode) || status.st_uid != ::geteuid()) return false;
+  if (::flock(file.get(), LOCK_EX | LOCK_NB) != 0) return false;
+  return ::unlinkat(directory, name.c_str(), 0) == 0;
+}
+
 bool onlyTrustedMayWrite(const struct stat& status) {
   return (status.st_uid == 0 || status.st_uid == ::geteuid()) && (status.st_mode & (S_IWGRP | S_IWOTH)) == 0;
 }
@@ -111,8 +154,8 @@ Result<ByteData> readDescriptor(int descriptor, const std::string& name, std::si
 }
 
 Result<void> writeAtomically(const std::string& path, std::span<const std::uint8_t> bytes, unsigned mode) {
-  std::string temporary = path + ".tmp-XXXXXX";
-  const FileDescriptor file(::mkostemp(temporary.data(), O_CLOEXEC));
+  std::string temporary;
+  const FileDescriptor file = newTemporary(path, temporary);
   if (!file) return systemFailure("cannot create a file beside", path, errno);
   giveToOwnerOfDirectory(file.get(), path);
   int error = fillTemporary(file.get(), bytes, mode);
@@ -122,6 +165,26 @@ Result<void> writeAtomically(const std::string& path, std::span<const std::uint8
     return systemFailure("cannot write", path, error);
   }
   syncDirectoryOf(path);
+  return {};
+}
+
+std::size_t sweepTemporaries(const std::string& directory) {
+  const auto names = list(directory);
+  const FileDescriptor opened(::open(directory.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
+  if (!names || !opened) return 0;
+  return static_cast<std::size_t>(std::count_if(names->begin(), names->end(), [&](const std::string& name) {
+    return isTemporaryName(name) && sweepTemporary(opened.get(), name);
+  }));
+}
+
+Result<void> probeWritable(const std::string& directory) {
+  if (const FileDescriptor file(::open(directory.c_str(), O_TMPFILE | O_WRONLY | O_CLOEXEC, 0600)); file) return {};
+  if (errno != EOPNOTSUPP && errno != EISDIR) return systemFailure("cannot write into", directory, errno);
+  // A file system without files that have no name.
+  std::string temporary;
+  const FileDescriptor file = newTemporary(directory + "/probe", temporary);
+  if (!file) return systemFailure("cannot write into", directory, errno);
+  (void)::unlink(temporary.c_str());
   return {};
 }
 

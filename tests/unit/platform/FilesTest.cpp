@@ -4,6 +4,10 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
+#include <atomic>
+#include <thread>
+#include <vector>
+
 #include "tests/support/TemporaryDirectory.h"
 
 namespace velk {
@@ -99,6 +103,67 @@ TEST(Files, KeepsAFewOfTheFilesThatWereSetAside) {
     EXPECT_FALSE(files::exists(directory / "a"));
   }
   EXPECT_EQ(files::list(directory.path())->size(), 5U);
+}
+
+TEST(Files, SweepsWhatACrashLeft) {
+  const test::TemporaryDirectory directory;
+  directory.write("suite.tmp-a1B2c3", "half");
+  directory.write("bag.tmp-XXXXXX", "");
+  const std::vector<std::string> others{"suite",         "suite.tmp-",      "suite.tmp-12345", "suite.tmp-1234567",
+                                        "suite.tmp-a/b", "suite.tmp-12 45", ".tmp-a1B2c3",     "suite.corrupt-1"};
+  for (const auto& name : others) directory.write(name, "stays");
+  EXPECT_EQ(files::sweepTemporaries(directory.path()), 2U);
+  EXPECT_FALSE(files::exists(directory / "suite.tmp-a1B2c3"));
+  EXPECT_FALSE(files::exists(directory / "bag.tmp-XXXXXX"));
+  for (const auto& name : others) EXPECT_EQ(directory.read(name), "stays") << name;
+  EXPECT_EQ(files::sweepTemporaries(directory / "none"), 0U);
+}
+
+TEST(Files, SweepsOnlyFilesOfItsOwnUserAndNoLinks) {
+  const test::TemporaryDirectory directory;
+  const auto target = directory.write("target", "stays");
+  ASSERT_EQ(::symlink(target.c_str(), (directory / "link.tmp-aaaaaa").c_str()), 0);
+  ASSERT_EQ(::mkfifo((directory / "fifo.tmp-aaaaaa").c_str(), 0600), 0);
+  ASSERT_EQ(::mkdir((directory / "directory.tmp-aaaaaa").c_str(), 0700), 0);
+  std::size_t kept = 4;
+  if (::geteuid() == 0) {
+    ASSERT_EQ(::chown(directory.write("foreign.tmp-aaaaaa", "x").c_str(), 65534, 65534), 0);
+    ++kept;
+  }
+  EXPECT_EQ(files::sweepTemporaries(directory.path()), 0U);
+  EXPECT_EQ(files::list(directory.path())->size(), kept);
+}
+
+TEST(Files, SweepsNothingThatIsBeingWritten) {
+  const test::TemporaryDirectory directory;
+  std::atomic<bool> stop{false};
+  std::atomic<int> failures{0};
+  std::vector<std::thread> writers;
+  for (const char* name : {"a", "b"}) {
+    writers.emplace_back([&, name] {
+      while (!stop) failures += files::writeAtomically(directory / name, bytesOf("contents")) ? 0 : 1;
+    });
+  }
+  std::size_t swept = 0;
+  for (int round = 0; round < 300; ++round) {
+    directory.write("crashed.tmp-aaaaaa", "half");
+    swept += files::sweepTemporaries(directory.path());
+  }
+  stop = true;
+  for (auto& writer : writers) writer.join();
+  EXPECT_GE(swept, 300U);
+  EXPECT_EQ(failures, 0);
+  EXPECT_EQ(files::list(directory.path())->size(), 2U);
+}
+
+TEST(Files, ProbesADirectoryAndLeavesNothing) {
+  const test::TemporaryDirectory directory;
+  EXPECT_TRUE(files::probeWritable(directory.path()));
+  EXPECT_TRUE(files::list(directory.path())->empty());
+  const auto absent = files::probeWritable(directory / "none");
+  ASSERT_FALSE(absent);
+  EXPECT_NE(absent.error().description.find(directory / "none"), std::string::npos);
+  EXPECT_FALSE(files::probeWritable("/proc/self"));
 }
 
 TEST(Files, TrustsOnlyWhatOthersCannotWrite) {
