@@ -22,7 +22,8 @@ struct CborReader::Item {
     array,
     map,
     tag,
-    refused
+    indefinite,
+    strayBreak
   };
   Kind kind = Kind::none;
   bool truth = false;
@@ -85,11 +86,11 @@ struct ItemSink {
     callbacks.null = simple<Kind::null>;
     callbacks.undefined = simple<Kind::null>;
     callbacks.boolean = truth;
-    callbacks.byte_string_start = simple<Kind::refused>;
-    callbacks.string_start = simple<Kind::refused>;
-    callbacks.indef_array_start = simple<Kind::refused>;
-    callbacks.indef_map_start = simple<Kind::refused>;
-    callbacks.indef_break = simple<Kind::refused>;
+    callbacks.byte_string_start = simple<Kind::indefinite>;
+    callbacks.string_start = simple<Kind::indefinite>;
+    callbacks.indef_array_start = simple<Kind::indefinite>;
+    callbacks.indef_map_start = simple<Kind::indefinite>;
+    callbacks.indef_break = simple<Kind::strayBreak>;
     return callbacks;
   }
 };
@@ -118,7 +119,9 @@ bool CborReader::next(Item& item) {
   if (result.status == CBOR_DECODER_NEDATA) return fail(Severity::malformed, "body cut short");
   if (result.status != CBOR_DECODER_FINISHED) return fail(Severity::malformed, "not CBOR");
   _bytes = _bytes.subspan(result.read);
-  if (item.kind == Item::Kind::refused) return fail(Severity::unacceptable, "indefinite length");
+  if (item.kind == Item::Kind::indefinite) return fail(Severity::unacceptable, "indefinite length");
+  // Nothing that it could end has been begun: whatever is read here has a length.
+  if (item.kind == Item::Kind::strayBreak) return fail(Severity::malformed, "not CBOR");
   return true;
 }
 
@@ -184,7 +187,8 @@ bool CborReader::readValue(PropertyValue& value, int depth) {
     case Item::Kind::tag:
       return readDate(value, item.number);
     case Item::Kind::none:
-    case Item::Kind::refused:
+    case Item::Kind::indefinite:
+    case Item::Kind::strayBreak:
       break;
   }
   return fail(Severity::unacceptable, "unknown simple value");

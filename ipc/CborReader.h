@@ -13,10 +13,11 @@ namespace velk {
 
 /// The first fault ends the reading: every later call answers false.
 ///
-/// Two kinds of fault. `malformed`: these bytes are no body of ours (not CBOR, cut short, trailing bytes, nested too
-/// deep, more entries than a body may have); whoever sent them cannot be trusted to frame the next one. `unacceptable`:
-/// sound CBOR with a content that we refuse (text that is not UTF-8, a key given twice or not a text, indefinite
-/// lengths, tags and simple values without a meaning here); it costs the sender this one call.
+/// Two kinds of fault. `malformed`: these bytes are no body of ours (not CBOR, a break without a beginning among that,
+/// cut short, trailing bytes, nested too deep, more entries than a body may have); whoever sent them cannot be trusted
+/// to frame the next one. `unacceptable`: sound CBOR with a content that we refuse (text that is not UTF-8, a key given
+/// twice or not a text, indefinite lengths, tags and simple values without a meaning here); it costs the sender this
+/// one call.
 class CborReader {
  public:
   enum class Severity : std::uint8_t { none, unacceptable, malformed };

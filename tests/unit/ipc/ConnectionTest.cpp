@@ -139,6 +139,8 @@ TEST_F(ConnectionTest, ClosesOnMalformedFramesWithOneLine) {
   large[3] = 1;
   expectBadFrame(large, "frame too large");
   expectBadFrame(frameBytes(FrameKind::call, 0, {0x82, 0x01, 0x1C}), "not CBOR");
+  expectBadFrame(frameBytes(FrameKind::call, 0, {0xFF}), "not CBOR");
+  expectBadFrame(frameBytes(FrameKind::call, 7, {0x82, 0x01, 0xFF}), "not CBOR");
   expectBadFrame(frameBytes(FrameKind::call, 0, {}), "body cut short");
   expectBadFrame(frameBytes(FrameKind::call, 0, {0x01}), "body is no array");
   expectBadFrame(frameBytes(FrameKind::call, 0, {0x81, 0x61, 'a'}), "number missing");
