@@ -20,7 +20,10 @@ void handOut(VelkReportingError** out, const Error& error) {
 
 }  // namespace velk::cinterface
 
-VelkReportingError* VelkReportingErrorRetain(VelkReportingError* error) { return velk::cinterface::retain(error); }
+VelkReportingError* VelkReportingErrorRetain(const VelkReportingError* error) {
+  // Only what is borrowed is constant; whoever retains it is an owner like any other.
+  return velk::cinterface::retain(const_cast<VelkReportingError*>(error));
+}
 
 void VelkReportingErrorRelease(VelkReportingError* error) { velk::cinterface::release(error); }
 

@@ -61,8 +61,8 @@ enum {
   kVelkReportingErrorInvalidJSON = 11       /* text that is no JSON, or a value that has no form in it */
 };
 
-/* Adds an owner; answers `error`. */
-VELK_EXPORT VelkReportingError* VelkReportingErrorRetain(VelkReportingError* error);
+/* Adds an owner; answers `error`. Retaining a borrowed error makes the caller an owner. */
+VELK_EXPORT VelkReportingError* VelkReportingErrorRetain(const VelkReportingError* error);
 VELK_EXPORT void VelkReportingErrorRelease(VelkReportingError* error);
 /* Texts are the error's and last as long as it does. The description is empty where there is none. */
 VELK_EXPORT const char* VelkReportingErrorGetDomain(const VelkReportingError* error);

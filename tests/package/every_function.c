@@ -60,7 +60,7 @@ static atomic_bool flushIsHeard;
 static void heard_flush(const VelkReportingError* error, void* context) {
   use(context);
   printf("flushed: %s\n", error == NULL ? "yes" : VelkReportingErrorGetDescription(error));
-  keptError = VelkReportingErrorRetain((VelkReportingError*)error);
+  keptError = VelkReportingErrorRetain(error);
   flushIsHeard = true;
 }
 

@@ -258,6 +258,10 @@ TEST_F(CInterfaceTest, NullCompletionIsAcceptedAndItsContextEnds) {
   Context context;
   VelkReportingFlushMessagesWithCompletion(client, nullptr, &context, Context::destroy);
   EXPECT_EQ(context.ended.load(), 1);
+  const Client aggregatingNothing(
+      VelkReportingClientCreateWithAggregation(_session, _user, nullptr, nullptr, &context, Context::destroy));
+  EXPECT_NE(aggregatingNothing.handle, nullptr);
+  EXPECT_EQ(context.ended.load(), 2);
   VelkReportingFlushMessagesWithCompletion(client, nullptr, nullptr, nullptr);
   VelkReportingFlushMessages(client);
   VelkReportingClientStartConfiguration(client, nullptr, nullptr, nullptr);
