@@ -54,6 +54,8 @@ void SharedConnectivityHelpers::releaseOnQueue(const std::string& key) {
         if (const auto self = weak.lock()) self->usageReported(key, helper, usage);
       },
       _stateQueue);
+  entry.unusedSince = ++_releases;
+  if (entry.uses == 0) boundUnused();
 }
 
 void SharedConnectivityHelpers::usageReported(const std::string& key,
@@ -63,10 +65,25 @@ void SharedConnectivityHelpers::usageReported(const std::string& key,
   if (usage != 0) return;
   const auto found = _helpers.find(key);
   if (found == _helpers.end() || found->second.helper != helper.lock() || found->second.uses != 0) return;
-  log::standard(daemontexts::kHelperReachedZero, key);
-  const auto unused = std::move(found->second.helper);
-  _helpers.erase(found);
+  letGo(found);
+}
+
+void SharedConnectivityHelpers::letGo(Helpers::iterator entry) {
+  log::standard(daemontexts::kHelperReachedZero, entry->first);
+  const auto unused = std::move(entry->second.helper);
+  _helpers.erase(entry);
   unused->invalidate();
+}
+
+void SharedConnectivityHelpers::boundUnused() {
+  std::size_t unused = 0;
+  auto oldest = _helpers.end();
+  for (auto entry = _helpers.begin(); entry != _helpers.end(); ++entry) {
+    if (entry->second.uses != 0) continue;
+    ++unused;
+    if (oldest == _helpers.end() || entry->second.unusedSince < oldest->second.unusedSince) oldest = entry;
+  }
+  if (unused > kMaximumUnused) letGo(oldest);
 }
 
 void SharedConnectivityHelpers::invalidateAll() {

@@ -20,6 +20,10 @@ class ReportingSessionConnectivityHelper;
 
 class SharedConnectivityHelpers : public std::enable_shared_from_this<SharedConnectivityHelpers> {
  public:
+  /// Transports without users that wait for the next one or for their time. Clients that keep changing their names
+  /// could leave any number behind; of more, those without users for longest are let go at once.
+  static constexpr std::size_t kMaximumUnused = 256;
+
   explicit SharedConnectivityHelpers(const Platform& platform);
 
   /// The transport of this user info, whatever mode it was made with; a new one in `mode` when there is none.
@@ -42,7 +46,10 @@ class SharedConnectivityHelpers : public std::enable_shared_from_this<SharedConn
     std::shared_ptr<ReportingSessionConnectivityHelper> helper;
     /// Our own tally: a transport's report of zero may be older than the latest request.
     std::uint32_t uses = 0;
+    /// Of those without users: the smallest has been without for longest.
+    std::uint64_t unusedSince = 0;
   };
+  using Helpers = std::map<std::string, Entry>;
 
   std::shared_ptr<ReportingSessionConnectivityHelper> requestOnQueue(
       const std::string& key, const PropertyDictionary& userInfo, std::int32_t mode,
@@ -50,12 +57,15 @@ class SharedConnectivityHelpers : public std::enable_shared_from_this<SharedConn
   void releaseOnQueue(const std::string& key);
   void usageReported(const std::string& key, const std::weak_ptr<ReportingSessionConnectivityHelper>& helper,
                      std::uint32_t usage);
+  void letGo(Helpers::iterator entry);
+  void boundUnused();
 
   // Constant after construction.
   const Platform _platform;
   const std::shared_ptr<Queue> _stateQueue;
   // Touched on _stateQueue only.
-  std::map<std::string, Entry> _helpers;
+  Helpers _helpers;
+  std::uint64_t _releases = 0;
 };
 
 }  // namespace velk

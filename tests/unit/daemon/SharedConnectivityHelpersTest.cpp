@@ -124,6 +124,29 @@ TEST_F(SharedConnectivityHelpersTest, AnEverLastingTransportIsNeverLetGo) {
   EXPECT_EQ(helpers->status().size(), 1U);
 }
 
+TEST_F(SharedConnectivityHelpersTest, LetsTheLongestUnusedGoWhenTooManyWait) {
+  constexpr auto kMaximum = SharedConnectivityHelpers::kMaximumUnused;
+  const auto numbered = [](std::size_t number) { return user("Media", std::to_string(number).c_str()); };
+  const auto used = request(media);
+  for (std::size_t number = 0; number < kMaximum; ++number) {
+    static_cast<void>(request(numbered(number)));
+    release(numbered(number));
+  }
+  EXPECT_EQ(helpers->count(), kMaximum + 1);
+  const auto again = request(numbered(0));  // no longer the longest unused
+  release(numbered(0));
+  const auto next = request(numbered(1));
+  release(numbered(1));
+  static_cast<void>(request(numbered(kMaximum)));
+  release(numbered(kMaximum));
+
+  EXPECT_EQ(helpers->count(), kMaximum + 1);
+  EXPECT_EQ(request(numbered(0)), again);
+  EXPECT_EQ(request(numbered(1)), next);
+  EXPECT_EQ(request(media), used);
+  EXPECT_EQ(logged(daemontexts::kHelperReachedZero, "media:2"), 1);
+}
+
 TEST_F(SharedConnectivityHelpersTest, InvalidatesAllAtTheEnd) {
   request(media)->activate(30);
   helpers->invalidateAll();
