@@ -133,6 +133,24 @@ TEST(Flush, ReportsTheFirstErrorAtOnce) {
   EXPECT_EQ(errorOf(flush(session)), "postURL is nil");
 }
 
+TEST(Flush, OfABackendThatHoldsNothingAnswersBeforeTheOthersHavePosted) {
+  ReportingServer server;
+  TlsTestServer::Response late;
+  late.delay = std::chrono::seconds(1);
+  server.setPostResponse(late);
+  server.setStorebag("heather", storebagOf({{"splunk", postBackend(server)},
+                                            {"korrin", postBackend(server, {{"event_whitelist", PropertyArray{9}}})}}));
+  Daemon daemon(server);
+  ControlledSession session(daemon);
+  ASSERT_EQ(session.open(9, 1, {{"BatchEvents", true}}).size(), 3U);
+  session.sendEvent(7, 1, PropertyDictionary{{"answer", 42}});
+
+  EXPECT_EQ(flush(session), failed("Nothing to flush")) << "although the other one has something to say";
+  EXPECT_TRUE(server.waitForEvents(1, {7}));
+  EXPECT_TRUE(daemon.log().waitForPart("internalFlushMessagesWithCompletion: splunk"));
+  EXPECT_NE(daemon.messageLog().find("[splunk -> flushMessages] "), std::string::npos) << "its result is only logged";
+}
+
 TEST(Health, MessageTellsOfTheDaemon) {
   Flusher flusher({}, {});
   ControlledSession other(flusher.daemon);
@@ -194,6 +212,24 @@ TEST(Health, IsNotSentWithoutBackends) {
   EXPECT_TRUE(daemon.log().waitForPart("releaseIPCTransactions: IPC transaction ref count is "));
   EXPECT_EQ(daemon.stop(), 0);
   EXPECT_TRUE(server.posts().empty());
+}
+
+TEST(Health, OfAOneShotSessionIsSentToo) {
+  ReportingServer server;
+  server.setStorebag("heather", storebagWith(server));
+  Daemon daemon(server);
+  ControlledSession session(daemon);
+  EXPECT_EQ(session.call({{"method", "sendMessageWithSessionInfo"},
+                          {"sessionInfo", PropertyDictionary{{"ComponentType", 9}, {"SessionID", 42}}},
+                          {"userInfo", PropertyDictionary{{"_clientName", "Test"}}},
+                          {"category", 7},
+                          {"type", 1},
+                          {"payload", PropertyDictionary{{"answer", 42}}}}),
+            PropertyArray{"finished"});
+  EXPECT_EQ(session.finish(), 0);
+
+  ASSERT_TRUE(waitForHealth(server, 1));
+  EXPECT_FALSE(healthMessages(server)[0].contains("StorebagVersion")) << "only a configuration takes note of it";
 }
 
 TEST(Health, SendAndExitLosesNothing) {

@@ -39,5 +39,16 @@ TEST(MemoryEstimate, FollowsNesting) {
                                        allocationSize(PropertyValue(inner)) + allocationSize(value));
 }
 
+TEST(MemoryEstimate, WrapsAtThirtyTwoBits) {
+  PropertyArray texts;
+  for (int i = 0; i < 4; ++i) texts.append(std::string(std::size_t{16} << 20, 'x'));
+  PropertyArray many;
+  for (int i = 0; i < 40; ++i) many.append(texts);
+  const std::uint64_t inner = 8ULL * allocationSize(texts[0]) + allocationSize(PropertyValue(texts));
+  const std::uint64_t sum = 40 * (inner + allocationSize(PropertyValue(texts))) + allocationSize(PropertyValue(many));
+  ASSERT_GT(sum, std::uint64_t{1} << 32);
+  EXPECT_EQ(memoryEstimate(many), static_cast<std::uint32_t>(sum));
+}
+
 }  // namespace
 }  // namespace velk::test
