@@ -129,6 +129,7 @@ void PeriodicTasks::fired(const LogTimer& settings) {
   _queue->runInTurn([self = shared_from_this(), settings, generation = _generation] {
     if (self->_generation != generation) return;
     self->_turnIsQueued = false;
+    if (self->_queue->isHeld()) return;  // so much waits that this did not: a later tick will
     self->myPeriodicTask(settings.category, settings.type, settings.multiplier,
                          settings.interval * kNanosecondsPerSecond);
   });

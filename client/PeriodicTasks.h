@@ -45,7 +45,7 @@ class PeriodicTasks : public std::enable_shared_from_this<PeriodicTasks> {
   void startLogTimer(std::uint32_t interval, std::uint32_t reportingMultiplier, std::uint16_t category,
                      std::uint16_t type);
   void stopLogTimer();
-  /// True in a callback of one of the modules, on its thread.
+  /// True in a callback of one of the modules, on its thread, and while what it owned ends there.
   [[nodiscard]] bool isInCallback() const noexcept;
   /// The client is going: no tick begins any more, and no callback is called any more, but for calls that have begun.
   /// What callbacks own ends here if the caller may wait, else where callbacks run.

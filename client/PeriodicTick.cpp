@@ -51,6 +51,7 @@ void PeriodicTick::start(Scheduler& timers, std::optional<Duration> limit) {
 }
 
 void PeriodicTick::work(PeriodicModules::Module module) {
+  CurrentQueueScope scope(_owner);  // also while what a callback owned ends: that must not wait for the tick either
   while (module) {
     call(*module);
     module = nullptr;  // before the tick can be over: whoever unregistered it is then the last to let go of it
@@ -66,7 +67,6 @@ PeriodicModules::Module PeriodicTick::takeModule() {
 }
 
 void PeriodicTick::call(PeriodicModule& module) {
-  CurrentQueueScope scope(_owner);
   if (_kind == Kind::update) {
     static_cast<void>(module.call(nullptr));
     return;

@@ -201,6 +201,23 @@ TEST_F(PeriodicTickTest, WhatACallbackRegistersItMayTakeBack) {
   stop();
 }
 
+TEST_F(PeriodicTickTest, WhatACallbackOwnsMayUnregisterWhenItEnds) {
+  bool hasEnded = false;
+  std::shared_ptr<void> owner(nullptr, [&](void*) {
+    _tasks->unregisterModule(2, true);  // would wait for ever for the tick that waits for this
+    hasEnded = true;
+  });
+  EXPECT_TRUE(_tasks->registerModule(1, true, false, [&, owner = std::move(owner)](PropertyDictionary*) {
+    _tasks->unregisterModule(1, true);
+    EXPECT_FALSE(hasEnded) << "it is being used";
+  }));
+  EXPECT_TRUE(_tasks->registerModule(2, true, false, [](PropertyDictionary*) {}));
+  start(10, 0);
+  runWorkers();
+  EXPECT_TRUE(hasEnded);
+  EXPECT_EQ(_log.count("unregisterPeriodTaskForModule: 2 removed"), 1);
+}
+
 TEST_F(PeriodicTickTest, UnregisteringFromWorkOnTheQueueDoesNotWait) {
   Owned owned;
   EXPECT_TRUE(_tasks->registerModule(1, true, true, owned.block()));
