@@ -17,6 +17,8 @@
 
 namespace velk {
 
+class UnnamedFile;
+
 /// A request as its maker describes it. Bodies are shared, never copied, on their way to the socket.
 struct HttpRequest {
   std::string url;
@@ -24,6 +26,8 @@ struct HttpRequest {
   /// In the order in which they are sent. Control characters in values are removed; an empty value is sent as empty.
   std::vector<std::pair<std::string, std::string>> headers;
   std::shared_ptr<const std::string> body;
+  /// A body that is too large for memory, read piece by piece while it is sent. At most one of the two is given.
+  std::shared_ptr<const UnnamedFile> bodyFile;
   /// From `resume` to the end of the answer, waiting for a network included.
   Duration timeout = std::chrono::seconds(60);
   bool ignoresLocalCache = false;
@@ -31,6 +35,8 @@ struct HttpRequest {
   bool allowsCellularAccess = true;
   /// True: only https is spoken, whatever the address says.
   bool requiresHttps = true;
+  /// Where this is less than what the session's configuration says, it is the bound for the answer.
+  std::optional<std::size_t> maximumResponseBytes;
 
   void setHeader(std::string_view name, std::string_view value);
 };
@@ -101,9 +107,14 @@ class HttpSession {
   virtual void finishTasksAndInvalidate() = 0;
 };
 
+/// Whether a request can be made for the address: an absolute one, of http or https, with a host.
+[[nodiscard]] bool isHttpAddress(const std::string& url);
+
 class HttpSessionService {
  public:
   virtual ~HttpSessionService() = default;
+  /// Ends all tasks, whose delegates hear an error, and makes no more. Blocks until that is under way; idempotent.
+  virtual void stop() {}
   [[nodiscard]] virtual std::shared_ptr<HttpSession> makeSession(HttpSessionConfiguration configuration,
                                                                  std::shared_ptr<HttpSessionDelegate> delegate,
                                                                  std::shared_ptr<Queue> delegateQueue) = 0;

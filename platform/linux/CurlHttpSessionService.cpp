@@ -48,6 +48,8 @@ class CurlHttpSessionService final : public HttpSessionService {
       : _engine(std::make_shared<CurlEngine>(completed(std::move(trust)))) {}
   ~CurlHttpSessionService() override { _engine->stop(); }
 
+  void stop() override { _engine->stop(); }
+
   std::shared_ptr<HttpSession> makeSession(HttpSessionConfiguration configuration,
                                            std::shared_ptr<HttpSessionDelegate> delegate,
                                            std::shared_ptr<Queue> delegateQueue) override {

@@ -10,6 +10,7 @@
 
 #include "foundation/PropertyValue.h"
 #include "foundation/Text.h"
+#include "platform/UnnamedFile.h"
 #include "platform/linux/CurlEngine.h"
 
 namespace velk {
@@ -83,6 +84,8 @@ Result<HttpAddress> parseHttpAddress(const std::string& url) {
   return address;
 }
 
+bool isHttpAddress(const std::string& url) { return parseHttpAddress(url).has_value(); }
+
 CurlTask::CurlTask(std::shared_ptr<CurlSession> session, HttpRequest request, HttpAddress address,
                    FileDescriptor bodyFile, std::int64_t bodyFileSize)
     : _session(std::move(session)),
@@ -119,6 +122,19 @@ std::shared_ptr<const HttpResponse> CurlTask::response() const {
 }
 
 const HttpSessionConfiguration& CurlTask::configuration() const noexcept { return _session->_configuration; }
+
+int CurlTask::bodyFile() const noexcept {
+  return _request.bodyFile ? _request.bodyFile->file().get() : _bodyFile.get();
+}
+
+std::int64_t CurlTask::bodyFileSize() const noexcept {
+  return _request.bodyFile ? static_cast<std::int64_t>(_request.bodyFile->size()) : _bodyFileSize;
+}
+
+std::size_t CurlTask::maximumResponseBytes() const noexcept {
+  const std::size_t configured = configuration().maximumResponseBytes;
+  return std::min(configured, _request.maximumResponseBytes.value_or(configured));
+}
 
 void CurlTask::post(std::function<void(HttpSessionDelegate&, HttpSession&, HttpTask&)> call) {
   auto delegate = _session->delegate();

@@ -52,8 +52,10 @@ class CurlTask : public HttpTask, public std::enable_shared_from_this<CurlTask> 
   [[nodiscard]] const HttpRequest& request() const noexcept { return _request; }
   [[nodiscard]] const HttpAddress& address() const noexcept { return _address; }
   [[nodiscard]] const HttpSessionConfiguration& configuration() const noexcept;
-  [[nodiscard]] int bodyFile() const noexcept { return _bodyFile.get(); }
-  [[nodiscard]] std::int64_t bodyFileSize() const noexcept { return _bodyFileSize; }
+  /// -1 when the body is in memory.
+  [[nodiscard]] int bodyFile() const noexcept;
+  [[nodiscard]] std::int64_t bodyFileSize() const noexcept;
+  [[nodiscard]] std::size_t maximumResponseBytes() const noexcept;
   [[nodiscard]] SteadyTime deadline() const noexcept { return _deadline; }
 
  private:

@@ -92,7 +92,7 @@ void CurlTransfer::configureConnection(const HttpTrust& trust, SteadyTime now) {
   const long timeout = remainingMilliseconds(_task->deadline(), now);
   set(CURLOPT_TIMEOUT_MS, timeout);
   set(CURLOPT_CONNECTTIMEOUT_MS, timeout);
-  set(CURLOPT_MAXFILESIZE_LARGE, static_cast<curl_off_t>(_task->configuration().maximumResponseBytes));
+  set(CURLOPT_MAXFILESIZE_LARGE, static_cast<curl_off_t>(_task->maximumResponseBytes()));
 }
 
 void CurlTransfer::configureCallbacks() {
@@ -194,7 +194,7 @@ void CurlTransfer::headEnded() {
 }
 
 std::size_t CurlTransfer::dataReceived(std::span<const std::uint8_t> data) {
-  if (_bodyBytes + data.size() > _task->configuration().maximumResponseBytes) {
+  if (_bodyBytes + data.size() > _task->maximumResponseBytes()) {
     return refuse(CURLE_FILESIZE_EXCEEDED, "the answer is longer than allowed");
   }
   if (!_task->deliverData(data)) return CURL_WRITEFUNC_PAUSE;
@@ -213,7 +213,8 @@ std::size_t CurlTransfer::onRead(char* buffer, std::size_t size, std::size_t cou
   const auto left = transfer._task->bodyFileSize() - transfer._bodyFileOffset;
   const auto wanted = std::min<std::size_t>(size * count, static_cast<std::size_t>(std::max<std::int64_t>(left, 0)));
   const auto got = ::pread(transfer._task->bodyFile(), buffer, wanted, transfer._bodyFileOffset);
-  if (got < 0) return CURL_READFUNC_ABORT;
+  // A file that ends before its size would leave the server waiting for the rest.
+  if (got < 0 || (got == 0 && wanted > 0)) return CURL_READFUNC_ABORT;
   transfer._bodyFileOffset += got;
   return static_cast<std::size_t>(got);
 }

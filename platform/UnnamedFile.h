@@ -1,0 +1,33 @@
+// A file without a name: large bytes that need not be in memory and leave nothing behind, however the process ends.
+#pragma once
+
+#include <cstdint>
+#include <memory>
+#include <span>
+#include <string>
+
+#include "foundation/Error.h"
+#include "platform/FileDescriptor.h"
+
+namespace velk {
+
+/// Filled by one thread; then it changes no more and any thread may read it. The space is given back with it.
+class UnnamedFile {
+ public:
+  /// In the file system of that directory, readable by this process alone. Creates the directory if need be.
+  [[nodiscard]] static Result<std::unique_ptr<UnnamedFile>> make(const std::string& directory);
+
+  /// Fails when there is no room.
+  [[nodiscard]] Result<void> append(std::span<const std::uint8_t> bytes);
+
+  [[nodiscard]] const FileDescriptor& file() const noexcept { return _file; }
+  [[nodiscard]] std::uint64_t size() const noexcept { return _size; }
+
+ private:
+  explicit UnnamedFile(FileDescriptor file) : _file(std::move(file)) {}
+
+  const FileDescriptor _file;
+  std::uint64_t _size = 0;
+};
+
+}  // namespace velk
