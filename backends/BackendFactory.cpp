@@ -7,6 +7,7 @@
 #include "backends/LogTexts.h"
 #include "backends/PowerLogBackend.h"
 #include "backends/QuillBackend.h"
+#include "backends/UploadBackend.h"
 #include "backends/VelkReportingBackend.h"
 #include "device/DeviceEnvironment.h"
 #include "ipc/Vocabulary.h"
@@ -37,6 +38,10 @@ std::shared_ptr<VelkReportingBackend> makeDashboardBackend(const Section& sectio
   return DashboardBackend::initWithName(section.context, section.name, section.profile, section.productFamily);
 }
 
+std::shared_ptr<VelkReportingBackend> makeUploadBackend(const Section& section) {
+  return UploadBackend::initWithName(section.context, section.name, section.profile, section.productFamily);
+}
+
 std::shared_ptr<VelkReportingBackend> makePowerLogBackend(const Section& section) {
   return PowerLogBackend::initWithName(section.context, section.name, section.profile, section.productFamily);
 }
@@ -44,12 +49,6 @@ std::shared_ptr<VelkReportingBackend> makePowerLogBackend(const Section& section
 std::shared_ptr<VelkReportingBackend> makeQuillBackend(const Section& section) {
   return QuillBackend::initWithName(section.context, section.name, section.profile, section.productFamily,
                                     section.clientType);
-}
-
-/// Stands where a class is known by name but not built into this daemon: its sections are passed over.
-std::shared_ptr<VelkReportingBackend> makeNothingYet(const Section& section) {
-  log::debug("VelkReportingBackend(newBackendWithName): this daemon has no %s backend", section.name);
-  return nullptr;
 }
 
 struct Row {
@@ -61,7 +60,7 @@ struct Row {
 // Tested from the top.
 constexpr std::array kRows{
     Row{kVelkReportingBackendDashboard, false, makeDashboardBackend},
-    Row{kVelkReportingBackendUploadServer, false, makeNothingYet},
+    Row{kVelkReportingBackendUploadServer, false, makeUploadBackend},
     Row{kVelkReportingBackendHTTPPost, true, makeHTTPSPostBackend},
     Row{kVelkReportingBackendHTTPPost2, false, makeHTTPSPostBackend},
     Row{kVelkReportingBackendPowerlog, false, makePowerLogBackend},

@@ -53,7 +53,7 @@ std::optional<std::string> VelkReportingBackend::flushMessagesWithCompletion(Bac
   return std::nullopt;
 }
 
-bool VelkReportingBackend::uploadFileAtPath(const std::string&, const std::string&) { return false; }
+bool VelkReportingBackend::uploadFileAtPath(FileUpload&) { return false; }
 
 bool VelkReportingBackend::uploadLogData(const PropertyArray&) { return false; }
 

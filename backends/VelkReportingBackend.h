@@ -22,6 +22,7 @@
 #include "foundation/Error.h"
 #include "foundation/PropertyValue.h"
 #include "foundation/TimeValue.h"
+#include "platform/FileDescriptor.h"
 #include "platform/Lock.h"
 #include "platform/Platform.h"
 
@@ -44,6 +45,17 @@ using BackendFlushCompletion = Completion<std::optional<std::string>, std::optio
 struct BackendContext {
   Platform& platform;
   const DeviceEnvironment& environment;
+  /// On a disk with room for what is too large for memory. What is kept there has no name.
+  std::string largeFilesDirectory = "/var/tmp";
+};
+
+/// A file that a client hands over for upload.
+struct FileUpload {
+  std::string path;            ///< what the client calls it; it is never opened
+  std::string extensionToken;  ///< what the client calls the descriptor
+  FileDescriptor file;         ///< opened by the client; none when it gave none
+  /// Set when a server has said that it has the file, which its owner may then remove.
+  bool isDelivered = false;
 };
 
 class VelkReportingBackend : public std::enable_shared_from_this<VelkReportingBackend> {
@@ -77,7 +89,9 @@ class VelkReportingBackend : public std::enable_shared_from_this<VelkReportingBa
   /// Posts what is batched. Answers the text for the message log. The completion runs on the calling thread before
   /// this returns, or on the transport's queue; it is dropped uncalled when the transport drops the post.
   virtual std::optional<std::string> flushMessagesWithCompletion(BackendFlushCompletion completion);
-  [[nodiscard]] virtual bool uploadFileAtPath(const std::string& path, const std::string& extensionToken);
+  // Uploads: on the session's upload queue, beside its other calls. They may block until a server has answered.
+  /// True when the file was taken in hand.
+  [[nodiscard]] virtual bool uploadFileAtPath(FileUpload& upload);
   [[nodiscard]] virtual bool uploadLogData(const PropertyArray& logData);
   /// Any thread.
   virtual void setCorrelatedSessionID(const std::string& combinedSessionID);

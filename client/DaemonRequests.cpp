@@ -1,5 +1,7 @@
 // The calls that ask the daemon for something, each with its own words for a daemon that cannot be reached.
 
+#include <cerrno>
+
 #include "client/DaemonConnection.h"
 #include "client/LogTexts.h"
 #include "client/VelkReportingImplementation.h"
@@ -13,6 +15,13 @@ namespace {
 const Error& noDaemon() {
   static const Error error = connectionError(ConnectionError::notConnected, "no daemon answers");
   return error;
+}
+
+/// With this process's own rights, and before its user hears of the upload. Not on the library's thread: a file system
+/// may take its time.
+void removeUploaded(const FileToHandOver& file) {
+  const auto removed = file.removeIfUnchanged();
+  if (!removed) log::standard(texts::kUploadedFileStays, removed.error());
 }
 
 /// A callback of the user, shared between the reply and the error handler: whichever comes runs it, elsewhere, once.
@@ -138,15 +147,35 @@ void VelkReportingImplementation::setDigestKey(const ByteData& key, std::int32_t
   SessionInterfaceProxy(connection, failed).setDigestKey(key, algorithm);
 }
 
-void VelkReportingImplementation::uploadFile(const std::string& url, FileDescriptor file,
+Result<std::shared_ptr<const FileToHandOver>> VelkReportingImplementation::openForUpload(const std::string& path) {
+  std::shared_ptr<void> place(nullptr, [held = _filesHeld](void*) { --*held; });
+  if (++*_filesHeld > kMaximumFilesHeld) return failure("HandedFile", EMFILE, path + ": too many uploads wait");
+  auto file = FileToHandOver::open(path);
+  if (!file) return Failure(file.error());
+  struct Held {
+    FileToHandOver file;
+    std::shared_ptr<void> place;
+  };
+  const auto held = std::make_shared<const Held>(Held{std::move(*file), std::move(place)});
+  return std::shared_ptr<const FileToHandOver>(held, &held->file);
+}
+
+void VelkReportingImplementation::uploadFile(const std::string& url, const std::shared_ptr<const FileToHandOver>& file,
                                              VelkReporting::UploadCallback completionHandler) {
   const auto failed = loggingHandler(texts::kUploadFileProxyFailure);
   const auto connection = _link->connect();
   if (!connection) return failed(noDaemon());
-  const SharedCallback<bool, const std::optional<Error>&> shared(_runtime, std::move(completionHandler));
+  auto descriptor = file->descriptor();
+  if (!descriptor) return failed(descriptor.error());
   SessionInterfaceProxy(connection, failed)
-      .uploadFileAtPath(url, randomUuidText(), std::move(file),
-                        [shared](bool uploaded) { shared(uploaded, std::optional<Error>()); });
+      .uploadFileAtPath(
+          url, randomUuidText(), std::move(*descriptor),
+          [runtime = &_runtime, file, handler = std::move(completionHandler)](bool uploaded, bool isDelivered) {
+            runtime->runCallback([file, handler, uploaded, isDelivered] {
+              if (isDelivered) removeUploaded(*file);
+              if (handler) handler(uploaded, std::nullopt);
+            });
+          });
 }
 
 void VelkReportingImplementation::uploadLogData(const PropertyArray& logData,

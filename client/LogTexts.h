@@ -58,6 +58,7 @@ inline constexpr std::string_view kServerSupportsFileUpload = "serverSupportsFil
 inline constexpr std::string_view kFileUrlIsNil = "uploadFileWithURL: fileURL provided is nil";
 inline constexpr std::string_view kNoExtension =
     "uploadFileWithURL: Failed to get sandbox extension for path %s, errno %d";
+inline constexpr std::string_view kUploadedFileStays = "uploadFileWithURL: An uploaded file stays: %s";
 inline constexpr std::string_view kLogDataArrayIsEmpty = "uploadDataArray: Log data array is empty";
 
 // Aggregation and the end

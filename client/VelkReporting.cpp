@@ -4,7 +4,6 @@
 #include "client/SessionInfoValidation.h"
 #include "client/VelkReportingImplementation.h"
 #include "ipc/Vocabulary.h"
-#include "platform/HandedFile.h"
 #include "platform/Log.h"
 
 namespace velk {
@@ -214,14 +213,15 @@ bool VelkReporting::uploadFileWithURL(const std::optional<std::string>& fileURL,
     return false;
   }
   if (_implementation->isForeign()) return false;
-  auto file = openToHandOver(pathOfFileUrl(*fileURL));
+  const std::string path = pathOfFileUrl(*fileURL);
+  auto file = _implementation->openForUpload(path);
   if (!file) {
-    log::standard(texts::kNoExtension, pathOfFileUrl(*fileURL), file.error().code);
+    log::standard(texts::kNoExtension, path, file.error().code);
     return false;
   }
-  _implementation->callInOrder([url = *fileURL, descriptor = std::move(*file),
+  _implementation->callInOrder([url = *fileURL, opened = std::move(*file),
                                 handler = std::move(completionHandler)](VelkReportingImplementation& self) mutable {
-    self.uploadFile(url, std::move(descriptor), std::move(handler));
+    self.uploadFile(url, opened, std::move(handler));
   });
   return true;
 }

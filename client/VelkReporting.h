@@ -89,7 +89,9 @@ class VELK_EXPORT VelkReporting : public std::enable_shared_from_this<VelkReport
   [[nodiscard]] bool isBlacklistedEvent(std::uint16_t category) const;
 
   [[nodiscard]] bool serverSupportsFileUpload() const;
-  /// Hands a file (a path, or a file URL) to the daemon for upload: opened here, without following links.
+  /// Hands a file (a path, or a file URL) to the daemon for upload: opened here, without following links. When the
+  /// server says that it has the file, it is removed, unless another one has taken its name; the callback hears whether
+  /// an upload was attempted. False as well while 64 files of this object wait for their answers.
   bool uploadFileWithURL(const std::optional<std::string>& fileURL, UploadCallback completionHandler);
   bool uploadDataArray(const std::optional<PropertyArray>& logData, UploadCallback completionHandler);
   /// The key of the digest that goes with each post of the "qrs" backend. False without a key.

@@ -20,6 +20,7 @@
 #include "client/SessionLink.h"
 #include "client/VelkReporting.h"
 #include "client/VelkReportingAggregationObject.h"
+#include "platform/HandedFile.h"
 
 namespace velk {
 
@@ -28,6 +29,8 @@ class VelkReportingImplementation : public std::enable_shared_from_this<VelkRepo
   /// Codes of errors that only the library makes.
   static constexpr int kOutboxFull = 8;
   static constexpr int kForkedChild = 9;
+  /// Files whose upload has not been answered yet: each takes two of the host's descriptors.
+  static constexpr std::size_t kMaximumFilesHeld = 64;
 
   VelkReportingImplementation(ClientRuntime& runtime, SessionDescription description,
                               VelkReportingAggregationBlock aggregationBlock);
@@ -58,6 +61,9 @@ class VelkReportingImplementation : public std::enable_shared_from_this<VelkRepo
   enum class Sent { taken, filtered, outboxFull, notFromForkedChild };
   /// Tells the delegate of a valid message and queues it, unless the daemon wants no such events.
   Sent sendMessage(std::uint16_t category, const PropertyDictionary& message);
+  /// The file is held open until its upload has been answered, so that nothing else is taken for it; no more than some
+  /// may be held by one client. The error's code is the system's error number.
+  [[nodiscard]] Result<std::shared_ptr<const FileToHandOver>> openForUpload(const std::string& path);
   /// Directly over the connection, past everything that is queued.
   void finishSession();
   /// The end: what was queued is sent, the session finished, the connection closed. Waits for that within a bound,
@@ -82,7 +88,8 @@ class VelkReportingImplementation : public std::enable_shared_from_this<VelkRepo
   void updateSharedDataForKey(const std::string& key, const std::optional<PropertyValue>& value);
   void setDigestKey(const ByteData& key, std::int32_t algorithm);
   void setMessageLoggingBlock(VelkReporting::LoggingBlock block);
-  void uploadFile(const std::string& url, FileDescriptor file, VelkReporting::UploadCallback completionHandler);
+  void uploadFile(const std::string& url, const std::shared_ptr<const FileToHandOver>& file,
+                  VelkReporting::UploadCallback completionHandler);
   void uploadLogData(const PropertyArray& logData, VelkReporting::UploadCallback completionHandler);
 
  private:
@@ -127,6 +134,8 @@ class VelkReportingImplementation : public std::enable_shared_from_this<VelkRepo
   EventOutbox _outbox;
   IncomingEvents _incoming;
   std::atomic<bool> _mayHaveDelegate{false};  ///< once true it stays so
+  /// Shared with the files.
+  const std::shared_ptr<std::atomic<std::size_t>> _filesHeld = std::make_shared<std::atomic<std::size_t>>(0);
 
   mutable Lock _lock;
   std::weak_ptr<VelkReportingMessageSentDelegate> _weakMessageSentDelegate VELK_GUARDED_BY(_lock);

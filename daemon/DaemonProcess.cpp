@@ -151,7 +151,7 @@ DaemonProcess::Parts::Parts(const DaemonOptions& options, process::RunLoop& loop
       storebagPlatform{systemClock(), *storebagPool, *defaults, *device,     *locale,       *http,
                        *random,       idleWatch,     *consent,  *statistics, *logSubmission},
       messageLog(directories.logs, platform.clock, *logSubmission),
-      services{{platform, environment}, messageLog},
+      services{{platform, environment, directories.cache}, messageLog},
       publicKey(storebagPublicKeyFromDirectories(directories.configuration, directories.data)),
       storebagService(StorebagService::make(storebagPlatform, environment,
                                             makeStorebagDiskCache(storebagDirectory(directories)), publicKey)),
@@ -273,6 +273,8 @@ void DaemonProcess::stop() {
     log::error("stop: the diagnostics adaptor does not return from its calls; the process ends without it");
     process::endNow(kExitSoftware);
   }
+  // Uploads wait for their answers on threads of the pool.
+  _parts->http->stop();
   // The threads: first those that hand work over, then those that do it.
   _parts->eventLoop.stop();
   _parts->pool->stop();

@@ -14,7 +14,7 @@ constexpr std::array kMethods{
     MethodDescription{Method::sendMessageWithDictionary, "sendMessageWithDictionary", 1, 1},
     MethodDescription{Method::flushMessagesWithCompletion, "flushMessagesWithCompletion", 0, 2},
     MethodDescription{Method::finishSessionGracefully, "finishSessionGracefully", 0, 0},
-    MethodDescription{Method::uploadFileAtPath, "uploadFileAtPath", 2, 1},
+    MethodDescription{Method::uploadFileAtPath, "uploadFileAtPath", 2, 2},
     MethodDescription{Method::uploadLogData, "uploadLogData", 1, 2},
     MethodDescription{Method::sendMessageWithSessionInfo, "sendMessageWithSessionInfo", 5, 1},
     MethodDescription{Method::updateSharedDataWithDictionary, "updateSharedDataWithDictionary", 1, 0},

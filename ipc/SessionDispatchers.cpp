@@ -61,8 +61,11 @@ FlushReply flushReply(Reply& reply) {
 
 UploadReply uploadReply(Reply& reply) {
   if (!reply) return nullptr;
-  return [reply = std::move(reply)](bool success) mutable {
-    reply.send(1, [&](CborWriter& writer) { writer.boolean(success); });
+  return [reply = std::move(reply)](bool success, bool isDelivered) mutable {
+    reply.send(2, [&](CborWriter& writer) {
+      writer.boolean(success);
+      writer.boolean(isDelivered);
+    });
   };
 }
 

@@ -20,7 +20,8 @@ using ConfigurationReply =
 using TextReply = Completion<std::optional<std::string>>;
 /// The result text and the error, either may be absent.
 using FlushReply = Completion<std::optional<std::string>, std::optional<Error>>;
-using UploadReply = Completion<bool>;
+/// Whether the file was taken in hand, and whether a server says that it has it: its owner may then remove it.
+using UploadReply = Completion<bool, bool>;
 using LogDataReply = Completion<bool, std::optional<Error>>;
 using StatusReply = Completion<PropertyDictionary>;
 

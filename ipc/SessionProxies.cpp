@@ -74,10 +74,11 @@ bool deliverFlush(ArgumentReader& values, FlushReply& reply) {
   return true;
 }
 
-bool deliverSuccess(ArgumentReader& values, UploadReply& reply) {
+bool deliverUpload(ArgumentReader& values, UploadReply& reply) {
   const bool success = values.boolean();
+  const bool isDelivered = values.boolean();
   if (!values.isSound()) return false;
-  reply(success);
+  reply(success, isDelivered);
   return true;
 }
 
@@ -150,7 +151,7 @@ void SessionInterfaceProxy::uploadFileAtPath(std::string url, std::string extens
     writer.text(url);
     writer.bytes({reinterpret_cast<const std::uint8_t*>(extensionToken.data()), extensionToken.size()});
   };
-  sendWithReply(*_connection, _errorHandler, Method::uploadFileAtPath, 2, encode, std::move(reply), deliverSuccess,
+  sendWithReply(*_connection, _errorHandler, Method::uploadFileAtPath, 2, encode, std::move(reply), deliverUpload,
                 std::move(descriptors));
 }
 

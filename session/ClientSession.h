@@ -19,6 +19,7 @@
 #include "platform/Lock.h"
 #include "session/ReportingdSession.h"
 #include "session/SessionBackends.h"
+#include "session/UploadQueue.h"
 
 namespace velk {
 
@@ -123,10 +124,11 @@ class ClientSession final : public ReportingdSession {
                                      std::uint16_t type, const std::optional<PropertyDictionary>& payload);
 
   // Uploads (Uploads.cpp).
-  void uploadFileWithURL(const std::string& url, const std::string& extensionToken, UploadReply reply);
+  void uploadFileWithURL(std::string url, std::string extensionToken, FileDescriptor file, UploadReply reply);
 
   // Teardown (Teardown.cpp).
   [[nodiscard]] PropertyDictionary makeHealthPayload();
+  void letGo();
   void returnKeepAlive();
   void releaseEverything();
 
@@ -155,6 +157,7 @@ class ClientSession final : public ReportingdSession {
   std::int32_t _digestAlgorithm = 0;
   std::shared_ptr<ReportingSessionConnectivityHelper> _connectivityHelper;
   std::uint32_t _connectivityHelperReleaseTimeout;
+  UploadQueue _uploads;
   bool _tornDown = false;
 
   // Self-synchronised.

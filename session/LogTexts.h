@@ -100,6 +100,8 @@ inline constexpr std::string_view kMessageLogUpload = "[uploadFileWithURL] Uploa
 // error
 inline constexpr std::string_view kUploadFailed = "uploadFileWithURL: File upload failed for %s";
 inline constexpr std::string_view kLogDataFailed = "uploadLogData: Log data array upload failed";
+inline constexpr std::string_view kTooManyUploads =
+    "uploadFileAtPath: session %u has %d uploads under way and takes no more";
 
 // What clients are told.
 inline constexpr std::string_view kReplyNoDisplayURL = "URL not available";

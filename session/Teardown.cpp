@@ -26,6 +26,12 @@ void ClientSession::teardown() {
     flushMessagesWithCompletion(FlushReply());
   }
   shutdownSessionAggregation();
+  // Uploads that a client leaves behind still need the transport, and the process.
+  _uploads.runBehindUploads([self = std::static_pointer_cast<ClientSession>(shared_from_this())] { self->letGo(); });
+}
+
+/// Once, when nobody else uses the session any more: on the connection's queue or, behind uploads, on theirs.
+void ClientSession::letGo() {
   returnKeepAlive();
   // After the helper has counted this session: releasing the user info may end the helper, which gives back what it
   // has counted.

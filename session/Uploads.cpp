@@ -1,4 +1,6 @@
 // Files and log data that clients hand over, and where their reports can be seen. The backends do the work.
+#include <utility>
+
 #include "foundation/Format.h"
 #include "ipc/Vocabulary.h"
 #include "platform/Log.h"
@@ -23,6 +25,36 @@ std::optional<std::string> chooseDisplayURL(const SessionBackends& backends) {
   return dashboard != nullptr ? dashboard->displayURL() : std::nullopt;
 }
 
+/// Every backend is asked, also when one has taken it in hand already.
+template <class Ask>
+bool offer(const SessionBackends* backends, Ask ask) {
+  bool taken = false;
+  if (backends == nullptr) return taken;
+  for (const auto& entry : *backends) taken = ask(*entry.backend) || taken;
+  return taken;
+}
+
+void finishFileUpload(MessageLog& messageLog, const std::string& url, const FileUpload& upload, bool taken,
+                      UploadReply& reply) {
+  if (taken) {
+    log::standard(session_texts::kUploadSuccessful, upload.path);
+  } else {
+    log::error(session_texts::kUploadFailed, upload.path);
+  }
+  messageLog.writeToLogFile(
+      formatText(session_texts::kMessageLogUpload, {taken ? "succeeded" : "failed", withoutControlCharacters(url)}));
+  reply(taken, upload.isDelivered);
+}
+
+void finishLogData(bool taken, LogDataReply& reply) {
+  if (taken) {
+    log::standard(session_texts::kLogDataSuccessful);
+  } else {
+    log::error(session_texts::kLogDataFailed);
+  }
+  reply(taken, std::nullopt);
+}
+
 }  // namespace
 
 void ClientSession::fetchDisplayURL(TextReply reply) {
@@ -35,38 +67,35 @@ void ClientSession::fetchDisplayURL(TextReply reply) {
 void ClientSession::uploadFileAtPath(std::string url, std::string extensionToken, FileDescriptor file,
                                      UploadReply reply) {
   log::standard(session_texts::kUploadingFile, sessionID());
-  // Stays open while the backends are asked; a backend that takes the upload finds it by the token.
-  const FileDescriptor heldOpen = std::move(file);
-  uploadFileWithURL(url, extensionToken, std::move(reply));
+  uploadFileWithURL(std::move(url), std::move(extensionToken), std::move(file), std::move(reply));
 }
 
-void ClientSession::uploadFileWithURL(const std::string& url, const std::string& extensionToken, UploadReply reply) {
-  const std::string path = fileSystemPath(url);
-  bool taken = false;
-  if (const auto& backends = ownBackends()) {
-    for (const auto& entry : *backends) taken = entry.backend->uploadFileAtPath(path, extensionToken) || taken;
+void ClientSession::uploadFileWithURL(std::string url, std::string extensionToken, FileDescriptor file,
+                                      UploadReply reply) {
+  FileUpload upload{fileSystemPath(url), std::move(extensionToken), std::move(file)};
+  if (_uploads.isFull()) {
+    log::error(session_texts::kTooManyUploads, sessionID(), UploadQueue::kMaximumUploads);
+    finishFileUpload(_services.messageLog, url, upload, false, reply);
+    return;
   }
-  if (taken) {
-    log::standard(session_texts::kUploadSuccessful, path);
-  } else {
-    log::error(session_texts::kUploadFailed, path);
-  }
-  _services.messageLog.writeToLogFile(
-      formatText(session_texts::kMessageLogUpload, {taken ? "succeeded" : "failed", withoutControlCharacters(url)}));
-  reply(taken);
+  // Nothing of the session: the upload may outlive it.
+  _uploads.run([backends = ownBackends(), &messageLog = _services.messageLog, url = std::move(url),
+                upload = std::move(upload), reply = std::move(reply)]() mutable {
+    const bool taken = offer(backends.get(), [&](VelkReportingBackend& each) { return each.uploadFileAtPath(upload); });
+    finishFileUpload(messageLog, url, upload, taken, reply);
+  });
 }
 
 void ClientSession::uploadLogData(PropertyArray logData, LogDataReply reply) {
-  bool taken = false;
-  if (const auto& backends = ownBackends()) {
-    for (const auto& entry : *backends) taken = entry.backend->uploadLogData(logData) || taken;
+  if (_uploads.isFull()) {
+    log::error(session_texts::kTooManyUploads, sessionID(), UploadQueue::kMaximumUploads);
+    finishLogData(false, reply);
+    return;
   }
-  if (taken) {
-    log::standard(session_texts::kLogDataSuccessful);
-  } else {
-    log::error(session_texts::kLogDataFailed);
-  }
-  reply(taken, std::nullopt);
+  _uploads.run([backends = ownBackends(), logData = std::move(logData), reply = std::move(reply)]() mutable {
+    finishLogData(offer(backends.get(), [&](VelkReportingBackend& each) { return each.uploadLogData(logData); }),
+                  reply);
+  });
 }
 
 }  // namespace velk

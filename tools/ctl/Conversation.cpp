@@ -1,9 +1,9 @@
 #include "tools/ctl/Conversation.h"
 
 #include <algorithm>
+#include <memory>
 
 #include "foundation/Uuid.h"
-#include "platform/HandedFile.h"
 
 namespace velk::ctl {
 namespace {
@@ -51,10 +51,14 @@ double Conversation::take(std::string_view line, int lineNumber, SessionWire& wi
 void Conversation::call(const SessionCall& call, int lineNumber, SessionWire& wire) {
   PropertyArray arguments = call.arguments;
   std::vector<FileDescriptor> descriptors;
+  std::shared_ptr<const FileToHandOver> file;
   if (call.path) {
-    Result<FileDescriptor> file = openToHandOver(*call.path);
-    if (!file) return complain(lineNumber, file.error().description);
-    descriptors.push_back(std::move(*file));
+    Result<FileToHandOver> opened = FileToHandOver::open(*call.path);
+    if (!opened) return complain(lineNumber, opened.error().description);
+    Result<FileDescriptor> descriptor = opened->descriptor();
+    if (!descriptor) return complain(lineNumber, descriptor.error().description);
+    file = std::make_shared<const FileToHandOver>(std::move(*opened));
+    descriptors.push_back(std::move(*descriptor));
     // The token that names the descriptor travels as bytes.
     const std::string token = randomUuidText();
     arguments.append(ByteData(token.begin(), token.end()));
@@ -63,7 +67,8 @@ void Conversation::call(const SessionCall& call, int lineNumber, SessionWire& wi
   const MethodDescription method = call.method;
   const Result<void> sent = wire.call(
       method, arguments,
-      [this, method, lineNumber](Result<PropertyArray> reply) {
+      [this, method, lineNumber, file](Result<PropertyArray> reply) {
+        if (file && reply) removeIfDelivered(*file, *reply);
         hear(method, lineNumber, reply);
         countReply(-1);
       },
@@ -71,6 +76,15 @@ void Conversation::call(const SessionCall& call, int lineNumber, SessionWire& wi
   if (sent) return;
   complain(lineNumber, sent.error().description);
   countReply(-1);
+}
+
+// What a server says that it has is removed, with the rights of whoever runs this. The second value is for this end
+// alone: people get the one that the method is known to answer.
+void Conversation::removeIfDelivered(const FileToHandOver& file, PropertyArray& reply) {
+  const bool isDelivered = reply.size() > 1 && booleanValue(&reply[1]);
+  if (!reply.empty()) reply = PropertyArray{reply[0]};
+  // One that may not be removed, or that another has taken the place of, stays: nobody asked for more than the upload.
+  if (isDelivered) (void)file.removeIfUnchanged();
 }
 
 void Conversation::hear(const MethodDescription& method, int lineNumber, const Result<PropertyArray>& reply) {

@@ -9,6 +9,7 @@
 #include "ipc/Connection.h"
 #include "ipc/SessionInterface.h"
 #include "platform/FileDescriptor.h"
+#include "platform/HandedFile.h"
 #include "platform/Lock.h"
 #include "tools/JsonLines.h"
 #include "tools/ctl/SessionLine.h"
@@ -47,6 +48,7 @@ class Conversation final : public ClientSessionReplyInterface {
 
  private:
   void call(const SessionCall& call, int lineNumber, SessionWire& wire);
+  static void removeIfDelivered(const FileToHandOver& file, PropertyArray& reply);
   void hear(const MethodDescription& method, int lineNumber, const Result<PropertyArray>& reply);
   void countReply(int change);
 

@@ -1,5 +1,6 @@
 #include <set>
 
+#include "backends/UploadBackend.h"
 #include "tests/unit/backends/BackendFixture.h"
 
 namespace velk::test {
@@ -34,7 +35,8 @@ class BackendBaseTest : public BackendTest {
 TEST_F(BackendBaseTest, DoesNothingByDefault) {
   VelkReportingBackend plain(context, "plain", PropertyDictionary{}, "Lamp");
   EXPECT_EQ(plain.sendMessage(PropertyDictionary{}, kStart, 1, 2, 0), std::nullopt);
-  EXPECT_FALSE(plain.uploadFileAtPath("/tmp/x", ""));
+  FileUpload upload{"/tmp/x", "", {}};
+  EXPECT_FALSE(plain.uploadFileAtPath(upload));
   EXPECT_FALSE(plain.uploadLogData({}));
   EXPECT_EQ(plain.batchedEventsSize(), 0U);
   EXPECT_FALSE(plain.isHTTPSPostBackend());
@@ -166,11 +168,12 @@ TEST_F(BackendFactoryTest, RefusesUnknownNames) {
   }
 }
 
-TEST_F(BackendFactoryTest, PassesOverNamesWhoseClassesItLacks) {
-  for (const char* name : {"upload_server"}) {
-    EXPECT_FALSE(make(name, PropertyDictionary{})) << name;
-    EXPECT_FALSE(log.contains(std::string("VelkReportingBackend(newBackendWithName): ") + name));
-  }
+TEST_F(BackendFactoryTest, UploadServerIsTheOneThatTakesFiles) {
+  const auto uploads = make("upload_server", PropertyDictionary{{"post_url", "https://logs.example"}});
+  ASSERT_NE(std::dynamic_pointer_cast<UploadBackend>(uploads), nullptr);
+  EXPECT_EQ(uploads->updateState(), kBackendEnabled);
+  EXPECT_EQ(make("upload_server", PropertyDictionary{}), nullptr) << "it has nowhere to post to";
+  EXPECT_EQ(make("upload_server2", PropertyDictionary{{"post_url", "https://logs.example"}}), nullptr);
 }
 
 TEST_F(BackendFactoryTest, KeepsQuillOffOneFamily) {

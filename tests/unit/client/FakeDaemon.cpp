@@ -17,6 +17,7 @@ struct FakeDaemon::State {
   std::size_t ends VELK_GUARDED_BY(lock) = 0;
   bool holds VELK_GUARDED_BY(lock) = false;
   bool refuses VELK_GUARDED_BY(lock) = false;
+  bool deliversUploads VELK_GUARDED_BY(lock) = false;
   std::optional<PropertyArray> enabled VELK_GUARDED_BY(lock) = PropertyArray{"splunk"};
   std::optional<PropertyArray> whitelist VELK_GUARDED_BY(lock);
   std::optional<PropertyArray> blacklist VELK_GUARDED_BY(lock);
@@ -81,7 +82,12 @@ class FakeDaemon::Session : public ClientSessionInterface {
   void finishSessionGracefully() override { record("finishSessionGracefully", {}); }
   void uploadFileAtPath(std::string url, std::string extensionToken, FileDescriptor file, UploadReply reply) override {
     record("uploadFileAtPath", {url, extensionToken, static_cast<bool>(file)});
-    reply(true);
+    bool isDelivered = false;
+    {
+      Guard guard(_state->lock);
+      isDelivered = _state->deliversUploads;
+    }
+    reply(true, isDelivered);
   }
   void uploadLogData(PropertyArray logData, LogDataReply reply) override {
     record("uploadLogData", {logData});
@@ -202,6 +208,11 @@ void FakeDaemon::setConfiguration(std::optional<PropertyArray> enabled, std::opt
   _state->enabled = std::move(enabled);
   _state->whitelist = std::move(whitelist);
   _state->blacklist = std::move(blacklist);
+}
+
+void FakeDaemon::setDeliversUploads(bool delivers) {
+  Guard guard(_state->lock);
+  _state->deliversUploads = delivers;
 }
 
 void FakeDaemon::setMessageReply(std::optional<std::string> text) {

@@ -40,6 +40,8 @@ class FakeDaemon {
   /// What configuration calls answer from now on.
   void setConfiguration(std::optional<PropertyArray> enabled, std::optional<PropertyArray> whitelist,
                         std::optional<PropertyArray> blacklist);
+  /// Whether a server is said to have the files that are uploaded.
+  void setDeliversUploads(bool delivers);
   void setMessageReply(std::optional<std::string> text);
   void setFlushError(std::optional<Error> error);
   /// Held back while true: no call is answered or even run.

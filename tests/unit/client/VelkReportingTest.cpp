@@ -1,9 +1,12 @@
 #include "client/VelkReporting.h"
 
 #include <atomic>
+#include <filesystem>
 #include <stdexcept>
 
 #include "client/LogTexts.h"
+#include "platform/Files.h"
+#include "tests/support/TemporaryDirectory.h"
 #include "tests/unit/client/ClientFixture.h"
 
 namespace velk::test {
@@ -231,6 +234,81 @@ TEST_F(VelkReportingTest, UploadHandsTheFileOver) {
   }));
   EXPECT_TRUE(answered->waitFor(kPatience));
   EXPECT_EQ(_daemon.calls().back().arguments[2], PropertyValue(true)) << "a descriptor came along";
+}
+
+class ClientUploadTest : public VelkReportingTest {
+ protected:
+  /// The answer to the upload of that file.
+  bool upload(VelkReporting& client, const std::string& path) {
+    auto uploaded = std::make_shared<std::atomic<bool>>(false);
+    auto answered = std::make_shared<Semaphore>();
+    EXPECT_TRUE(client.uploadFileWithURL(path, [uploaded, answered](bool value, const auto&) {
+      *uploaded = value;
+      answered->signal();
+    }));
+    EXPECT_TRUE(answered->waitFor(kPatience));
+    return *uploaded;
+  }
+
+  const TemporaryDirectory _directory;
+};
+
+TEST_F(ClientUploadTest, FileThatTheServerHasIsGoneWhenTheAnswerComes) {
+  _daemon.start();
+  _daemon.setDeliversUploads(true);
+  const auto path = _directory.write("log", "text");
+  EXPECT_TRUE(upload(*makeClient(), "file://" + path));
+  EXPECT_FALSE(files::exists(path));
+}
+
+TEST_F(ClientUploadTest, FileThatTheServerRefusedStays) {
+  _daemon.start();
+  const auto path = _directory.write("log", "text");
+  EXPECT_TRUE(upload(*makeClient(), path));
+  EXPECT_TRUE(files::exists(path));
+}
+
+TEST_F(ClientUploadTest, FileThatTookItsPlaceStays) {
+  _daemon.start();
+  _daemon.setDeliversUploads(true);
+  _daemon.holdCalls(true);
+  const auto path = _directory.write("log", "text");
+  const auto client = makeClient();
+  auto answered = std::make_shared<Semaphore>();
+  EXPECT_TRUE(client->uploadFileWithURL(path, [answered](bool, const auto&) { answered->signal(); }));
+  ASSERT_TRUE(files::remove(path).has_value());
+  static_cast<void>(_directory.write("log", "another one"));
+  _daemon.holdCalls(false);
+  EXPECT_TRUE(answered->waitFor(kPatience));
+  EXPECT_EQ(_directory.read("log"), "another one");
+  EXPECT_EQ(_log.count("uploadFileWithURL: An uploaded file stays: " + path + ": another file has taken its place"), 1);
+}
+
+TEST_F(ClientUploadTest, LinksAndDirectoriesReachTheDaemon) {
+  _daemon.start();
+  const auto client = makeClient();
+  const auto link = _directory / "link";
+  std::filesystem::create_symlink(_directory.write("log", "text"), link);
+  EXPECT_TRUE(upload(*client, link));
+  EXPECT_EQ(_daemon.calls().back().arguments[2], PropertyValue(true)) << "a descriptor came along";
+  EXPECT_TRUE(upload(*client, _directory.path()));
+  EXPECT_EQ(_daemon.calls().back().arguments[2], PropertyValue(true)) << "a descriptor came along";
+}
+
+TEST_F(ClientUploadTest, HoldsSoManyFilesAndNoMore) {
+  _daemon.start();
+  _daemon.holdCalls(true);
+  const auto client = makeClient();
+  const auto path = _directory.write("log", "text");
+  auto answered = std::make_shared<Semaphore>();
+  for (int number = 0; number < 64; ++number) {
+    EXPECT_TRUE(client->uploadFileWithURL(path, [answered](bool, const auto&) { answered->signal(); }));
+  }
+  EXPECT_FALSE(client->uploadFileWithURL(path, nullptr));
+  EXPECT_EQ(_log.count("uploadFileWithURL: Failed to get sandbox extension for path " + path + ", errno 24"), 1);
+  _daemon.holdCalls(false);
+  for (int number = 0; number < 64; ++number) EXPECT_TRUE(answered->waitFor(kPatience));
+  EXPECT_TRUE(upload(*client, path)) << "answered files are let go";
 }
 
 TEST_F(VelkReportingTest, AggregationBlockGetsEventsInOrder) {

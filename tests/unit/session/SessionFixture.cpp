@@ -67,8 +67,9 @@ std::optional<std::string> FakeBackend::flushMessagesWithCompletion(BackendFlush
   return std::nullopt;
 }
 
-bool FakeBackend::uploadFileAtPath(const std::string& path, const std::string& extensionToken) {
-  journal.note(formatText("upload %@ %@ %@", {name(), path, extensionToken}));
+bool FakeBackend::uploadFileAtPath(FileUpload& upload) {
+  journal.note(formatText("upload %@ %@ %@", {name(), upload.path, upload.extensionToken}));
+  if (deliversUploads) upload.isDelivered = true;
   return takesUploads;
 }
 

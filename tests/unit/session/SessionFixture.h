@@ -91,7 +91,7 @@ class FakeBackend : public VelkReportingBackend {
                                                     std::uint16_t respCode, std::uint16_t eventID,
                                                     std::uint32_t flag) override;
   std::optional<std::string> flushMessagesWithCompletion(BackendFlushCompletion completion) override;
-  [[nodiscard]] bool uploadFileAtPath(const std::string& path, const std::string& extensionToken) override;
+  [[nodiscard]] bool uploadFileAtPath(FileUpload& upload) override;
   [[nodiscard]] bool uploadLogData(const PropertyArray& logData) override;
   [[nodiscard]] std::uint64_t batchedEventsSize() const override { return batchedSize; }
   [[nodiscard]] std::uint64_t batchedEventsCount() const override { return batchedCount; }
@@ -122,6 +122,7 @@ class FakeBackend : public VelkReportingBackend {
   int stateUpdates = 0;
   bool isPost = false;
   bool takesUploads = false;
+  bool deliversUploads = false;
 };
 
 /// The agent. Tables and answers are the test's.

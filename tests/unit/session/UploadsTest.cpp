@@ -1,4 +1,5 @@
 #include "session/FileUrl.h"
+#include "session/UploadQueue.h"
 #include "tests/unit/session/SessionFixture.h"
 
 namespace velk::test {
@@ -15,7 +16,11 @@ class UploadsTest : public SessionTest {
   }
   std::optional<bool> uploadFile(const std::string& url) {
     std::optional<bool> answer;
-    session->uploadFileAtPath(url, "token", FileDescriptor(), [&](bool success) { answer = success; });
+    session->uploadFileAtPath(url, "token", FileDescriptor(), [&](bool success, bool isDelivered) {
+      answer = success;
+      delivered = isDelivered;
+    });
+    fakes.scheduler.runUntilIdle();
     return answer;
   }
   std::optional<bool> uploadLog(const PropertyArray& logData) {
@@ -24,6 +29,7 @@ class UploadsTest : public SessionTest {
       answer = success;
       EXPECT_FALSE(error.has_value());
     });
+    fakes.scheduler.runUntilIdle();
     return answer;
   }
   void offer(const std::vector<std::pair<std::string, std::optional<std::string>>>& urls) {
@@ -37,6 +43,14 @@ class UploadsTest : public SessionTest {
     start(names);
     prepareBackend = nullptr;
   }
+  /// Two uploads are under way: one file and one array, whose answers are counted.
+  void leaveTwoUploadsBehind() {
+    session->uploadFileAtPath("file:///tmp/a", "token", FileDescriptor(), [&](bool, bool) { ++answers; });
+    session->uploadLogData(numbers({1}), [&](bool, std::optional<Error>) { ++answers; });
+  }
+
+  bool delivered = false;
+  int answers = 0;
 };
 
 TEST_F(UploadsTest, DisplayURLIsNotAvailableWithoutBackends) {
@@ -75,6 +89,67 @@ TEST_F(UploadsTest, EveryBackendIsOfferedTheFile) {
   EXPECT_EQ(recordedLog.count(log::Level::standard, "uploadFileWithURL: File upload successful for /tmp/a b"), 1);
   EXPECT_EQ(messageLog.journal.entries(),
             std::vector<std::string>{"[uploadFileWithURL] Upload succeeded for file file:///tmp/a%20b"});
+}
+
+TEST_F(UploadsTest, OnlyAFileThatAServerHasIsSaidToBeDelivered) {
+  prepareBackend = [](FakeBackend& each) { each.takesUploads = each.deliversUploads = each.name() == "splunk"; };
+  start({"splunk", "korrin"});
+  EXPECT_EQ(uploadFile("file:///tmp/a"), true);
+  EXPECT_TRUE(delivered) << "whoever else was asked afterwards";
+  backend("splunk").deliversUploads = false;
+  EXPECT_EQ(uploadFile("file:///tmp/a"), true);
+  EXPECT_FALSE(delivered);
+}
+
+TEST_F(UploadsTest, OtherCallsGoOnMeanwhile) {
+  prepareBackend = [](FakeBackend& each) { each.takesUploads = true; };
+  start({"splunk"});
+  leaveTwoUploadsBehind();
+  EXPECT_EQ(send(message(3, 4)), std::nullopt);
+  EXPECT_EQ(displayURL(), "URL not available");
+  EXPECT_EQ(answers, 0);
+  EXPECT_EQ(journal.entries(), std::vector<std::string>{"send splunk 3/4"});
+  fakes.scheduler.runUntilIdle();
+  EXPECT_EQ(answers, 2);
+  EXPECT_EQ(journal.entries(),
+            (std::vector<std::string>{"send splunk 3/4", "upload splunk /tmp/a token", "logData splunk 1"}));
+}
+
+TEST_F(UploadsTest, MoreThanItTakesIsRefusedAtOnce) {
+  prepareBackend = [](FakeBackend& each) { each.takesUploads = true; };
+  start({"splunk"});
+  for (std::size_t number = 0; number < UploadQueue::kMaximumUploads; number += 2) leaveTwoUploadsBehind();
+  std::vector<bool> refused;
+  session->uploadFileAtPath("file:///tmp/b", "token", FileDescriptor(),
+                            [&](bool taken, bool isDelivered) { refused.push_back(taken || isDelivered); });
+  session->uploadLogData(numbers({1}), [&](bool taken, std::optional<Error>) { refused.push_back(taken); });
+  EXPECT_EQ(refused, (std::vector<bool>{false, false}));
+  EXPECT_EQ(recordedLog.count(log::Level::error, "uploadFileWithURL: File upload failed for /tmp/b"), 1);
+  EXPECT_EQ(recordedLog.count("uploadFileAtPath: session 7 has 16 uploads under way and takes no more"), 2);
+  fakes.scheduler.runUntilIdle();
+  EXPECT_EQ(answers, static_cast<int>(UploadQueue::kMaximumUploads));
+  EXPECT_EQ(uploadFile("file:///tmp/b"), true) << "there is room again";
+}
+
+TEST_F(UploadsTest, SessionThatEndsKeepsItsTransportForWhatItLeavesBehind) {
+  prepareBackend = [](FakeBackend& each) { each.takesUploads = true; };
+  start({"splunk"}, {}, userNamed("Media", "Calls"));
+  leaveTwoUploadsBehind();
+  journal.clear();
+  session->teardown();
+  const auto atOnce = journal.entries();
+  EXPECT_EQ(journal.count("send splunk 0/1") + journal.count("flush splunk"), 2) << "said goodbye at once";
+  EXPECT_EQ(journal.count("cleanup splunk"), 0);
+  EXPECT_TRUE(session->userInfo().has_value());
+  fakes.scheduler.runUntilIdle();
+  EXPECT_EQ(answers, 2);
+  const auto all = journal.entries();
+  const std::vector<std::string> after(all.begin() + static_cast<std::ptrdiff_t>(atOnce.size()), all.end());
+  ASSERT_GE(after.size(), 3U);
+  EXPECT_EQ(after[0], "upload splunk /tmp/a token");
+  EXPECT_EQ(after[1], "logData splunk 1");
+  EXPECT_EQ(after.back(), "cleanup splunk");
+  EXPECT_FALSE(session->userInfo().has_value());
 }
 
 TEST_F(UploadsTest, FileThatNobodyTakesFails) {

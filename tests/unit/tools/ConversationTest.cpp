@@ -3,6 +3,7 @@
 #include <gtest/gtest.h>
 
 #include <cmath>
+#include <filesystem>
 #include <sstream>
 
 #include "tests/support/TemporaryDirectory.h"
@@ -128,6 +129,28 @@ TEST_F(ConversationTest, SendsADescriptorAndATokenWithAnUpload) {
   EXPECT_GE(wire.calls[0].arguments[1].data()->size(), 16u);
   wire.calls[0].reply(PropertyArray{true});
   EXPECT_NE(printed.str().find("\"reply\":[true]"), std::string::npos);
+}
+
+TEST_F(ConversationTest, RemovesAFileThatAServerHas) {
+  const test::TemporaryDirectory directory;
+  const std::string kept = directory.write("kept", "text");
+  const std::string delivered = directory.write("delivered", "text");
+  const std::string replaced = directory.write("replaced", "text");
+  for (const auto& path : {kept, delivered, replaced}) {
+    (void)take("{\"method\":\"uploadFileAtPath\",\"path\":\"" + path + "\"}");
+  }
+  std::filesystem::remove(replaced);
+  (void)directory.write("replaced", "another one");
+  wire.calls[0].reply(PropertyArray{true, false});
+  wire.calls[1].reply(PropertyArray{true, true});
+  wire.calls[2].reply(PropertyArray{true, true});
+  EXPECT_TRUE(std::filesystem::exists(kept));
+  EXPECT_FALSE(std::filesystem::exists(delivered));
+  EXPECT_EQ(directory.read("replaced"), "another one");
+  EXPECT_EQ(printed.str(),
+            "{\"method\":\"uploadFileAtPath\",\"line\":1,\"reply\":[true]}\n"
+            "{\"method\":\"uploadFileAtPath\",\"line\":2,\"reply\":[true]}\n"
+            "{\"method\":\"uploadFileAtPath\",\"line\":3,\"reply\":[true]}\n");
 }
 
 TEST_F(ConversationTest, ComplainsOfAFileThatIsNotThere) {

@@ -1,0 +1,51 @@
+// What a session uploads: one file or array after the other, beside the session's other calls, since each may take as
+// long as a server likes. Owned by its session; its queue is made with the first upload.
+#pragma once
+
+#include <atomic>
+#include <cstddef>
+#include <memory>
+#include <utility>
+
+#include "platform/Queue.h"
+
+namespace velk {
+
+/// Used on the session's queue alone. What it has taken runs to its end, whether or not the session still lives.
+class UploadQueue {
+ public:
+  /// Uploads that are under way or wait. A client with more of them has to wait for its answers first: each may hold a
+  /// descriptor, or a megabyte of log data.
+  static constexpr std::size_t kMaximumUploads = 16;
+
+  explicit UploadQueue(Scheduler& scheduler) : _scheduler(scheduler) {}
+
+  [[nodiscard]] bool isFull() const { return _underWay->load() >= kMaximumUploads; }
+
+  /// Runs the upload behind those that were taken before.
+  template <class Upload>
+  void run(Upload upload) {
+    if (!_queue) _queue = _scheduler.makeSerialQueue("com.tavrin.velkreportingd.uploads");
+    ++*_underWay;
+    // Run or dropped, it leaves once.
+    std::shared_ptr<void> place(nullptr, [underWay = _underWay](void*) { --*underWay; });
+    _queue->async([upload = std::move(upload), place = std::move(place)]() mutable { upload(); });
+  }
+
+  /// Runs the work when all uploads have ended: at once if there are none.
+  template <class Work>
+  void runBehindUploads(Work work) {
+    if (_underWay->load() == 0) {
+      work();
+    } else {
+      _queue->async(std::move(work));
+    }
+  }
+
+ private:
+  Scheduler& _scheduler;
+  std::shared_ptr<Queue> _queue;
+  const std::shared_ptr<std::atomic<std::size_t>> _underWay = std::make_shared<std::atomic<std::size_t>>(0);
+};
+
+}  // namespace velk
