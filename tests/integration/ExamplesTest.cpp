@@ -29,11 +29,12 @@ class Examples : public ::testing::Test {
 };
 
 TEST_F(Examples, ReportAnEvent) {
+  std::size_t expected = 0;
   for (const auto& [program, language] : {std::pair("report_event_c", "C"), std::pair("report_event_cpp", "C++")}) {
     const Finished finished = runExample(program);
     EXPECT_EQ(finished.status, 0) << finished.errors;
+    ASSERT_TRUE(server.waitForEvents(++expected, {101})) << program;
     const auto events = eventsOf(server, 101);
-    ASSERT_FALSE(events.empty()) << program;
     EXPECT_EQ(integerValue(events.back().find("answer")), 42);
     EXPECT_EQ(*events.back().string("language"), language);
   }
@@ -46,8 +47,8 @@ TEST_F(Examples, ReportAnEventFromPython) {
   const Finished finished =
       run({"/usr/bin/python3", VELK_PYTHON_EXAMPLE, "9"}, {{"VELKREPORTING_LIBRARY", VELK_CLIENT_LIBRARY}});
   EXPECT_EQ(finished.status, 0) << finished.errors;
+  ASSERT_TRUE(server.waitForEvents(1, {101}));
   const auto events = eventsOf(server, 101);
-  ASSERT_EQ(events.size(), 1U);
   EXPECT_EQ(*events[0].string("language"), "Python");
 #endif
 }
