@@ -5,37 +5,17 @@
 
 #include <random>
 
+#include "tests/integration/HandWrittenCalls.h"
 #include "tests/integration/RawConnection.h"
 #include "tests/integration/Scenario.h"
 
 namespace velk::test {
 namespace {
 
+using namespace cbor;
 using std::string_literals::operator""s;
 
 const PropertyValue kSplunk = PropertyArray{"splunk"};
-
-// CBOR, by hand.
-std::string head(unsigned major, std::uint64_t value) {
-  const auto first = static_cast<unsigned char>(major << 5);
-  if (value < 24) return {static_cast<char>(first | value)};
-  std::string bytes{static_cast<char>(first | 27U)};
-  for (int i = 7; i >= 0; --i) bytes.push_back(static_cast<char>(value >> (8 * i)));
-  return bytes;
-}
-std::string number(std::uint64_t value) { return head(0, value); }
-std::string text(std::string_view value) { return head(3, value.size()).append(value); }
-std::string list(const std::vector<std::string>& values) {
-  std::string bytes = head(4, values.size());
-  for (const auto& value : values) bytes += value;
-  return bytes;
-}
-const std::string kNull = "\xf6";
-const std::string kEmptyMap = "\xa0";
-
-std::string call(std::uint64_t serial, const std::vector<std::string>& values) {
-  return RawConnection::frame(FrameKind::call, serial, list(values));
-}
 
 /// A daemon beside whose hostile clients one honest session lives.
 class HostileClient : public testing::Test {

@@ -1,6 +1,8 @@
 #include "tests/integration/RawConnection.h"
 
+#include <linux/sockios.h>
 #include <poll.h>
+#include <sys/ioctl.h>
 #include <sys/socket.h>
 #include <sys/un.h>
 
@@ -49,6 +51,29 @@ bool RawConnection::send(std::string_view bytes) {
     bytes.remove_prefix(static_cast<std::size_t>(count));
   }
   return true;
+}
+
+bool RawConnection::sendWith(std::string_view bytes, const std::vector<int>& descriptors) {
+  const std::size_t size = descriptors.size() * sizeof(int);
+  std::vector<char> control(CMSG_SPACE(size));
+  iovec part{const_cast<char*>(bytes.data()), bytes.size()};
+  msghdr message{};
+  message.msg_iov = &part;
+  message.msg_iovlen = 1;
+  message.msg_control = control.data();
+  message.msg_controllen = control.size();
+  cmsghdr* const header = CMSG_FIRSTHDR(&message);
+  header->cmsg_level = SOL_SOCKET;
+  header->cmsg_type = SCM_RIGHTS;
+  header->cmsg_len = CMSG_LEN(size);
+  std::memcpy(CMSG_DATA(header), descriptors.data(), size);
+  const ssize_t count = ::sendmsg(_socket.get(), &message, MSG_NOSIGNAL);
+  return count > 0 && send(bytes.substr(static_cast<std::size_t>(count)));
+}
+
+int RawConnection::bytesUntaken() const {
+  int bytes = 0;
+  return ::ioctl(_socket.get(), SIOCOUTQ, &bytes) == 0 ? bytes : -1;
 }
 
 std::size_t RawConnection::sendWhatFits(std::string_view bytes, std::chrono::milliseconds patience) {

@@ -5,6 +5,7 @@
 #include <optional>
 #include <string>
 #include <string_view>
+#include <vector>
 
 #include "platform/FileDescriptor.h"
 #include "tests/integration/Daemon.h"
@@ -33,6 +34,10 @@ class RawConnection {
                                          std::uint16_t descriptors = 0);
   /// False when the daemon has closed the connection. Blocks while the daemon does not read.
   bool send(std::string_view bytes);
+  /// The same with descriptors riding along with the first byte. They stay the caller's.
+  bool sendWith(std::string_view bytes, const std::vector<int>& descriptors);
+  /// Sent, and not yet taken from the socket by the daemon: bytes as the system counts them.
+  [[nodiscard]] int bytesUntaken() const;
   /// As much as fits within the time; the number of bytes.
   std::size_t sendWhatFits(std::string_view bytes, std::chrono::milliseconds patience);
   /// The next frame that the daemon sends; nothing when it closes the connection first or none comes in time.
