@@ -89,6 +89,13 @@ void Announcer::post(std::int64_t number, const std::string& path, const Receive
   _lines.writeText(lines);
 }
 
+void Announcer::upload(std::int64_t number, const std::string& name, std::uint64_t fileBytes, std::uint64_t wireBytes) {
+  if (_quiet) return;
+  say({{"event", "upload"}, {"upload", number}, {"name", name}, {"bytes", fileBytes}, {"wireBytes", wireBytes}},
+      "Upload " + std::to_string(number) + ": " + withoutControlCharacters(name) + ", " + count(fileBytes, "byte") +
+          " (" + std::to_string(wireBytes) + " on the wire)");
+}
+
 void Announcer::refused(const std::string& path, int status, const std::string& reason) {
   say({{"event", "refused"}, {"path", path}, {"status", status}, {"reason", reason}},
       "Refused a post to " + withoutControlCharacters(path) + " with " + std::to_string(status) + ": " +

@@ -32,6 +32,7 @@ class Announcer {
   void listening(const std::string& url, int port, const std::string& caPath, const std::string& databasePath,
                  std::optional<int> dashboardPort = std::nullopt);
   void post(std::int64_t number, const std::string& path, const ReceivedPost& post, bool digestChecked);
+  void upload(std::int64_t number, const std::string& name, std::uint64_t fileBytes, std::uint64_t wireBytes);
   /// A post that was not taken, and the sentence that its sender was told.
   void refused(const std::string& path, int status, const std::string& reason);
   void storebag(const std::string& name, int status);

@@ -39,13 +39,24 @@ void send(const Answer& answer, httplib::Response& response) {
 }
 
 // The library would unpack gzip without a bound; it leaves encodings alone that it does not see.
-httplib::Server::HandlerResponse hideContentEncoding(const httplib::Request& request, httplib::Response&) {
+void hideContentEncoding(const httplib::Request& request) {
   auto& headers = const_cast<httplib::Request&>(request).headers;
   const auto encoding = headers.find("Content-Encoding");
   if (encoding != headers.end()) {
     headers.emplace(kPackedMark, encoding->second);
     headers.erase("Content-Encoding");
   }
+}
+
+// The library would read a body into memory for which there is no route, and one may be as large as an upload.
+httplib::Server::HandlerResponse beforeRouting(const httplib::Request& request, httplib::Response& response) {
+  const bool isKnown = request.method == "GET" || request.method == "HEAD" || request.method == "POST";
+  if (!isKnown || request.path.empty() || request.path.front() != '/') {
+    response.status = isKnown ? 400 : 405;
+    response.set_header("Connection", "close");
+    return httplib::Server::HandlerResponse::Handled;
+  }
+  hideContentEncoding(request);
   return httplib::Server::HandlerResponse::Unhandled;
 }
 
@@ -57,8 +68,12 @@ void setSocketOptions(int socket) {
 
 class Server final : public HttpsServer {
  public:
-  Server(Collector& collector, Dashboard& dashboard, const std::string& certificatePath, const std::string& keyPath)
-      : _collector(collector), _dashboard(dashboard), _server(certificatePath.c_str(), keyPath.c_str()) {}
+  Server(Collector& collector, Dashboard& dashboard, Uploads& uploads, const std::string& certificatePath,
+         const std::string& keyPath)
+      : _collector(collector),
+        _dashboard(dashboard),
+        _uploads(uploads),
+        _server(certificatePath.c_str(), keyPath.c_str()) {}
 
   [[nodiscard]] bool isUsable() const { return _server.is_valid(); }
 
@@ -72,8 +87,8 @@ class Server final : public HttpsServer {
     _server.set_keep_alive_timeout(kKeepAliveSeconds);
     _server.set_read_timeout(kTransferTimeoutSeconds);
     _server.set_write_timeout(kTransferTimeoutSeconds);
-    _server.set_payload_max_length(PostBounds{}.wireBytes);
-    _server.set_pre_routing_handler(&hideContentEncoding);
+    _server.set_payload_max_length(kMaximumUploadBytes);
+    _server.set_pre_routing_handler(&beforeRouting);
     addRoutes();
   }
 
@@ -114,6 +129,8 @@ class Server final : public HttpsServer {
       takeBody(request, response, reader,
                [&](const std::string& wire) { return _dashboard.postLogData(headersOf(request), wire); });
     });
+    _server.Post("/upload", [this](const httplib::Request& request, httplib::Response& response,
+                                   const httplib::ContentReader& reader) { takeUpload(request, response, reader); });
     _server.Post("/.*", [this](const httplib::Request& request, httplib::Response& response,
                                const httplib::ContentReader& reader) { takePost(request, response, reader); });
   }
@@ -121,6 +138,13 @@ class Server final : public HttpsServer {
   void takePost(const httplib::Request& request, httplib::Response& response, const httplib::ContentReader& reader) {
     takeBody(request, response, reader,
              [&](const std::string& wire) { return _collector.post(request.path, headersOf(request), wire); });
+  }
+
+  void takeUpload(const httplib::Request& request, httplib::Response& response, const httplib::ContentReader& reader) {
+    const auto upload = _uploads.begin();
+    const bool whole = reader([&](const char* bytes, std::size_t count) { return upload->take({bytes, count}); });
+    send(_uploads.end(*upload, whole, request.target), response);
+    if (!whole) response.set_header("Connection", "close");
   }
 
   template <class Take>
@@ -138,6 +162,7 @@ class Server final : public HttpsServer {
 
   Collector& _collector;
   Dashboard& _dashboard;
+  Uploads& _uploads;
   TlsConnections _connections;
   httplib::SSLServer _server;
   std::atomic<bool> _ended = false;
@@ -145,9 +170,9 @@ class Server final : public HttpsServer {
 
 }  // namespace
 
-Result<std::unique_ptr<HttpsServer>> HttpsServer::make(Collector& collector, Dashboard& dashboard,
+Result<std::unique_ptr<HttpsServer>> HttpsServer::make(Collector& collector, Dashboard& dashboard, Uploads& uploads,
                                                        const std::string& certificatePath, const std::string& keyPath) {
-  auto server = std::make_unique<Server>(collector, dashboard, certificatePath, keyPath);
+  auto server = std::make_unique<Server>(collector, dashboard, uploads, certificatePath, keyPath);
   if (!server->isUsable()) {
     return failure("collector", 2,
                    "cannot use the certificate " + certificatePath + " with the key " + keyPath +

@@ -7,6 +7,7 @@
 #include "foundation/Error.h"
 #include "tools/collector/Collector.h"
 #include "tools/collector/Dashboard.h"
+#include "tools/collector/Uploads.h"
 
 namespace velk::collector {
 
@@ -14,13 +15,14 @@ namespace velk::collector {
 ///   GET  /storebags/vindle/NAME, /bags/vindle/NAME   the signed envelope
 ///   GET  /stats                                      counts
 ///   POST /logdata, GET /logdata/NUMBER               log data of sessions
+///   POST /upload                                     a file, as the upload backend sends it
 ///   POST anything                                    an event post
 class HttpsServer {
  public:
-  /// The certificate's chain and its key in PEM. Fails when they cannot be used. `collector` and `dashboard` outlive
+  /// The certificate's chain and its key in PEM. Fails when they cannot be used. The others outlive
   /// the server.
   [[nodiscard]] static Result<std::unique_ptr<HttpsServer>> make(Collector& collector, Dashboard& dashboard,
-                                                                 const std::string& certificatePath,
+                                                                 Uploads& uploads, const std::string& certificatePath,
                                                                  const std::string& keyPath);
   virtual ~HttpsServer() = default;
 

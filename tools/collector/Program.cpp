@@ -15,6 +15,8 @@
 #include "tools/collector/HttpsServer.h"
 #include "tools/collector/PostStore.h"
 #include "tools/collector/TestCertificates.h"
+#include "tools/collector/UploadStore.h"
+#include "tools/collector/Uploads.h"
 
 namespace velk::collector {
 namespace {
@@ -50,6 +52,11 @@ Result<std::unique_ptr<PostStore>> openStore(const CollectorOptions& options) {
 Result<std::unique_ptr<DashboardStore>> openDashboardStore(const CollectorOptions& options) {
   if (options.sink) return std::unique_ptr<DashboardStore>();
   return DashboardStore::open(options.stateDirectory + "/dashboard.sqlite");
+}
+
+Result<std::unique_ptr<UploadStore>> openUploadStore(const CollectorOptions& options) {
+  if (options.sink) return std::unique_ptr<UploadStore>();
+  return UploadStore::open(options.stateDirectory);
 }
 
 /// Null when none is asked for.
@@ -104,7 +111,10 @@ ExitCode run(std::vector<std::string> arguments, std::ostream& out, std::ostream
   const auto dashboardStore = openDashboardStore(options);
   if (!dashboardStore) return fail(error, ExitCode::cannotCreate, dashboardStore.error().description);
   Dashboard dashboard(dashboardStore->get(), announcer, systemClock());
-  auto server = HttpsServer::make(collector, dashboard, names->serverPath, names->serverKeyPath);
+  const auto uploadStore = openUploadStore(options);
+  if (!uploadStore) return fail(error, ExitCode::cannotCreate, uploadStore.error().description);
+  Uploads uploads(options, uploadStore->get(), announcer, systemClock());
+  auto server = HttpsServer::make(collector, dashboard, uploads, names->serverPath, names->serverKeyPath);
   if (!server) return fail(error, ExitCode::configuration, server.error().description);
   const Result<int> port = (*server)->bind(options.listenAddress, options.port);
   if (!port) return fail(error, ExitCode::unavailable, port.error().description);
