@@ -17,7 +17,8 @@ class SystemClock final : public Clock {
 }  // namespace
 
 Clock& systemClock() {
-  static SystemClock clock;
+  // Never destroyed: threads and exit handlers ask it to the very end of the process.
+  static SystemClock& clock = *new SystemClock;
   return clock;
 }
 
