@@ -7,7 +7,8 @@
 //
 // Any thread may call any operation. Callbacks run on threads of the library that are there only while they are needed;
 // a callback may take its time and may wait for another one. Message texts and aggregated events arrive in order, one
-// at a time; answers to different calls may arrive at the same time.
+// at a time; answers to different calls may arrive at the same time. A callback that throws ends the process, except
+// where it says otherwise.
 //
 // When the last reference goes, what was handed over is sent, the session is finished, and the connection is closed.
 #pragma once
