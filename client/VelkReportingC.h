@@ -241,10 +241,10 @@ VELK_EXPORT void VelkReportingUpdateSharedDataForKey(VelkReportingClient* client
 /* Uploads log data, an array of dictionaries. True: handed over. False for an empty array and for no array. */
 VELK_EXPORT bool VelkReportingUploadLogWithArray(VelkReportingClient* client, const VelkReportingValue* logData);
 typedef void (*VelkReportingUploadCallback)(bool uploaded, void* context);
-/* Uploads a file (a path or a file URL): opened here, with the caller's rights, without following links. When the server
- * says that it has the file, it is removed, unless another one has taken its name. True: handed over, and the callback
- * hears whether an upload was attempted, unless the daemon went away meanwhile. False when the file cannot be opened,
- * and while 64 files of this client wait for their answers. */
+/* Uploads a file (a path or a file URL): opened here, with the caller's rights, without following links. When the
+ * server says that it has the file, it is removed, unless another one has taken its name. True: handed over, and the
+ * callback hears whether an upload was attempted, unless the daemon went away meanwhile. False when the file cannot be
+ * opened, and while 64 files of this client wait for their answers. */
 VELK_EXPORT bool VelkReportingClientUploadFile(VelkReportingClient* client, const char* path,
                                                VelkReportingUploadCallback callback, void* context,
                                                VelkReportingDestroyFunction destroy);
