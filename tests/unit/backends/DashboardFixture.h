@@ -5,6 +5,7 @@
 #include <algorithm>
 #include <memory>
 #include <string>
+#include <vector>
 
 #include "backends/DashboardBackend.h"
 #include "tests/unit/backends/BackendFixture.h"
@@ -45,6 +46,15 @@ class DashboardTest : public BackendTest {
  protected:
   using Record = FakeUdpSockets::Record;
 
+  /// Handlers own a backend until it has cleaned up, pending datagrams included.
+  ~DashboardTest() override {
+    fakes.udpSockets.sendError = 0;
+    for (const auto& backend : _made) {
+      if (const auto alive = backend.lock()) alive->cleanup();
+    }
+    tick(40);
+  }
+
   /// A section with an address; `more` is added.
   [[nodiscard]] static PropertyDictionary section(const PropertyDictionary& more = {}) {
     PropertyDictionary result{{"ip", "192.0.2.7"}, {"port", 9000}};
@@ -60,8 +70,9 @@ class DashboardTest : public BackendTest {
     return makeWith(section({{"reliable", period}}));
   }
 
-  [[nodiscard]] static std::shared_ptr<DashboardBackend> described(std::shared_ptr<DashboardBackend> backend) {
+  [[nodiscard]] std::shared_ptr<DashboardBackend> described(std::shared_ptr<DashboardBackend> backend) {
     if (!backend) return nullptr;
+    _made.push_back(backend);
     backend->setSelfVersion("8.1.2");
     backend->setCompType(20);
     backend->setSessionID(4242);
@@ -98,6 +109,9 @@ class DashboardTest : public BackendTest {
                       [eventNumber](const ByteData& bytes) { return Datagram(bytes).eventNumber == eventNumber; }));
   }
   [[nodiscard]] bool isTimerArmed() const { return fakes.scheduler.pendingDeadlines() > 0; }
+
+ private:
+  std::vector<std::weak_ptr<DashboardBackend>> _made;
 };
 
 }  // namespace velk::test
