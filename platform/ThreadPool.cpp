@@ -31,7 +31,8 @@ class PoolCore final : public QueueRunner, public BlockingObserver {
                                                     : std::max(2u, std::thread::hardware_concurrency())),
         _maximumThreads(std::max<std::size_t>(options.maximumThreads, 1)),
         _maximumWhenBlocked(_maximumThreads + options.emergencyThreads),
-        _idleThreadLifetime(options.idleThreadLifetime) {}
+        _idleThreadLifetime(options.idleThreadLifetime),
+        _isNeverStopped(options.isNeverStopped) {}
 
   bool schedule(std::shared_ptr<SerialQueueCore> queue) override;
   bool yield(const std::shared_ptr<SerialQueueCore>& queue) override;
@@ -62,6 +63,7 @@ class PoolCore final : public QueueRunner, public BlockingObserver {
   const std::size_t _maximumThreads;
   const std::size_t _maximumWhenBlocked;
   const Duration _idleThreadLifetime;
+  const bool _isNeverStopped;
 
   // Guarded by _lock, under which nobody is called.
   mutable Lock _lock;
@@ -206,7 +208,11 @@ void PoolCore::endThread() {
     });
     if (self == _threads.end()) return;  // `stop` has it, or will.
     ended.swap(_ended);
-    _ended.push_back(std::move(*self));
+    if (_isNeverStopped) {
+      self->detach();
+    } else {
+      _ended.push_back(std::move(*self));
+    }
     _threads.erase(self);
   }
   for (auto& thread : ended) thread.join();

@@ -19,6 +19,8 @@ struct ThreadPoolOptions {
   std::size_t emergencyThreads = 0;
   /// A thread without work for this long ends.
   Duration idleThreadLifetime = std::chrono::seconds(5);
+  /// Nobody will stop the pool: a thread that ends leaves nothing behind that `stop` would wait for.
+  bool isNeverStopped = false;
 };
 
 /// Starts no thread before there is work. `stop` runs what was handed over, drops delayed work, joins all threads;
