@@ -14,6 +14,7 @@ ThreadPoolOptions callbackThreads() {
   options.runningThreads = 64;
   options.maximumThreads = 64;
   options.idleThreadLifetime = std::chrono::seconds(2);
+  options.isNeverStopped = true;
   return options;
 }
 
