@@ -39,7 +39,7 @@ class RecordingSession final : public ClientSessionInterface {
   void finishSessionGracefully() override { asked.append("finish"); }
   void uploadFileAtPath(std::string url, std::string token, FileDescriptor file, UploadReply reply) override {
     asked.append(PropertyArray{"uploadFile", url, token, static_cast<bool>(file)});
-    reply(true);
+    reply(true, false);
   }
   void uploadLogData(PropertyArray logData, LogDataReply reply) override {
     asked.append(PropertyArray{"uploadLogData", std::move(logData)});
@@ -168,8 +168,9 @@ TEST_F(SessionProxiesTest, CarriesTheRepliesBack) {
     ++answers;
   });
   calls.uploadFileAtPath("file:///x", std::string("to\0ken", 6), FileDescriptor(::open("/dev/null", O_RDONLY)),
-                         [&](bool success) {
-                           EXPECT_TRUE(success);
+                         [&](bool taken, bool delivered) {
+                           EXPECT_TRUE(taken);
+                           EXPECT_FALSE(delivered);
                            ++answers;
                          });
   calls.copyStatus([&](PropertyDictionary status) {
