@@ -2,11 +2,12 @@
 // that was forked from their process: its copies of their locks may be held by threads that it does not have.
 #pragma once
 
+#include <atomic>
 #include <cstdint>
 
 namespace velk {
 
-/// Grows by one in every forked child. Cheap enough for every call: no system call after the first.
+/// Grows in every forked child. Cheap enough for every call: no system call after the first.
 [[nodiscard]] std::uint64_t processGeneration() noexcept;
 
 /// Remembers the process that made it. Any thread; takes no lock.
@@ -18,6 +19,38 @@ class ForkGuard {
 
  private:
   const std::uint64_t _generation;
+};
+
+/// What each process has one of, made at first use and never destroyed: threads may use it while the process ends. A
+/// forked child gets a new one of its own, since the locks of its parent's may be held by threads that it does not
+/// have. Constant initialisation: for objects of static storage. Any thread; takes no lock.
+template <class Object>
+class PerProcess {
+ public:
+  /// `Make` answers a new object; it may be called in vain, when another thread is quicker.
+  template <class Make>
+  [[nodiscard]] Object& get(Make make) {
+    if (Object* const object = existing()) return *object;
+    Made* former = _made.load(std::memory_order_acquire);
+    auto* const fresh = new Made{processGeneration(), make()};
+    if (_made.compare_exchange_strong(former, fresh, std::memory_order_acq_rel)) return *fresh->object;
+    delete fresh->object;
+    delete fresh;
+    return *former->object;
+  }
+
+  /// This process's own, or null.
+  [[nodiscard]] Object* existing() const noexcept {
+    const Made* const made = _made.load(std::memory_order_acquire);
+    return made != nullptr && made->generation == processGeneration() ? made->object : nullptr;
+  }
+
+ private:
+  struct Made {
+    std::uint64_t generation;
+    Object* object;
+  };
+  std::atomic<Made*> _made{nullptr};
 };
 
 }  // namespace velk

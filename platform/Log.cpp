@@ -2,6 +2,7 @@
 
 #include <utility>
 
+#include "platform/Fork.h"
 #include "platform/Lock.h"
 
 namespace velk::log {
@@ -15,10 +16,10 @@ struct Current {
   bool wasSet VELK_GUARDED_BY(lock) = false;
 };
 
-/// Never destroyed: threads may log while the process ends.
+/// In a forked child there is no sink until it sets its own: the parent's may be in use by threads that are not there.
+constinit PerProcess<Current> currents;
 Current& current() {
-  static auto* const instance = new Current;
-  return *instance;
+  return currents.get([] { return new Current; });
 }
 
 }  // namespace

@@ -1,6 +1,7 @@
 #include "platform/PersistentIdentifier.h"
 
 #include "foundation/Uuid.h"
+#include "platform/Fork.h"
 #include "platform/Lock.h"
 #include "platform/Log.h"
 #include "platform/LogTexts.h"
@@ -10,7 +11,10 @@ namespace {
 
 // Held while the suite's file is read and written: the two operations that it serialises are rare, and the suite
 // never calls back.
-Lock identifierLock;
+constinit PerProcess<Lock> identifierLocks;
+Lock& identifierLock() {
+  return identifierLocks.get([] { return new Lock; });
+}
 
 std::string_view keyForDNU(bool respectConsent) { return respectConsent ? "uuidRespectDNU" : "uuidOverrideDNU"; }
 
@@ -40,7 +44,7 @@ std::string getPersistentIdentifierForDNU(UserDefaults& defaults, bool respectCo
   const auto key = keyForDNU(respectConsent);
   std::string identifier;
   {
-    Guard guard(identifierLock);
+    Guard guard(identifierLock());
     identifier = persistentIdentifier(defaults, key);
   }
   log::standard(logtexts::kPersistentIdentifierForDNU, key, identifier);
@@ -51,7 +55,7 @@ void regeneratePersistentIdentifierForDNU(UserDefaults& defaults, bool respectCo
   const auto key = keyForDNU(respectConsent);
   const std::string identifier = randomUuidText();
   {
-    Guard guard(identifierLock);
+    Guard guard(identifierLock());
     store(defaults, key, identifier);
   }
   log::standard(logtexts::kRegeneratedPersistentIdentifierForDNU, key, identifier);
