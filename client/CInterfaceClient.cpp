@@ -117,6 +117,11 @@ void VelkReportingClientRelease(VelkReportingClient* client) {
   guardedVoid(__func__, [&] { velk::cinterface::release(client); });
 }
 
+void VelkReportingClientSetEndOfLifeBound(VelkReportingClient* client, uint32_t milliseconds) {
+  if (client == nullptr) return;
+  guardedVoid(__func__, [&] { client->client->setEndOfLifeBound(std::chrono::milliseconds(milliseconds)); });
+}
+
 void VelkReportingFetchStatesWithUserInfo(VelkReportingClient* client, const VelkReportingValue* userInfo,
                                           VelkReportingStatesCallback callback, void* context,
                                           VelkReportingDestroyFunction destroy) {

@@ -1,7 +1,5 @@
 // The services of the class that need no client object: identifiers, hierarchy tokens, one-shot messages.
 
-#include <atomic>
-
 #include "client/ClientRuntime.h"
 #include "client/DaemonConnection.h"
 #include "client/LogTexts.h"
@@ -49,13 +47,13 @@ constexpr int kMaximumOneShots = 256;
 /// Counts one message for as long as its connection is needed.
 class OneShotSlot {
  public:
-  explicit OneShotSlot(std::atomic<int>& underWay) : _underWay(underWay) {}
+  explicit OneShotSlot(ClientRuntime& runtime) : _runtime(runtime) {}
   OneShotSlot(const OneShotSlot&) = delete;
   OneShotSlot& operator=(const OneShotSlot&) = delete;
-  ~OneShotSlot() { _underWay.fetch_sub(1); }
+  ~OneShotSlot() { _runtime.endOneMessage(); }
 
  private:
-  std::atomic<int>& _underWay;
+  ClientRuntime& _runtime;
 };
 
 struct OneMessage {
@@ -102,12 +100,10 @@ bool VelkReporting::sendOneMessageWithSessionInfo(const std::optional<PropertyDi
   if (auto invalid = validateSessionInfo(sessionInfo)) return refuse(std::move(*invalid));
   const std::string domain(kVelkReportingErrorDomain);
   if (category == 0) return refuse({domain, 4, "the category is 0"});
-  auto& underWay = runtime.oneMessagesUnderWay();
-  if (underWay.fetch_add(1) >= kMaximumOneShots) {
-    underWay.fetch_sub(1);
+  if (!runtime.beginOneMessage(kMaximumOneShots)) {
     return refuse({domain, VelkReportingImplementation::kOutboxFull, "too many single messages are under way"});
   }
-  auto slot = std::make_shared<OneShotSlot>(underWay);
+  auto slot = std::make_shared<OneShotSlot>(runtime);
   if (error != nullptr) *error = {};
   OneMessage message{*sessionInfo, userInfo, category, type, payload};
   message.sessionInfo.set(kVelkReportingSessionInfoBatchEvent, false);  // the event must go out at once

@@ -1,5 +1,8 @@
 #include "client/ClientRuntime.h"
 
+#include <algorithm>
+#include <cstdlib>
+
 #include "platform/Directories.h"
 #include "platform/Log.h"
 #include "platform/LogSinks.h"
@@ -18,18 +21,20 @@ ThreadPoolOptions callbackThreads() {
   return options;
 }
 
+constinit PerProcess<ClientRuntime> runtimes;
+
+/// Exit handlers are inherited by forked children: one is enough.
+std::atomic<bool> watchesExit{false};
+
 }  // namespace
 
+/// What is under way when the process exits has no other end: nobody releases it.
+void ClientRuntime::processExits() {
+  if (ClientRuntime* const runtime = runtimes.existing()) runtime->sendBeforeExit();
+}
+
 ClientRuntime& ClientRuntime::shared() {
-  // A lock would be of no use in a forked child, where it may be held by a thread that is not there: the pointer is
-  // exchanged instead, and whoever loses the race throws its own away before it has started a thread.
-  static std::atomic<ClientRuntime*> current{nullptr};
-  ClientRuntime* runtime = current.load(std::memory_order_acquire);
-  if (runtime != nullptr && runtime->_generation == processGeneration()) return *runtime;
-  auto* fresh = new ClientRuntime;
-  if (current.compare_exchange_strong(runtime, fresh, std::memory_order_acq_rel)) return *fresh;
-  delete fresh;
-  return *runtime;
+  return runtimes.get([] { return new ClientRuntime; });
 }
 
 ClientRuntime::ClientRuntime()
@@ -38,6 +43,55 @@ ClientRuntime::ClientRuntime()
       _periodicTaskThreads(makeThreadPool(callbackThreads())),
       _oneMessageQueue(_loop.makeLoopQueue("com.tavrin.VelkReporting.sendOneMessageQueue")) {
   log::setSinkIfNone(log::makeLibrarySink(), log::librarySinkLevel());
+  if (!watchesExit.exchange(true)) static_cast<void>(std::atexit(&ClientRuntime::processExits));
+}
+
+bool ClientRuntime::beginOneMessage(int maximum) {
+  Guard guard(_lock);
+  if (_oneMessagesUnderWay >= maximum) return false;
+  ++_oneMessagesUnderWay;
+  return true;
+}
+
+void ClientRuntime::endOneMessage() {
+  Guard guard(_lock);
+  if (--_oneMessagesUnderWay == 0) _noOneMessage.notifyAll();
+}
+
+bool ClientRuntime::waitForOneMessages(SteadyTime deadline) {
+  Guard guard(_lock);
+  while (_oneMessagesUnderWay != 0) {
+    if (!_noOneMessage.waitUntil(_lock, deadline)) return _oneMessagesUnderWay == 0;
+  }
+  return true;
+}
+
+void ClientRuntime::addClient(std::weak_ptr<LeavingClient> client) {
+  Guard guard(_lock);
+  if (_clients.size() >= _clientsToSweep) {
+    std::erase_if(_clients, [](const auto& other) { return other.expired(); });
+    _clientsToSweep = 2 * _clients.size() + 64;
+  }
+  _clients.push_back(std::move(client));
+}
+
+SteadyTime ClientRuntime::deadlineFor(Duration bound) const {
+  return std::min(_loop.clock().steadyTime(), _exitBegun.load()) + bound;
+}
+
+void ClientRuntime::sendBeforeExit() {
+  if (_loop.isCurrent()) return;  // it would wait for itself
+  const SteadyTime begun = _loop.clock().steadyTime();
+  _exitBegun = begun;
+  std::vector<std::weak_ptr<LeavingClient>> clients;
+  {
+    Guard guard(_lock);
+    clients = _clients;
+  }
+  for (const auto& client : clients) {
+    if (const auto strong = client.lock()) strong->sendBeforeExit(begun);
+  }
+  if (!waitForOneMessages(begun + kEndOfLifeBound)) log::error("sendOneMessageWithSessionInfo: the process ends first");
 }
 
 void ClientRuntime::runCallback(Task callback) {

@@ -7,6 +7,7 @@
 #include <cstdint>
 #include <memory>
 #include <string>
+#include <vector>
 
 #include "platform/EventLoop.h"
 #include "platform/Fork.h"
@@ -16,8 +17,19 @@
 
 namespace velk {
 
+/// Who has something to hand over before the process ends.
+class LeavingClient {
+ public:
+  virtual ~LeavingClient() = default;
+  /// On the thread that ends the process, while all other threads go on; waits within the client's bound after `begun`.
+  virtual void sendBeforeExit(SteadyTime begun) = 0;
+};
+
 class ClientRuntime {
  public:
+  /// How long the end of a client, and that of the process, wait for events to leave, unless the client says otherwise.
+  static constexpr Duration kEndOfLifeBound = std::chrono::seconds(1);
+
   /// The process's own. A forked child gets a new one for the clients that it makes itself.
   [[nodiscard]] static ClientRuntime& shared();
 
@@ -33,8 +45,15 @@ class ClientRuntime {
 
   /// One-shot messages are made one after the other on this queue of the loop's.
   [[nodiscard]] const std::shared_ptr<Queue>& oneMessageQueue() const { return _oneMessageQueue; }
-  /// How many of them wait for their reply.
-  [[nodiscard]] std::atomic<int>& oneMessagesUnderWay() { return _oneMessagesUnderWay; }
+  /// Counts one message, until `endOneMessage`. False when `maximum` of them wait for their replies.
+  [[nodiscard]] bool beginOneMessage(int maximum);
+  void endOneMessage();
+
+  /// From now on `client` is asked to send what it has when the process exits.
+  void addClient(std::weak_ptr<LeavingClient> client);
+  /// The latest moment to which a client with that bound may wait: counted from now or, once the process exits, from
+  /// the beginning of that.
+  [[nodiscard]] SteadyTime deadlineFor(Duration bound) const;
 
   /// The calling user's suite, in which the library keeps its identifiers.
   [[nodiscard]] UserDefaults& defaults();
@@ -42,13 +61,20 @@ class ClientRuntime {
  private:
   ClientRuntime();
 
-  const std::uint64_t _generation = processGeneration();
+  static void processExits();
+  void sendBeforeExit();
+  [[nodiscard]] bool waitForOneMessages(SteadyTime deadline);
+
   EventLoop _loop;
   const std::unique_ptr<ThreadPool> _callbackThreads;
   const std::unique_ptr<ThreadPool> _periodicTaskThreads;
   const std::shared_ptr<Queue> _oneMessageQueue;
-  std::atomic<int> _oneMessagesUnderWay{0};
+  std::atomic<SteadyTime> _exitBegun{SteadyTime::max()};
   Lock _lock;
+  Condition _noOneMessage;
+  int _oneMessagesUnderWay VELK_GUARDED_BY(_lock) = 0;
+  std::vector<std::weak_ptr<LeavingClient>> _clients VELK_GUARDED_BY(_lock);
+  std::size_t _clientsToSweep VELK_GUARDED_BY(_lock) = 64;
   std::unique_ptr<UserDefaults> _defaults VELK_GUARDED_BY(_lock);
 };
 

@@ -13,7 +13,8 @@ namespace velk {
 namespace {
 
 const Error& noDaemon() {
-  static const Error error = connectionError(ConnectionError::notConnected, "no daemon answers");
+  // Never destroyed: the library's thread is at work while the process ends.
+  static const Error& error = *new Error(connectionError(ConnectionError::notConnected, "no daemon answers"));
   return error;
 }
 

@@ -10,9 +10,11 @@
 // at a time; answers to different calls may arrive at the same time. A callback that throws ends the process, except
 // where it says otherwise.
 //
-// When the last reference goes, what was handed over is sent, the session is finished, and the connection is closed.
+// When the last reference goes, what was handed over is sent, the session is finished, and the connection is closed. A
+// process that exits with a reference left sends what was handed over too. Both wait for it within a bound.
 #pragma once
 
+#include <chrono>
 #include <cstdint>
 #include <functional>
 #include <memory>
@@ -53,6 +55,11 @@ class VELK_EXPORT VelkReporting : public std::enable_shared_from_this<VelkReport
   ~VelkReporting();
   VelkReporting(const VelkReporting&) = delete;
   VelkReporting& operator=(const VelkReporting&) = delete;
+
+  /// How long the last release of this object may wait for what was handed over to leave (one second unless set; 0 to
+  /// an hour), and how long the end of the process may, by `exit` or a return from `main`, while this object is there.
+  /// What has not left by then is lost. `_exit`, and the end by a signal, wait for nothing.
+  void setEndOfLifeBound(std::chrono::milliseconds bound);
 
   /// Has the daemon build the session's backends; once, before events are sent.
   void startConfigurationWithCompletionHandler(StatesCallback completionHandler);

@@ -191,9 +191,13 @@ VELK_EXPORT void VelkReportingClientStartConfiguration(VelkReportingClient* clie
                                                        VelkReportingDestroyFunction destroy);
 /* Adds an owner; answers `client`. */
 VELK_EXPORT VelkReportingClient* VelkReportingClientRetain(VelkReportingClient* client);
-/* The last owner's release sends what is queued (for at most a second), finishes the session and closes the
- * connection. It may be called from a callback of the client itself. */
+/* The last owner's release sends what is queued (for at most a second, unless a bound is set), finishes the session and
+ * closes the connection. It may be called from a callback of the client itself. */
 VELK_EXPORT void VelkReportingClientRelease(VelkReportingClient* client);
+/* How long the last release may wait for what is queued to leave, and how long the end of the process may (by exit(),
+ * or a return from main) while the client has an owner: 1,000 unless set, at most an hour. What has not left by then is
+ * lost. */
+VELK_EXPORT void VelkReportingClientSetEndOfLifeBound(VelkReportingClient* client, uint32_t milliseconds);
 
 /* ---- Reporting ---- */
 

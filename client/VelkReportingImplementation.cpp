@@ -5,14 +5,11 @@
 #include "ipc/MethodTable.h"
 #include "ipc/Vocabulary.h"
 #include "platform/Log.h"
-#include "platform/Semaphore.h"
 
 namespace velk {
 
 namespace {
 
-/// How long the last release waits for queued events to leave.
-constexpr Duration kEndOfLifeBound = std::chrono::seconds(1);
 /// How soon a connection that was full is tried again.
 constexpr Duration kFullConnectionPause = std::chrono::milliseconds(2);
 /// While events come more often than this, they are taken together: each wake-up of the library's thread costs more
@@ -46,6 +43,7 @@ void VelkReportingImplementation::open(std::weak_ptr<VelkReporting> client) {
   _link->open([self = weak_from_this()] {
     if (const auto strong = self.lock()) strong->wasInterrupted();
   });
+  _runtime.addClient(weak_from_this());
 }
 
 VelkReportingImplementation::Sent VelkReportingImplementation::sendMessage(std::uint16_t category,
@@ -170,65 +168,6 @@ void VelkReportingImplementation::finishSession() {
   } else {
     log::standard(texts::kFinishSessionProxyFailure, "no daemon answers");
   }
-}
-
-void VelkReportingImplementation::endOfLife(const void* client) {
-  const Clock& clock = _runtime.loop().clock();
-  const SteadyTime deadline = clock.steadyTime() + kEndOfLifeBound;
-  const bool isOnLoop = _runtime.loop().isCurrent();
-  const bool mayWait = !isOnLoop && !_periodicTasks->isInCallback();  // a tick does not end before its callbacks do
-  _periodicTasks->withdrawAll(!isOnLoop);
-  if (mayWait) sendHeldEventsWithin(deadline);
-  auto done = std::make_shared<Semaphore>();
-  onQueue([client, done](VelkReportingImplementation& self) {
-    self.finishAndClose(client);
-    done->signal();
-  });
-  if (!mayWait || !done->waitFor(deadline - clock.steadyTime())) return;
-  const auto connection = _link->current();
-  const Duration left = deadline - clock.steadyTime();
-  if (connection && left > Duration::zero()) static_cast<void>(connection->waitUntilSent(left));
-}
-
-/// Off the queue: makes room in the connection, again and again, for what did not fit into it.
-void VelkReportingImplementation::sendHeldEventsWithin(SteadyTime deadline) {
-  const Clock& clock = _runtime.loop().clock();
-  for (;;) {
-    auto turn = std::make_shared<Semaphore>();
-    auto isLeft = std::make_shared<std::atomic<bool>>(false);
-    onQueue([turn, isLeft](VelkReportingImplementation& self) {
-      self.sendHeldEvents();
-      *isLeft = !self._outbox.held.empty();
-      turn->signal();
-    });
-    if (!turn->waitFor(deadline - clock.steadyTime()) || !*isLeft) return;
-    const auto connection = _link->current();
-    if (!connection || connection->hasEnded()) return;
-    if (!connection->waitUntilSent(deadline - clock.steadyTime())) return;
-  }
-}
-
-void VelkReportingImplementation::finishAndClose(const void* client) {
-  _isFinished = true;
-  _periodicTasks->end();
-  sendEvents(_incoming.takeForWork());  // what a tick reported that was not over yet when the last reference went
-  sendWhatFits();
-  std::size_t lost = 0;
-  for (auto& waiting : _outbox.held) {
-    if (waiting.call) {
-      waiting.call();  // its callback learns that it failed
-    } else {
-      ++lost;
-    }
-  }
-  _outbox.held.clear();
-  if (lost != 0) log::error("aboutToDealloc: %u events are lost: no daemon takes them", lost);
-  reportOverflow();
-  log::standard(texts::kAboutToDealloc, client);
-  finishSession();
-  _aggregation->releaseAggregationBlock();
-  replaceLoggingBlock(nullptr);
-  _link->close();
 }
 
 void VelkReportingImplementation::setMessageSentDelegate(std::weak_ptr<VelkReportingMessageSentDelegate> delegate) {

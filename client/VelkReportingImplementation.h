@@ -24,7 +24,8 @@
 
 namespace velk {
 
-class VelkReportingImplementation : public std::enable_shared_from_this<VelkReportingImplementation> {
+class VelkReportingImplementation final : public LeavingClient,
+                                          public std::enable_shared_from_this<VelkReportingImplementation> {
  public:
   /// Codes of errors that only the library makes.
   static constexpr int kOutboxFull = 8;
@@ -69,6 +70,9 @@ class VelkReportingImplementation : public std::enable_shared_from_this<VelkRepo
   /// The end: what was queued is sent, the session finished, the connection closed. Waits for that within a bound,
   /// unless it runs on the library's own thread.
   void endOfLife(const void* client);
+  void setEndOfLifeBound(Duration bound) noexcept { _endOfLifeBound.store(bound, std::memory_order_relaxed); }
+  /// Sends what was queued, past a tick that does not end in time; the session goes on for as long as the process does.
+  void sendBeforeExit(SteadyTime begun) override;
 
   /// From here on messages are brought to the queue, which knows the delegate.
   void expectMessageSentDelegate() noexcept { _mayHaveDelegate.store(true, std::memory_order_relaxed); }
@@ -106,11 +110,14 @@ class VelkReportingImplementation : public std::enable_shared_from_this<VelkRepo
   void sendHeldEvents();
   void sendWhatFits();
   void runBehindHeldEvents(Task call);
-  void sendHeldEventsWithin(SteadyTime deadline);
+  enum class Turn { behindTicks, pastTicks };
+  /// The number of events that were left when it last looked.
+  std::size_t sendHeldEventsWithin(SteadyTime deadline, Turn turn);
   void retryLater(Duration delay);
   void reportOverflow();
   void wasInterrupted();
   void finishAndClose(const void* client);
+  [[nodiscard]] std::size_t heldEvents() const;
   void fetchDisplayURL(const std::shared_ptr<Connection>& connection);
   void logText(const std::string& text);
   void replaceLoggingBlock(SharedLoggingBlock block);
@@ -133,6 +140,7 @@ class VelkReportingImplementation : public std::enable_shared_from_this<VelkRepo
   // Self-synchronised.
   EventOutbox _outbox;
   IncomingEvents _incoming;
+  std::atomic<Duration> _endOfLifeBound{ClientRuntime::kEndOfLifeBound};
   std::atomic<bool> _mayHaveDelegate{false};  ///< once true it stays so
   /// Shared with the files.
   const std::shared_ptr<std::atomic<std::size_t>> _filesHeld = std::make_shared<std::atomic<std::size_t>>(0);

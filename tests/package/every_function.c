@@ -177,6 +177,8 @@ static void check_client(VelkReportingClient* client, const VelkReportingValue* 
   VelkReportingUpdateSharedDataForKey(client, "key", user);
   VelkReportingUpdateSharedDataForKey(client, "key", NULL);
   REQUIRE(VelkReportingClientSetDigestKey(client, "key", 3, 0));
+  VelkReportingClientSetEndOfLifeBound(client, 5000);
+  VelkReportingClientSetEndOfLifeBound(NULL, 5000);
   VelkReportingValue* logData = VelkReportingValueCreateFromJSON("[{\"LogData\": \"line\"}]", NULL);
   REQUIRE(VelkReportingUploadLogWithArray(client, logData));
   VelkReportingValueRelease(logData);
