@@ -110,8 +110,7 @@ inline constexpr const char* kNotARegularFile = "UploadBackend(uploadFileAtPath)
 inline constexpr const char* kInputFileIsEmpty = "UploadBackend(uploadFileAtPath): Input file is empty";
 inline constexpr const char* kNoUploadRequest = "UploadBackend(uploadFileAtPath): Unable to create URL request";
 inline constexpr const char* kUploadPostFailed = "UploadBackend(uploadFileAtPath): post %s";
-inline constexpr const char* kUploadAnswered =
-    "UploadBackend(uploadFileAtPath): sending to |%s|, Json output: %s";
+inline constexpr const char* kUploadAnswered = "UploadBackend(uploadFileAtPath): sending to |%s|, Json output: %s";
 inline constexpr const char* kUploadTooLarge =
     "UploadBackend(uploadFileAtPath): a file of %llu bytes is larger than the %llu that are taken";
 inline constexpr const char* kUploadNotKept = "UploadBackend(uploadFileAtPath): the compressed file is lost: %s";

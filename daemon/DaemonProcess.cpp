@@ -145,8 +145,8 @@ DaemonProcess::Parts::Parts(const DaemonOptions& options, process::RunLoop& loop
       environment(*defaults, *device),
       idleWatch(
           *pool, idleLimit(options, activated), [this] { return isOccupied(); }, [this] { runLoop.wakeUp(); }),
-      platform{systemClock(), *pool,     *defaults, *device,     *locale,        *http,
-               *random,       idleWatch, *consent,  *statistics, *logSubmission, adaptorBundle.get(),
+      platform{systemClock(),  *pool,           *defaults, *device,     *locale,        *http,
+               *random,        idleWatch,       *consent,  *statistics, *logSubmission, adaptorBundle.get(),
                powerLog.get(), udpSockets.get()},
       storebagPlatform{systemClock(), *storebagPool, *defaults, *device,     *locale,       *http,
                        *random,       idleWatch,     *consent,  *statistics, *logSubmission},

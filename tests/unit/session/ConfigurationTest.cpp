@@ -389,8 +389,9 @@ TEST_F(ConfigurationTest, StatusTellsWhatASessionIs) {
   EXPECT_EQ(integerValue(status.find("level")), 1);
   EXPECT_TRUE(booleanValue(status.find("described")));
   EXPECT_FALSE(booleanValue(status.find("finished")));
-  EXPECT_EQ((*status.array("backends"))[0],
-            PropertyValue(PropertyDictionary{{"name", "splunk"}, {"state", 2}, {"batchedEvents", 3}, {"batchedBytes", 12}}));
+  EXPECT_EQ(
+      (*status.array("backends"))[0],
+      PropertyValue(PropertyDictionary{{"name", "splunk"}, {"state", 2}, {"batchedEvents", 3}, {"batchedBytes", 12}}));
 }
 
 }  // namespace
