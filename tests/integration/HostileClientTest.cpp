@@ -125,7 +125,7 @@ TEST_F(HostileClient, WithWrongArgumentsIsRefusedPerCall) {
   const auto answer = connection.receive();
   ASSERT_TRUE(answer) << "the connection still serves";
   EXPECT_EQ(answer->kind, FrameKind::reply);
-  EXPECT_EQ(answer->body, list({"\xf4"}));
+  EXPECT_EQ(answer->body, list({"\xf4", "\xf4"}));
 }
 
 TEST_F(HostileClient, ThatSendsNoiseIsDisconnected) {
