@@ -1,7 +1,8 @@
 /* A process that loads and unloads the library again and again, as plug-ins do that link it:
  *   loading_host LIBRARY TIMES
- * Writes a line when it has loaded it for the first time: "loaded THREADS-BEFORE THREADS DESCRIPTORS-BEFORE DESCRIPTORS";
- * one for each round that goes wrong; and "done THREADS MAPPED", with 1 for a library that is still there. */
+ * Writes a line when it has loaded it for the first time: "loaded THREADS-BEFORE THREADS DESCRIPTORS-BEFORE
+ * DESCRIPTORS"; one for each round that goes wrong; and "done THREADS MAPPED", with 1 for a library that is still
+ * there. */
 #include <dirent.h>
 #include <dlfcn.h>
 #include <stdint.h>
