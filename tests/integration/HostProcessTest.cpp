@@ -180,7 +180,7 @@ TEST_F(HostProcessTest, ForkedChildrenAreInertAndDoTheParentNoHarm) {
   EXPECT_EQ(host.call("send-forever 4"), "");
   EXPECT_EQ(host.call("fork-often 20"), "");
   EXPECT_EQ(host.call("stop-senders"), "");
-  EXPECT_TRUE(host.flush()) << "they may have filled the outbox";
+  EXPECT_TRUE(host.flush()) << "they may have filled the outbox; posts: " << server.posts().size();
   EXPECT_EQ(host.call("send 3 1"), "");
   EXPECT_TRUE(host.flush());
   ASSERT_TRUE(server.waitForEvents(3, {7}));

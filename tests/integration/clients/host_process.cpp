@@ -244,9 +244,9 @@ class Host {
         for (int round = 0; !_stops; ++round) {
           client->sendMessageWithCategory(8, 1, PropertyDictionary{{"round", round}});
           static_cast<void>(client->serverSupportsFileUpload());
-          if (round % 64 != 0) continue;
-          client->flushMessages();
-          std::this_thread::sleep_for(std::chrono::milliseconds(1));
+          // A pace that the daemon can keep up with: each flush is a post.
+          if (round % 16 == 0) std::this_thread::sleep_for(std::chrono::milliseconds(1));
+          if (round % 1024 == 0) client->flushMessages();
         }
       });
     }
