@@ -1,7 +1,6 @@
 // What the dashboard's side of the collector keeps, in an SQLite file of its own.
 //   datagrams (id, received, fate, sent, component, major_version, session, client_version, event_number, method,
-//   status,
-//              device, flags, text)
+//              status, device, flags, text)
 //   log_data  (id, received, entries, archive)
 #pragma once
 
@@ -14,9 +13,7 @@
 #include "foundation/TimeValue.h"
 #include "platform/Lock.h"
 #include "tools/collector/DashboardListener.h"
-
-struct sqlite3;
-struct sqlite3_stmt;
+#include "tools/collector/Database.h"
 
 namespace velk::collector {
 
@@ -36,23 +33,12 @@ class DashboardStore {
   [[nodiscard]] Result<std::string> logData(std::int64_t number);
 
  private:
-  struct DatabaseClose {
-    void operator()(sqlite3* database) const noexcept;
-  };
-  struct StatementFinalize {
-    void operator()(sqlite3_stmt* statement) const noexcept;
-  };
-  using Statement = std::unique_ptr<sqlite3_stmt, StatementFinalize>;
-
   DashboardStore();
   [[nodiscard]] Result<void> prepare(const std::string& path);
-  [[nodiscard]] Result<Statement> statementLocked(const char* sql) VELK_REQUIRES(_lock);
-  [[nodiscard]] Result<void> stepLocked(sqlite3_stmt* statement) VELK_REQUIRES(_lock);
-  [[nodiscard]] Failure problemLocked(const char* doing) VELK_REQUIRES(_lock);
 
   // Held while SQLite works: that is what it is for.
   Lock _lock;
-  std::unique_ptr<sqlite3, DatabaseClose> _database VELK_GUARDED_BY(_lock);
+  Database _database VELK_GUARDED_BY(_lock);
   Statement _insertDatagram VELK_GUARDED_BY(_lock);
   Statement _insertLogData VELK_GUARDED_BY(_lock);
   Statement _selectLogData VELK_GUARDED_BY(_lock);

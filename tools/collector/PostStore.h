@@ -10,10 +10,8 @@
 #include "foundation/Error.h"
 #include "foundation/TimeValue.h"
 #include "platform/Lock.h"
+#include "tools/collector/Database.h"
 #include "tools/collector/ReceivedPost.h"
-
-struct sqlite3;
-struct sqlite3_stmt;
 
 namespace velk::collector {
 
@@ -32,18 +30,8 @@ class PostStore {
                                          TimeValue received);
 
  private:
-  struct DatabaseClose {
-    void operator()(sqlite3* database) const noexcept;
-  };
-  struct StatementFinalize {
-    void operator()(sqlite3_stmt* statement) const noexcept;
-  };
-  using Statement = std::unique_ptr<sqlite3_stmt, StatementFinalize>;
-
   PostStore();
   [[nodiscard]] Result<void> prepare(const std::string& path);
-  [[nodiscard]] Result<void> runLocked(const char* sql) VELK_REQUIRES(_lock);
-  [[nodiscard]] Result<Statement> statementLocked(const char* sql) VELK_REQUIRES(_lock);
   [[nodiscard]] Result<std::int64_t> insertPostLocked(const ReceivedPost& post, const std::string& path,
                                                       const HeaderList& headers, TimeValue received)
       VELK_REQUIRES(_lock);
@@ -51,12 +39,10 @@ class PostStore {
   [[nodiscard]] Result<std::int64_t> insertAllLocked(const ReceivedPost& post, const std::string& path,
                                                      const HeaderList& headers, TimeValue received)
       VELK_REQUIRES(_lock);
-  [[nodiscard]] Result<void> stepLocked(sqlite3_stmt* statement) VELK_REQUIRES(_lock);
-  [[nodiscard]] Failure problemLocked(const char* doing) VELK_REQUIRES(_lock);
 
   // Held while SQLite writes: that is what it is for.
   Lock _lock;
-  std::unique_ptr<sqlite3, DatabaseClose> _database VELK_GUARDED_BY(_lock);
+  Database _database VELK_GUARDED_BY(_lock);
   Statement _insertPost VELK_GUARDED_BY(_lock);
   Statement _insertEvent VELK_GUARDED_BY(_lock);
 };

@@ -9,8 +9,7 @@
 #include "foundation/Error.h"
 #include "foundation/TimeValue.h"
 #include "platform/Lock.h"
-
-struct sqlite3;
+#include "tools/collector/Database.h"
 
 namespace velk::collector {
 
@@ -37,20 +36,15 @@ class UploadStore {
   [[nodiscard]] Result<std::int64_t> keep(const KeptUpload& upload, TimeValue received);
 
  private:
-  struct DatabaseClose {
-    void operator()(sqlite3* database) const noexcept;
-  };
-
   explicit UploadStore(std::string directory) : _directory(std::move(directory)) {}
   [[nodiscard]] Result<void> prepare(const std::string& databasePath);
   [[nodiscard]] Result<std::int64_t> insertLocked(const KeptUpload& upload, TimeValue received) VELK_REQUIRES(_lock);
-  [[nodiscard]] Result<void> runLocked(const char* sql) VELK_REQUIRES(_lock);
-  [[nodiscard]] Failure problemLocked(const char* doing) VELK_REQUIRES(_lock);
 
   const std::string _directory;
   // Held while SQLite works: that is what it is for.
   Lock _lock;
-  std::unique_ptr<sqlite3, DatabaseClose> _database VELK_GUARDED_BY(_lock);
+  Database _database VELK_GUARDED_BY(_lock);
+  Statement _insert VELK_GUARDED_BY(_lock);
 };
 
 }  // namespace velk::collector
