@@ -51,28 +51,28 @@ Result<void> DashboardStore::add(const ReceivedDatagram& datagram, TimeValue rec
   const double sent = header.seconds + header.fourMilliseconds * dashboard::kFourMilliseconds / 1000.0;
   Guard guard(_lock);
   sqlite3_stmt* statement = _insertDatagram.get();
-  bind(statement, 1, secondsFromTimeValue(received));
-  bind(statement, 2, nameOf(datagram.fate));
-  bind(statement, 3, sent);
-  bind(statement, 4, std::int64_t{header.component});
-  bind(statement, 5, std::int64_t{header.majorVersion});
-  bind(statement, 6, std::int64_t{header.sessionID});
-  bind(statement, 7, std::int64_t{header.clientVersion});
-  bind(statement, 8, std::int64_t{header.eventNumber});
-  bind(statement, 9, std::int64_t{header.method});
-  bind(statement, 10, std::int64_t{header.respCode});
-  bind(statement, 11, Blob{{header.deviceIdentifier.data(), header.deviceIdentifier.size()}});
-  bind(statement, 12, std::int64_t{header.flags});
-  bind(statement, 13, Blob{datagram.text});
+  bindColumn(statement, 1, secondsFromTimeValue(received));
+  bindColumn(statement, 2, nameOf(datagram.fate));
+  bindColumn(statement, 3, sent);
+  bindColumn(statement, 4, std::int64_t{header.component});
+  bindColumn(statement, 5, std::int64_t{header.majorVersion});
+  bindColumn(statement, 6, std::int64_t{header.sessionID});
+  bindColumn(statement, 7, std::int64_t{header.clientVersion});
+  bindColumn(statement, 8, std::int64_t{header.eventNumber});
+  bindColumn(statement, 9, std::int64_t{header.method});
+  bindColumn(statement, 10, std::int64_t{header.respCode});
+  bindColumn(statement, 11, Blob{{header.deviceIdentifier.data(), header.deviceIdentifier.size()}});
+  bindColumn(statement, 12, std::int64_t{header.flags});
+  bindColumn(statement, 13, Blob{datagram.text});
   return _database.step(statement);
 }
 
 Result<std::int64_t> DashboardStore::addLogData(std::string_view archive, std::size_t entries, TimeValue received) {
   Guard guard(_lock);
   sqlite3_stmt* statement = _insertLogData.get();
-  bind(statement, 1, secondsFromTimeValue(received));
-  bind(statement, 2, static_cast<std::int64_t>(entries));
-  bind(statement, 3, Blob{archive});
+  bindColumn(statement, 1, secondsFromTimeValue(received));
+  bindColumn(statement, 2, static_cast<std::int64_t>(entries));
+  bindColumn(statement, 3, Blob{archive});
   if (Result<void> stepped = _database.step(statement); !stepped) return Failure(std::move(stepped).error());
   return _database.lastRow();
 }
@@ -80,7 +80,7 @@ Result<std::int64_t> DashboardStore::addLogData(std::string_view archive, std::s
 Result<std::string> DashboardStore::logData(std::int64_t number) {
   Guard guard(_lock);
   sqlite3_stmt* statement = _selectLogData.get();
-  bind(statement, 1, number);
+  bindColumn(statement, 1, number);
   std::string archive;
   const bool found = sqlite3_step(statement) == SQLITE_ROW;
   if (found) {

@@ -16,17 +16,19 @@ void DatabaseClose::operator()(sqlite3* database) const noexcept { sqlite3_close
 
 void StatementFinalize::operator()(sqlite3_stmt* statement) const noexcept { sqlite3_finalize(statement); }
 
-void bind(sqlite3_stmt* statement, int column, std::string_view text) {
+void bindColumn(sqlite3_stmt* statement, int column, std::string_view text) {
   sqlite3_bind_text64(statement, column, text.data(), text.size(), SQLITE_STATIC, SQLITE_UTF8);
 }
 
-void bind(sqlite3_stmt* statement, int column, Blob blob) {
+void bindColumn(sqlite3_stmt* statement, int column, Blob blob) {
   sqlite3_bind_blob64(statement, column, blob.bytes.data(), blob.bytes.size(), SQLITE_STATIC);
 }
 
-void bind(sqlite3_stmt* statement, int column, std::int64_t number) { sqlite3_bind_int64(statement, column, number); }
+void bindColumn(sqlite3_stmt* statement, int column, std::int64_t number) {
+  sqlite3_bind_int64(statement, column, number);
+}
 
-void bind(sqlite3_stmt* statement, int column, double number) { sqlite3_bind_double(statement, column, number); }
+void bindColumn(sqlite3_stmt* statement, int column, double number) { sqlite3_bind_double(statement, column, number); }
 
 Result<void> Database::open(const std::string& path, const char* schema) {
   // SQLite would make the file readable for others, and its journal files take the mode of the first.
@@ -61,6 +63,17 @@ Result<void> Database::step(sqlite3_stmt* statement) {
   sqlite3_clear_bindings(statement);
   if (stepped != SQLITE_DONE) return problem("write to the database");
   return {};
+}
+
+Result<std::int64_t> Database::end(Result<std::int64_t> outcome) {
+  if (outcome) {
+    Result<void> committed = run("COMMIT");
+    if (committed) return outcome;
+    outcome = Failure(std::move(committed).error());
+  }
+  // Fails when SQLite has rolled back by itself; the first error is the one to tell.
+  (void)run("ROLLBACK");
+  return outcome;
 }
 
 std::int64_t Database::lastRow() const { return sqlite3_last_insert_rowid(_handle.get()); }

@@ -28,14 +28,14 @@ struct Blob {
 };
 
 /// Columns count from 1. Texts and bytes are not copied: they must outlive the statement's step.
-void bind(sqlite3_stmt* statement, int column, std::string_view text);
-void bind(sqlite3_stmt* statement, int column, Blob blob);
-void bind(sqlite3_stmt* statement, int column, std::int64_t number);
-void bind(sqlite3_stmt* statement, int column, double number);
+void bindColumn(sqlite3_stmt* statement, int column, std::string_view text);
+void bindColumn(sqlite3_stmt* statement, int column, Blob blob);
+void bindColumn(sqlite3_stmt* statement, int column, std::int64_t number);
+void bindColumn(sqlite3_stmt* statement, int column, double number);
 template <class Value>
-void bind(sqlite3_stmt* statement, int column, const std::optional<Value>& value) {
+void bindColumn(sqlite3_stmt* statement, int column, const std::optional<Value>& value) {
   // What is not bound is null.
-  if (value) bind(statement, column, *value);
+  if (value) bindColumn(statement, column, *value);
 }
 
 /// Owned by a store, which locks it and ends its statements first.
@@ -51,20 +51,10 @@ class Database {
   [[nodiscard]] Result<void> step(sqlite3_stmt* statement);
   [[nodiscard]] std::int64_t lastRow() const;
 
-  /// Runs `work`, a Result<std::int64_t>(), in a transaction: what fails leaves nothing behind.
-  template <class Work>
-  [[nodiscard]] Result<std::int64_t> transact(Work&& work) {
-    if (Result<void> begun = run("BEGIN IMMEDIATE"); !begun) return Failure(std::move(begun).error());
-    Result<std::int64_t> number = work();
-    if (number) {
-      Result<void> committed = run("COMMIT");
-      if (committed) return number;
-      number = Failure(std::move(committed).error());
-    }
-    // Fails when SQLite has rolled back by itself; the first error is the one to tell.
-    (void)run("ROLLBACK");
-    return number;
-  }
+  /// A transaction: what is done between `begin` and `end` is there whole, or not at all. `end` is told how the work
+  /// went, and answers the same unless the transaction could not be closed.
+  [[nodiscard]] Result<void> begin() { return run("BEGIN IMMEDIATE"); }
+  [[nodiscard]] Result<std::int64_t> end(Result<std::int64_t> outcome);
 
  private:
   [[nodiscard]] Failure problem(const char* doing) const;

@@ -55,7 +55,8 @@ Result<void> PostStore::prepare(const std::string& path) {
 Result<std::int64_t> PostStore::add(const ReceivedPost& post, const std::string& path, const HeaderList& headers,
                                     TimeValue received) {
   Guard guard(_lock);
-  return _database.transact([&]() VELK_REQUIRES(_lock) { return insertAllLocked(post, path, headers, received); });
+  if (Result<void> begun = _database.begin(); !begun) return Failure(std::move(begun).error());
+  return _database.end(insertAllLocked(post, path, headers, received));
 }
 
 Result<std::int64_t> PostStore::insertAllLocked(const ReceivedPost& post, const std::string& path,
@@ -74,14 +75,14 @@ Result<std::int64_t> PostStore::insertPostLocked(const ReceivedPost& post, const
                                                  const HeaderList& headers, TimeValue received) {
   sqlite3_stmt* statement = _insertPost.get();
   const std::string headerText = jsonOfHeaders(headers);
-  bind(statement, 1, secondsFromTimeValue(received));
-  bind(statement, 2, path);
-  bind(statement, 3, headerText);
-  bind(statement, 4, post.clientId);
-  bind(statement, 5, post.postTime);
-  bind(statement, 6, static_cast<std::int64_t>(post.events.size()));
-  bind(statement, 7, static_cast<std::int64_t>(post.wireBytes));
-  bind(statement, 8, static_cast<std::int64_t>(post.bodyBytes));
+  bindColumn(statement, 1, secondsFromTimeValue(received));
+  bindColumn(statement, 2, path);
+  bindColumn(statement, 3, headerText);
+  bindColumn(statement, 4, post.clientId);
+  bindColumn(statement, 5, post.postTime);
+  bindColumn(statement, 6, static_cast<std::int64_t>(post.events.size()));
+  bindColumn(statement, 7, static_cast<std::int64_t>(post.wireBytes));
+  bindColumn(statement, 8, static_cast<std::int64_t>(post.bodyBytes));
   if (Result<void> stepped = _database.step(statement); !stepped) return Failure(std::move(stepped).error());
   return _database.lastRow();
 }
@@ -90,13 +91,13 @@ Result<void> PostStore::insertEventLocked(std::int64_t post, const PropertyDicti
   sqlite3_stmt* statement = _insertEvent.get();
   const EventFields fields = eventFields(event);
   const std::string text = tools::jsonText(event);
-  bind(statement, 1, post);
-  bind(statement, 2, fields.method);
-  bind(statement, 3, fields.status);
-  bind(statement, 4, fields.eventNumber);
-  bind(statement, 5, fields.sender);
-  bind(statement, 6, fields.session);
-  bind(statement, 7, text);
+  bindColumn(statement, 1, post);
+  bindColumn(statement, 2, fields.method);
+  bindColumn(statement, 3, fields.status);
+  bindColumn(statement, 4, fields.eventNumber);
+  bindColumn(statement, 5, fields.sender);
+  bindColumn(statement, 6, fields.session);
+  bindColumn(statement, 7, text);
   return _database.step(statement);
 }
 

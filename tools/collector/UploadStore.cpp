@@ -51,25 +51,27 @@ Result<void> UploadStore::prepare(const std::string& databasePath) {
 
 Result<std::int64_t> UploadStore::keep(const KeptUpload& upload, TimeValue received) {
   Guard guard(_lock);
-  return _database.transact([&]() VELK_REQUIRES(_lock) -> Result<std::int64_t> {
-    Result<std::int64_t> number = insertLocked(upload, received);
-    if (!number) return number;
-    // The file before the line is there for good: a line without a file would promise what is not there.
-    const auto moved =
-        files::move(upload.path, _directory + "/" + std::to_string(*number) + "-" + harmless(upload.name));
-    if (!moved) return Failure(moved.error());
-    return number;
-  });
+  if (Result<void> begun = _database.begin(); !begun) return Failure(std::move(begun).error());
+  return _database.end(insertAndMoveLocked(upload, received));
+}
+
+/// The file before the line is there for good: a line without a file would promise what is not there.
+Result<std::int64_t> UploadStore::insertAndMoveLocked(const KeptUpload& upload, TimeValue received) {
+  Result<std::int64_t> number = insertLocked(upload, received);
+  if (!number) return number;
+  const auto moved = files::move(upload.path, _directory + "/" + std::to_string(*number) + "-" + harmless(upload.name));
+  if (!moved) return Failure(moved.error());
+  return number;
 }
 
 Result<std::int64_t> UploadStore::insertLocked(const KeptUpload& upload, TimeValue received) {
   const std::string file = harmless(upload.name);
-  bind(_insert.get(), 1, secondsFromTimeValue(received));
-  bind(_insert.get(), 2, upload.name);
-  bind(_insert.get(), 3, upload.target);
-  bind(_insert.get(), 4, static_cast<std::int64_t>(upload.wireBytes));
-  bind(_insert.get(), 5, static_cast<std::int64_t>(upload.fileBytes));
-  bind(_insert.get(), 6, file);
+  bindColumn(_insert.get(), 1, secondsFromTimeValue(received));
+  bindColumn(_insert.get(), 2, upload.name);
+  bindColumn(_insert.get(), 3, upload.target);
+  bindColumn(_insert.get(), 4, static_cast<std::int64_t>(upload.wireBytes));
+  bindColumn(_insert.get(), 5, static_cast<std::int64_t>(upload.fileBytes));
+  bindColumn(_insert.get(), 6, file);
   if (Result<void> stepped = _database.step(_insert.get()); !stepped) return Failure(std::move(stepped).error());
   return _database.lastRow();
 }

@@ -38,6 +38,8 @@ class UploadStore {
  private:
   explicit UploadStore(std::string directory) : _directory(std::move(directory)) {}
   [[nodiscard]] Result<void> prepare(const std::string& databasePath);
+  [[nodiscard]] Result<std::int64_t> insertAndMoveLocked(const KeptUpload& upload, TimeValue received)
+      VELK_REQUIRES(_lock);
   [[nodiscard]] Result<std::int64_t> insertLocked(const KeptUpload& upload, TimeValue received) VELK_REQUIRES(_lock);
 
   const std::string _directory;
