@@ -236,6 +236,8 @@ TEST_F(LifecycleTest, LastReferenceWaitsForRoomAndKeepsTheOrder) {
   _daemon.start();
   auto client = makeClient();
   ASSERT_TRUE(_daemon.waitForCalls("setSessionInfo", 1));
+  // What is told of here is the order, however slow the machine.
+  client->setEndOfLifeBound(std::chrono::minutes(1));
   _daemon.holdCalls(true);
   // More than the daemon's socket, its unread bytes and the connection's outbox hold together.
   constexpr std::size_t kEvents = 120;
