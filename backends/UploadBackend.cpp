@@ -141,10 +141,10 @@ HttpRequest UploadBackend::makeRequest(std::string address, const CompressedFile
 }
 
 Duration UploadBackend::timeoutFor(std::uint64_t bodyBytes) {
-  constexpr Duration kOrdinary = std::chrono::seconds(60);
-  constexpr Duration kLongest = std::chrono::hours(1);
+  constexpr std::uint64_t kOrdinarySeconds = 60;
+  constexpr std::uint64_t kLongestSeconds = 3600;
   constexpr std::uint64_t kSlowestBytesASecond = 128 * 1024;
-  return std::min<Duration>(kOrdinary + std::chrono::seconds(bodyBytes / kSlowestBytesASecond), kLongest);
+  return std::chrono::seconds(std::min(kOrdinarySeconds + bodyBytes / kSlowestBytesASecond, kLongestSeconds));
 }
 
 bool UploadBackend::postAndWait(ReportingSessionConnectivityInterface& transport, HttpRequest request,
