@@ -148,6 +148,8 @@ TEST(Flush, OfABackendThatHoldsNothingAnswersBeforeTheOthersHavePosted) {
   EXPECT_EQ(flush(session), failed("Nothing to flush")) << "although the other one has something to say";
   EXPECT_TRUE(server.waitForEvents(1, {7}));
   EXPECT_TRUE(daemon.log().waitForPart("internalFlushMessagesWithCompletion: splunk"));
+  // Its line in the message log follows; by its end the daemon has written it.
+  EXPECT_EQ(daemon.stop(), 0);
   EXPECT_NE(daemon.messageLog().find("[splunk -> flushMessages] "), std::string::npos) << "its result is only logged";
 }
 
