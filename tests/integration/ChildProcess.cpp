@@ -8,9 +8,8 @@
 #include <sys/wait.h>
 #include <unistd.h>
 
-#include <cstdio>
-#include <cstdlib>
 #include <stdexcept>
+#include <string_view>
 
 namespace velk::test {
 
@@ -84,26 +83,48 @@ void readLines(FileDescriptor file, LineCollector& lines) {
   lines.end();
 }
 
-[[noreturn]] void become(const ChildProcess::Options& options, int in, int out, int err) {
+/// What the new program is started with. Made before the fork: other threads may hold the locks of the heap and of the
+/// environment at that moment, and in the child nobody would ever give them back.
+struct Start {
+  explicit Start(const ChildProcess::Options& options) : user(options.user) {
+    for (char** variable = environ; *variable != nullptr; ++variable) {
+      const std::string text = *variable;
+      if (options.environment.count(text.substr(0, text.find('='))) == 0) variables.push_back(text);
+    }
+    for (const auto& [name, value] : options.environment) {
+      if (!value.empty()) variables.push_back(name + "=" + value);
+    }
+    words = options.command;
+    arguments = pointersTo(words);
+    environment = pointersTo(variables);
+  }
+  Start(const Start&) = delete;
+  Start& operator=(const Start&) = delete;
+
+  static std::vector<char*> pointersTo(std::vector<std::string>& texts) {
+    std::vector<char*> pointers;
+    for (auto& text : texts) pointers.push_back(text.data());
+    pointers.push_back(nullptr);
+    return pointers;
+  }
+
+  std::vector<std::string> words;
+  std::vector<std::string> variables;
+  std::vector<char*> arguments;
+  std::vector<char*> environment;
+  std::optional<uid_t> user;
+};
+
+/// In the child: nothing but system calls.
+[[noreturn]] void become(const Start& start, int in, int out, int err) {
   dup2(in, 0);
   dup2(out, 1);
   dup2(err, 2);
-  for (const auto& [name, value] : options.environment) {
-    if (value.empty()) {
-      unsetenv(name.c_str());
-    } else {
-      setenv(name.c_str(), value.c_str(), 1);
-    }
-  }
   ::signal(SIGPIPE, SIG_DFL);
-  if (options.user && (setgroups(0, nullptr) != 0 || setgid(*options.user) != 0 || setuid(*options.user) != 0)) {
-    _exit(126);
-  }
-  std::vector<char*> arguments;
-  for (const auto& argument : options.command) arguments.push_back(const_cast<char*>(argument.c_str()));
-  arguments.push_back(nullptr);
-  execv(arguments[0], arguments.data());
-  std::perror(arguments[0]);
+  if (start.user && (setgroups(0, nullptr) != 0 || setgid(*start.user) != 0 || setuid(*start.user) != 0)) _exit(126);
+  execve(start.arguments[0], start.arguments.data(), start.environment.data());
+  constexpr std::string_view kProblem = "the program cannot be started\n";
+  static_cast<void>(!::write(2, kProblem.data(), kProblem.size()));
   _exit(127);
 }
 
@@ -114,9 +135,10 @@ ChildProcess::ChildProcess(const Options& options) {
   Pipe in = makePipe();
   Pipe out = makePipe();
   Pipe err = makePipe();
+  const Start start(options);
   _pid = fork();
   if (_pid < 0) throw std::runtime_error("fork failed");
-  if (_pid == 0) become(options, in.reading.get(), out.writing.get(), err.writing.get());
+  if (_pid == 0) become(start, in.reading.get(), out.writing.get(), err.writing.get());
   _input = std::move(in.writing);
   _readers.emplace_back([file = std::move(out.reading), this]() mutable { readLines(std::move(file), _output); });
   _readers.emplace_back([file = std::move(err.reading), this]() mutable { readLines(std::move(file), _errors); });
