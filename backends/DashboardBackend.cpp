@@ -229,6 +229,7 @@ bool DashboardBackend::uploadLogData(const PropertyArray& logData) {
   request.method = "POST";
   request.body = std::make_shared<const std::string>(archive->begin(), archive->end());
   request.requiresHttps = !_isInternal;
+  request.isBulk = true;
   request.setHeader("Content-Type", "application/octet-stream");
   const auto sender = transport();
   if (!sender) return true;

@@ -133,6 +133,7 @@ HttpRequest UploadBackend::makeRequest(std::string address, const CompressedFile
   request.bodyFile = body.onDisk;
   request.timeout = timeoutFor(body.size());
   request.maximumResponseBytes = kMaximumAnswerBytes;
+  request.isBulk = true;
   // As with events: only internal builds may speak plain http.
   request.requiresHttps = !_isInternal;
   request.setHeader("Content-Type", "application/octet-stream");

@@ -36,9 +36,13 @@ void ReportingSessionConnectivityHelper::waitForRoom() { _window->waitForRoom();
 
 void ReportingSessionConnectivityHelper::postURLRequestWithCompletionHandler(HttpRequest request,
                                                                              HttpCompletion completion) {
-  _window->enter();
-  // Called or dropped, and by whatever path, it leaves the window once.
-  const std::shared_ptr<void> underWay(nullptr, [window = _window](void*) { window->leave(); });
+  // Called or dropped, and by whatever path, it leaves the window once. Bulk has a line of its own and bounds of its
+  // own: events need not wait for it.
+  std::shared_ptr<void> underWay;
+  if (!request.isBulk) {
+    _window->enter();
+    underWay = std::shared_ptr<void>(nullptr, [window = _window](void*) { window->leave(); });
+  }
   _stateQueue->async([self = shared_from_this(), request = std::move(request), underWay,
                       completion = std::move(completion)]() mutable {
     self->post(std::move(request),

@@ -35,6 +35,8 @@ struct HttpRequest {
   bool allowsCellularAccess = true;
   /// True: only https is spoken, whatever the address says.
   bool requiresHttps = true;
+  /// Large and patient: it stands in a line of its own, so that small requests to the same server go on beside it.
+  bool isBulk = false;
   /// Where this is less than what the session's configuration says, it is the bound for the answer.
   std::optional<std::size_t> maximumResponseBytes;
 

@@ -121,11 +121,16 @@ void CurlEngine::start(std::shared_ptr<CurlTask> task) {
 }
 
 void CurlEngine::enter(std::shared_ptr<CurlTask> task) {
-  auto& server = _servers[task->address().server];
+  auto& server = serverOf(*task);
   if (server.line.empty() && hasRoom(server)) return attempt(std::move(task));
   _lineExpires = std::min(_lineExpires, task->deadline());
   server.line.push_back(std::move(task));
   ++_inLine;
+}
+
+CurlEngine::Server& CurlEngine::serverOf(const CurlTask& task) {
+  const auto& name = task.address().server;
+  return _servers[task.request().isBulk ? name + " bulk" : name];
 }
 
 bool CurlEngine::hasRoom(const Server& server) const {
@@ -182,7 +187,7 @@ void CurlEngine::attempt(std::shared_ptr<CurlTask> task) {
     task->complete(outOfMemory(*task));
     return;
   }
-  ++_servers[task->address().server].running;
+  ++serverOf(*task).running;
   CURL* const key = easy.release();
   _running.emplace(key, std::move(transfer));
 }
@@ -208,7 +213,7 @@ void CurlEngine::finished(CURL* handle, CURLcode code) {
   const auto transfer = std::move(found->second);
   _running.erase(found);
   const auto task = transfer->task();
-  --_servers[task->address().server].running;
+  --serverOf(*task).running;
   const bool waits = task->configuration().waitsForConnectivity && transfer->failedForLackOfNetwork(code);
   const auto error = transfer->error(code);
   curl_multi_remove_handle(_multi.get(), handle);

@@ -67,6 +67,7 @@ class CurlEngine {
   [[nodiscard]] bool takeCommands(std::vector<Command>& into);
   void start(std::shared_ptr<CurlTask> task);
   void enter(std::shared_ptr<CurlTask> task);
+  [[nodiscard]] Server& serverOf(const CurlTask& task);
   [[nodiscard]] bool hasRoom(const Server& server) const;
   void serveLines();
   void expireLines();
@@ -88,7 +89,8 @@ class CurlEngine {
 
   // The thread's own.
   std::unordered_map<CURL*, std::unique_ptr<CurlTransfer>> _running;
-  /// By the server's name. The number of tasks that stand in line, and when the first of them may have to leave it.
+  /// By the server's name, for bulk with a word behind it. The number of tasks that stand in line, and when the first
+  /// of them may have to leave it.
   std::unordered_map<std::string, Server> _servers;
   std::size_t _inLine = 0;
   SteadyTime _lineExpires = SteadyTime::max();

@@ -316,6 +316,19 @@ TEST_F(HttpSessionTest, ATaskInLineEndsAtItsTimeout) {
   EXPECT_EQ(_server.requests().size(), 8U);
 }
 
+TEST_F(HttpSessionTest, BulkStandsInALineOfItsOwn) {
+  _server.setHandler([](const TlsTestServer::Request& request) {
+    return TlsTestServer::Response{.silent = request.target == "/bulk"};
+  });
+  auto bulk = request("/bulk");
+  bulk.isBulk = true;
+  for (int number = 0; number < 20; ++number) start(bulk, std::to_string(number));
+  ASSERT_TRUE(_server.waitForRequests(8));
+  EXPECT_FALSE(fetch(request("/small")).error);
+  EXPECT_EQ(_delegate->completed, 1);
+  EXPECT_EQ(_server.requests().size(), 9U) << "no more of the bulk either";
+}
+
 TEST_F(HttpSessionTest, TheEndOfTheServiceEndsTasksInLine) {
   _server.setResponse({.silent = true});
   for (int number = 0; number < 20; ++number) start(request(), std::to_string(number));
