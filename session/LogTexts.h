@@ -101,7 +101,7 @@ inline constexpr std::string_view kMessageLogUpload = "[uploadFileWithURL] Uploa
 inline constexpr std::string_view kUploadFailed = "uploadFileWithURL: File upload failed for %s";
 inline constexpr std::string_view kLogDataFailed = "uploadLogData: Log data array upload failed";
 inline constexpr std::string_view kTooManyUploads =
-    "uploadFileAtPath: session %u has %d uploads under way and takes no more";
+    "uploadFileAtPath: session %u takes no more: %d uploads of its own, or %d of all sessions, are under way";
 
 // What clients are told.
 inline constexpr std::string_view kReplyNoDisplayURL = "URL not available";

@@ -18,17 +18,28 @@ class UploadQueue {
   /// descriptor, or a megabyte of log data.
   static constexpr std::size_t kMaximumUploads = 16;
 
-  explicit UploadQueue(Scheduler& scheduler) : _scheduler(scheduler) {}
+  /// The same for the whole process: what sessions have taken outlives them, and a client may open another.
+  static constexpr std::size_t kMaximumUploadsOfAll = 64;
 
-  [[nodiscard]] bool isFull() const { return _underWay->load() >= kMaximumUploads; }
+  /// `ofAll` counts the uploads of all sessions.
+  UploadQueue(Scheduler& scheduler, std::shared_ptr<std::atomic<std::size_t>> ofAll)
+      : _scheduler(scheduler), _ofAll(std::move(ofAll)) {}
+
+  [[nodiscard]] bool isFull() const {
+    return _underWay->load() >= kMaximumUploads || _ofAll->load() >= kMaximumUploadsOfAll;
+  }
 
   /// Runs the upload behind those that were taken before.
   template <class Upload>
   void run(Upload upload) {
     if (!_queue) _queue = _scheduler.makeSerialQueue("com.tavrin.velkreportingd.uploads");
     ++*_underWay;
+    ++*_ofAll;
     // Run or dropped, it leaves once.
-    std::shared_ptr<void> place(nullptr, [underWay = _underWay](void*) { --*underWay; });
+    std::shared_ptr<void> place(nullptr, [underWay = _underWay, ofAll = _ofAll](void*) {
+      --*underWay;
+      --*ofAll;
+    });
     _queue->async([upload = std::move(upload), place = std::move(place)]() mutable { upload(); });
   }
 
@@ -44,6 +55,7 @@ class UploadQueue {
 
  private:
   Scheduler& _scheduler;
+  const std::shared_ptr<std::atomic<std::size_t>> _ofAll;
   std::shared_ptr<Queue> _queue;
   const std::shared_ptr<std::atomic<std::size_t>> _underWay = std::make_shared<std::atomic<std::size_t>>(0);
 };

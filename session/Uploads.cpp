@@ -74,7 +74,8 @@ void ClientSession::uploadFileWithURL(std::string url, std::string extensionToke
                                       UploadReply reply) {
   FileUpload upload{fileSystemPath(url), std::move(extensionToken), std::move(file)};
   if (_uploads.isFull()) {
-    log::error(session_texts::kTooManyUploads, sessionID(), UploadQueue::kMaximumUploads);
+    log::error(session_texts::kTooManyUploads, sessionID(), UploadQueue::kMaximumUploads,
+               UploadQueue::kMaximumUploadsOfAll);
     finishFileUpload(_services.messageLog, url, upload, false, reply);
     return;
   }
@@ -88,7 +89,8 @@ void ClientSession::uploadFileWithURL(std::string url, std::string extensionToke
 
 void ClientSession::uploadLogData(PropertyArray logData, LogDataReply reply) {
   if (_uploads.isFull()) {
-    log::error(session_texts::kTooManyUploads, sessionID(), UploadQueue::kMaximumUploads);
+    log::error(session_texts::kTooManyUploads, sessionID(), UploadQueue::kMaximumUploads,
+               UploadQueue::kMaximumUploadsOfAll);
     finishLogData(false, reply);
     return;
   }

@@ -125,10 +125,28 @@ TEST_F(UploadsTest, MoreThanItTakesIsRefusedAtOnce) {
   session->uploadLogData(numbers({1}), [&](bool taken, std::optional<Error>) { refused.push_back(taken); });
   EXPECT_EQ(refused, (std::vector<bool>{false, false}));
   EXPECT_EQ(recordedLog.count(log::Level::error, "uploadFileWithURL: File upload failed for /tmp/b"), 1);
-  EXPECT_EQ(recordedLog.count("uploadFileAtPath: session 7 has 16 uploads under way and takes no more"), 2);
+  EXPECT_EQ(
+      recordedLog.count(
+          "uploadFileAtPath: session 7 takes no more: 16 uploads of its own, or 64 of all sessions, are under way"),
+      2);
   fakes.scheduler.runUntilIdle();
   EXPECT_EQ(answers, static_cast<int>(UploadQueue::kMaximumUploads));
   EXPECT_EQ(uploadFile("file:///tmp/b"), true) << "there is room again";
+}
+
+TEST_F(UploadsTest, WhatEndedSessionsLeftBehindCountsForAll) {
+  prepareBackend = [](FakeBackend& each) { each.takesUploads = true; };
+  start({"splunk"});
+  leaveTwoUploadsBehind();
+  session->teardown();
+  EXPECT_EQ(*services.uploadsOfAll, 2U);
+  fakes.scheduler.runUntilIdle();
+  EXPECT_EQ(*services.uploadsOfAll, 0U);
+  *services.uploadsOfAll = UploadQueue::kMaximumUploadsOfAll;
+  start({"splunk"});
+  EXPECT_EQ(uploadFile("file:///tmp/b"), false);
+  *services.uploadsOfAll = 0;
+  EXPECT_EQ(uploadFile("file:///tmp/b"), true);
 }
 
 TEST_F(UploadsTest, SessionThatEndsKeepsItsTransportForWhatItLeavesBehind) {
