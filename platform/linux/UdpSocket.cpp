@@ -41,7 +41,20 @@ class ReadSourceState : public std::enable_shared_from_this<ReadSourceState> {
         _readable(std::move(readable)),
         _failed(std::move(failed)) {}
 
+  // By way of the queue: whoever makes the source there may go on to set its socket up before anybody else looks at it.
   void start() {
+    _queue->async([self = shared_from_this()] {
+      if (!self->_cancelled) self->watch();
+    });
+  }
+
+  void cancel() {
+    _cancelled = true;
+    _loop.post([self = shared_from_this()] { self->_watch.reset(); });
+  }
+
+ private:
+  void watch() {
     const auto fail = [self = shared_from_this()] {
       self->_queue->async([self] {
         if (!self->_cancelled) self->_failed();
@@ -60,12 +73,6 @@ class ReadSourceState : public std::enable_shared_from_this<ReadSourceState> {
     });
   }
 
-  void cancel() {
-    _cancelled = true;
-    _loop.post([self = shared_from_this()] { self->_watch.reset(); });
-  }
-
- private:
   /// On the loop's thread.
   void arm() {
     if (_cancelled || !_watch) return;
