@@ -28,9 +28,18 @@ class Examples : public ::testing::Test {
   std::optional<Daemon> daemon;
 };
 
+/// gcc's thread sanitizer does not know the locks of <threads.h>, and takes what they guard for races.
+constexpr bool kKnowsLocksOfC =
+#if defined(__SANITIZE_THREAD__)
+    false;
+#else
+    true;
+#endif
+
 TEST_F(Examples, ReportAnEvent) {
   std::size_t expected = 0;
   for (const auto& [program, language] : {std::pair("report_event_c", "C"), std::pair("report_event_cpp", "C++")}) {
+    if (!kKnowsLocksOfC && language == std::string("C")) continue;
     const Finished finished = runExample(program);
     EXPECT_EQ(finished.status, 0) << finished.errors;
     ASSERT_TRUE(server.waitForEvents(++expected, {101})) << program;
@@ -55,7 +64,7 @@ TEST_F(Examples, ReportAnEventFromPython) {
 
 TEST_F(Examples, SayWhatIsWrongWhenNoDaemonIsThere) {
   ASSERT_EQ(daemon->stop(), 0);
-  const Finished finished = runExample("report_event_c");
+  const Finished finished = runExample(kKnowsLocksOfC ? "report_event_c" : "report_event_cpp");
   EXPECT_EQ(finished.status, 1);
   EXPECT_NE(finished.errors.find("is velkreportingd running?"), std::string::npos) << finished.errors;
 }
