@@ -17,7 +17,7 @@ void ReportingQueue::release() {
   while (!_isHeld && !_waiting.empty()) {
     Task work = std::move(_waiting.front());
     _waiting.pop_front();
-    work();
+    if (work) work();
   }
 }
 
