@@ -1,5 +1,6 @@
 #include "foundation/Format.h"
 
+#include <algorithm>
 #include <charconv>
 #include <cinttypes>
 #include <cstdio>
@@ -207,33 +208,30 @@ void describe(const PropertyValue& value, std::string& out) {
   }
 }
 
-// Control characters, and the bytes with which those of UTF-8 and its line separators begin.
+// Control characters, and everything beyond ASCII: there are more of them, and bytes that are no text at all.
 bool mayNeedEscape(char character) noexcept {
   const auto byte = static_cast<unsigned char>(character);
-  return byte < 0x20 || byte == 0x7F || byte == 0xC2 || byte == 0xE2;
+  return byte < 0x20 || byte >= 0x7F;
 }
 
 // Appends the character at the beginning of `text`, escaped if it must be; answers how many of its bytes that took.
 std::size_t appendEscaped(std::string_view text, std::string& result) {
   const auto byte = static_cast<unsigned char>(text[0]);
-  const auto second = text.size() > 1 ? static_cast<unsigned char>(text[1]) : 0U;
+  const std::size_t length = utf8CharacterLength(text);
   char escape[8] = {};
-  std::size_t taken = 1;
   if (byte == '\n' || byte == '\t' || byte == '\r') {
     result += byte == '\n' ? "\\n" : byte == '\t' ? "\\t" : "\\r";
-  } else if (byte < 0x20 || byte == 0x7F) {
+  } else if (length == 0 || byte < 0x20 || byte == 0x7F) {
     std::snprintf(escape, sizeof(escape), "\\x%02x", byte);
   } else if (text.starts_with("\u2028") || text.starts_with("\u2029")) {
     result += text.starts_with("\u2028") ? "\\u2028" : "\\u2029";
-    taken = 3;
-  } else if (byte == 0xC2 && second >= 0x80 && second < 0xA0) {
-    std::snprintf(escape, sizeof(escape), "\\u%04x", second);
-    taken = 2;
+  } else if (byte == 0xC2 && static_cast<unsigned char>(text[1]) < 0xA0) {
+    std::snprintf(escape, sizeof(escape), "\\u%04x", static_cast<unsigned char>(text[1]));
   } else {
-    result += text[0];
+    result.append(text.substr(0, length));
   }
   result += escape;
-  return taken;
+  return std::max<std::size_t>(length, 1);
 }
 
 }  // namespace

@@ -61,8 +61,8 @@ class FormatArgument {
 /// as {"$date": seconds} and {"$data": "base64"}. A null pointer reads "(null)". A bare string is not quoted.
 [[nodiscard]] std::string description(const PropertyValue* value);
 
-/// `text` with each control character replaced by an escape (\n, \t, \x1b ...), so that it cannot begin a new
-/// line or steer a terminal. Line separators of Unicode are escaped as well.
+/// `text` with each control character, line separator of Unicode and byte that is no UTF-8 replaced by an escape (\n,
+/// \x1b, \xff ...), so that it cannot begin a new line or steer a terminal, and is text whatever it was.
 [[nodiscard]] std::string withoutControlCharacters(std::string_view text);
 
 }  // namespace velk

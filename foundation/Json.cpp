@@ -174,10 +174,12 @@ class ValueBuilder : public rapidjson::BaseReaderHandler<rapidjson::UTF8<>, Valu
   bool Bool(bool value) { return add(value); }
   /// Converted here: the reader's own conversion ends the process on some numbers far out of range.
   bool RawNumber(const char* text, rapidjson::SizeType length, bool) { return addNumber({text, length}); }
-  bool String(const char* text, rapidjson::SizeType length, bool) { return add(std::string(text, length)); }
+  bool String(const char* text, rapidjson::SizeType length, bool) {
+    return isText({text, length}) && add(std::string(text, length));
+  }
   bool Key(const char* text, rapidjson::SizeType length, bool) {
     _open.back().key.assign(text, length);
-    return true;
+    return isText(_open.back().key);
   }
   bool StartObject() { return open(PropertyValue(PropertyDictionary())); }
   bool StartArray() { return open(PropertyValue(PropertyArray())); }
@@ -187,12 +189,19 @@ class ValueBuilder : public rapidjson::BaseReaderHandler<rapidjson::UTF8<>, Valu
   PropertyValue take() { return std::move(_result); }
   [[nodiscard]] bool wasTooDeep() const { return _tooDeep; }
   [[nodiscard]] bool hadHugeNumber() const { return _hugeNumber; }
+  [[nodiscard]] bool hadLoneSurrogate() const { return _loneSurrogate; }
 
  private:
   struct Container {
     PropertyValue value;
     std::string key;
   };
+
+  /// The reader takes the escape of a surrogate's second half by itself, and makes bytes of it that are no UTF-8.
+  bool isText(std::string_view text) {
+    _loneSurrogate = !isUtf8(text);
+    return !_loneSurrogate;
+  }
 
   bool open(PropertyValue container) {
     _tooDeep = _open.size() >= kMaximumDepth;
@@ -253,6 +262,7 @@ class ValueBuilder : public rapidjson::BaseReaderHandler<rapidjson::UTF8<>, Valu
   PropertyValue _result;
   bool _tooDeep = false;
   bool _hugeNumber = false;
+  bool _loneSurrogate = false;
 };
 
 template <class Writer, class Value>
@@ -290,9 +300,10 @@ Result<PropertyValue> parse(std::string_view text, Extensions extensions) {
   constexpr unsigned kFlags = rapidjson::kParseNumbersAsStringsFlag | rapidjson::kParseIterativeFlag;
   const auto outcome = reader.Parse<kFlags>(stream, builder);
   if (outcome) return builder.take();
-  const std::string reason = builder.wasTooDeep()      ? "containers nest too deep"
-                             : builder.hadHugeNumber() ? "a number is too large"
-                                                       : rapidjson::GetParseError_En(outcome.Code());
+  const std::string reason = builder.wasTooDeep()         ? "containers nest too deep"
+                             : builder.hadHugeNumber()    ? "a number is too large"
+                             : builder.hadLoneSurrogate() ? "half of a surrogate pair stands alone"
+                                                          : rapidjson::GetParseError_En(outcome.Code());
   return failure("json", 2, reason + " (at byte " + std::to_string(outcome.Offset()) + ")");
 }
 

@@ -13,29 +13,6 @@ constexpr char lowered(char letter) noexcept {
 
 bool sameIgnoringCase(char left, char right) noexcept { return lowered(left) == lowered(right); }
 
-// Length of the well-formed sequence at `at`, 0 when it is not one.
-std::size_t sequenceLength(std::string_view text, std::size_t at) noexcept {
-  const auto byte = [&](std::size_t offset) { return static_cast<std::uint8_t>(text[at + offset]); };
-  const auto continues = [&](std::size_t offset) { return (byte(offset) & 0xC0U) == 0x80U; };
-  const std::size_t left = text.size() - at;
-  const std::uint8_t first = byte(0);
-  if (first < 0x80) return 1;
-  if (first >= 0xC2 && first <= 0xDF) return left >= 2 && continues(1) ? 2 : 0;
-  if (first >= 0xE0 && first <= 0xEF) {
-    if (left < 3 || !continues(1) || !continues(2)) return 0;
-    if (first == 0xE0 && byte(1) < 0xA0) return 0;  // overlong
-    if (first == 0xED && byte(1) > 0x9F) return 0;  // surrogate
-    return 3;
-  }
-  if (first >= 0xF0 && first <= 0xF4) {
-    if (left < 4 || !continues(1) || !continues(2) || !continues(3)) return 0;
-    if (first == 0xF0 && byte(1) < 0x90) return 0;  // overlong
-    if (first == 0xF4 && byte(1) > 0x8F) return 0;  // above U+10FFFF
-    return 4;
-  }
-  return 0;
-}
-
 }  // namespace
 
 std::vector<std::string_view> split(std::string_view text, char separator) {
@@ -63,6 +40,29 @@ bool containsIgnoringCase(std::string_view text, std::string_view part) noexcept
          part.empty();
 }
 
+std::size_t utf8CharacterLength(std::string_view text) noexcept {
+  if (text.empty()) return 0;
+  const auto byte = [&](std::size_t offset) { return static_cast<std::uint8_t>(text[offset]); };
+  const auto continues = [&](std::size_t offset) { return (byte(offset) & 0xC0U) == 0x80U; };
+  const std::size_t left = text.size();
+  const std::uint8_t first = byte(0);
+  if (first < 0x80) return 1;
+  if (first >= 0xC2 && first <= 0xDF) return left >= 2 && continues(1) ? 2 : 0;
+  if (first >= 0xE0 && first <= 0xEF) {
+    if (left < 3 || !continues(1) || !continues(2)) return 0;
+    if (first == 0xE0 && byte(1) < 0xA0) return 0;  // overlong
+    if (first == 0xED && byte(1) > 0x9F) return 0;  // surrogate
+    return 3;
+  }
+  if (first >= 0xF0 && first <= 0xF4) {
+    if (left < 4 || !continues(1) || !continues(2) || !continues(3)) return 0;
+    if (first == 0xF0 && byte(1) < 0x90) return 0;  // overlong
+    if (first == 0xF4 && byte(1) > 0x8F) return 0;  // above U+10FFFF
+    return 4;
+  }
+  return 0;
+}
+
 bool isUtf8(std::string_view text) noexcept {
   std::size_t at = 0;
   while (at < text.size()) {
@@ -70,11 +70,17 @@ bool isUtf8(std::string_view text) noexcept {
       ++at;
       continue;
     }
-    const std::size_t length = sequenceLength(text, at);
+    const std::size_t length = utf8CharacterLength(text.substr(at));
     if (length == 0) return false;
     at += length;
   }
   return true;
+}
+
+std::string_view utf8Prefix(std::string_view text, std::size_t most) noexcept {
+  if (text.size() <= most) return text;
+  while (most > 0 && (static_cast<std::uint8_t>(text[most]) & 0xC0U) == 0x80U) --most;
+  return text.substr(0, most);
 }
 
 std::size_t utf16Length(std::string_view text) noexcept {

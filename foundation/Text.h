@@ -21,6 +21,10 @@ namespace velk {
 
 /// Well-formed UTF-8 (RFC 3629): no overlong forms, no surrogates, nothing above U+10FFFF.
 [[nodiscard]] bool isUtf8(std::string_view text) noexcept;
+/// How many bytes the character takes with which `text` begins; 0 when it begins with none, or with no UTF-8.
+[[nodiscard]] std::size_t utf8CharacterLength(std::string_view text) noexcept;
+/// The first bytes of well-formed UTF-8, at most `most` of them, without a part of a character at their end.
+[[nodiscard]] std::string_view utf8Prefix(std::string_view text, std::size_t most) noexcept;
 /// How many UTF-16 code units well-formed UTF-8 takes.
 [[nodiscard]] std::size_t utf16Length(std::string_view text) noexcept;
 

@@ -15,7 +15,9 @@ constexpr std::uint64_t kTagOfDates = 1;
 }  // namespace
 
 CborWriter::CborWriter(std::vector<std::uint8_t>& out, std::size_t maximumBytes) noexcept
-    : _out(out), _end(out.size() + maximumBytes) {}
+    : _out(&out), _left(maximumBytes) {}
+
+CborWriter::CborWriter(std::size_t maximumBytes) noexcept : _out(nullptr), _left(maximumBytes) {}
 
 const char* CborWriter::description(Fault fault) noexcept {
   switch (fault) {
@@ -42,12 +44,14 @@ bool CborWriter::countEntry() noexcept {
 
 void CborWriter::payload(const void* data, std::size_t count) {
   if (_fault != Fault::none) return;
-  if (count > _end - _out.size()) {
+  if (count > _left) {
     _fault = Fault::tooLarge;
     return;
   }
+  _left -= count;
+  if (_out == nullptr) return;
   const auto* bytes = static_cast<const std::uint8_t*>(data);
-  _out.insert(_out.end(), bytes, bytes + count);
+  _out->insert(_out->end(), bytes, bytes + count);
 }
 
 template <class EncodeHead>

@@ -22,6 +22,8 @@ class CborWriter {
 
   /// At most `maximumBytes` are appended to `out`.
   CborWriter(std::vector<std::uint8_t>& out, std::size_t maximumBytes) noexcept;
+  /// Writes nothing and finds the same faults: whether a body could be written at all.
+  explicit CborWriter(std::size_t maximumBytes) noexcept;
 
   void beginArray(std::size_t count);
   void null();
@@ -64,8 +66,8 @@ class CborWriter {
   void textOf(std::string_view value);
   void payload(const void* data, std::size_t count);
 
-  std::vector<std::uint8_t>& _out;
-  const std::size_t _end;
+  std::vector<std::uint8_t>* const _out;
+  std::size_t _left;
   std::size_t _entries = 0;
   Fault _fault = Fault::none;
 };

@@ -61,7 +61,7 @@ void Connection::resume() { _core->resume(); }
 
 void Connection::invalidate() { _core->invalidate(); }
 
-void Connection::closeAfterSending() { _core->closeAfterSending(); }
+void Connection::closeAfterSending(Duration drainTime) { _core->closeAfterSending(drainTime); }
 
 Result<void> Connection::callMethod(std::uint32_t method, const PropertyArray& arguments, ReplyHandler reply,
                                     std::vector<FileDescriptor> descriptors) {
@@ -86,6 +86,11 @@ const std::shared_ptr<Queue>& Connection::deliveryQueue() const noexcept { retur
 Result<void> Connection::sendCall(std::uint32_t method, std::size_t argumentCount, ipc::BodyEncoder encode,
                                   std::vector<FileDescriptor> descriptors, ReplyHandler& reply) {
   return _core->sendCall(method, argumentCount, encode, std::move(descriptors), reply);
+}
+
+Result<void> Connection::sendFirmCall(std::uint32_t method, std::size_t argumentCount, ipc::BodyEncoder encode) {
+  ReplyHandler none;
+  return _core->sendCall(method, argumentCount, encode, {}, none, ipc::kMaximumOutboxBytesWithReplies);
 }
 
 }  // namespace velk

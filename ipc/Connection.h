@@ -157,8 +157,9 @@ class Connection {
   /// invalidation handler runs. Only posts: may be called under any lock.
   void invalidate();
   /// Ends the connection behind everything sent so far: nothing that was queued is lost, later calls are refused.
-  /// Frames received meanwhile still run; pending replies fail. The invalidation handler runs as above.
-  void closeAfterSending();
+  /// Frames received meanwhile still run; pending replies fail. The invalidation handler runs as above. A peer that
+  /// does not read is waited for as long as for one that is invalidated, or for `drainTime` if that is longer.
+  void closeAfterSending(Duration drainTime = {});
 
   /// Sends a call that wants no answer. Never blocks. The descriptors are taken in any case.
   template <class Encode>
@@ -166,6 +167,12 @@ class Connection {
                                   std::vector<FileDescriptor> descriptors = {}) {
     ReplyHandler none;
     return sendCall(method, argumentCount, ipc::BodyEncoder(encode), std::move(descriptors), none);
+  }
+  /// The same with the room that is kept for replies as well: for the few bytes that a peer must not miss although it
+  /// reads slowly.
+  template <class Encode>
+  [[nodiscard]] Result<void> sendFirmly(std::uint32_t method, std::size_t argumentCount, Encode&& encode) {
+    return sendFirmCall(method, argumentCount, ipc::BodyEncoder(encode));
   }
   /// Sends a call; `reply` runs exactly once on the delivery queue, with the answer or with an error, unless this
   /// returns an error: then it has been destroyed unrun.
@@ -202,6 +209,7 @@ class Connection {
  private:
   [[nodiscard]] Result<void> sendCall(std::uint32_t method, std::size_t argumentCount, ipc::BodyEncoder encode,
                                       std::vector<FileDescriptor> descriptors, ReplyHandler& reply);
+  [[nodiscard]] Result<void> sendFirmCall(std::uint32_t method, std::size_t argumentCount, ipc::BodyEncoder encode);
 
   const std::shared_ptr<ipc::ConnectionCore> _core;
 };

@@ -1,5 +1,6 @@
 #include "ipc/ConnectionCore.h"
 
+#include <algorithm>
 #include <string>
 
 #include "foundation/Text.h"
@@ -64,7 +65,7 @@ void ConnectionCore::invalidate() {
   queue->async([self = shared_from_this()] { self->endHere(); });
 }
 
-void ConnectionCore::closeAfterSending() {
+void ConnectionCore::closeAfterSending(Duration drainTime) {
   if (_fork.forked() || _closingHere.exchange(true)) return;
   _ended = true;
   bool wake = false;
@@ -74,7 +75,8 @@ void ConnectionCore::closeAfterSending() {
     wake = claimSenderLocked();
   }
   if (wake) wakeSender();
-  _loop.post([self = shared_from_this()] { self->closeWhenSent(); });
+  const auto longer = std::max<Duration>(drainTime, kDrainTime);
+  _loop.post([self = shared_from_this(), longer] { self->closeWhenSent(longer); });
   queue->async([self = shared_from_this()] {
     if (self->_reachedEnd) self->finish();
   });
@@ -116,7 +118,8 @@ void ConnectionCore::appendGoodbyeLocked() {
 }
 
 Result<void> ConnectionCore::sendCall(std::uint32_t method, std::size_t argumentCount, BodyEncoder encode,
-                                      std::vector<FileDescriptor> descriptors, ReplyHandler& reply) {
+                                      std::vector<FileDescriptor> descriptors, ReplyHandler& reply,
+                                      std::size_t outboxLimit) {
   if (_fork.forked()) return Failure(connectionError(ConnectionError::forked, "the connection belongs to the parent"));
   std::optional<Refusal> refusal = Refusal{ConnectionError::ended, "the connection has ended"};
   if (hasEnded()) return Failure(connectionError(refusal->code, refusal->text));
@@ -138,7 +141,7 @@ Result<void> ConnectionCore::sendCall(std::uint32_t method, std::size_t argument
         refusal = Refusal{ConnectionError::outboxFull, "too many calls wait for a reply"};
       } else {
         refusal = appendLocked({0, kProtocolVersion, FrameKind::call, 0, serial}, BodyEncoder(body), descriptors,
-                               kMaximumOutboxBytes);
+                               outboxLimit);
         if (refusal && serial != 0) reply = _pending.take(serial);
       }
       wake = claimSenderLocked();
@@ -176,7 +179,7 @@ void ConnectionCore::sendAnswer(FrameHeader header, BodyEncoder encode, bool pro
   {
     Guard guard(_lock);
     if (!_accepting || _sendFailed) return;
-    refusal = appendLocked(header, encode, none, 2 * kMaximumOutboxBytes);
+    refusal = appendLocked(header, encode, none, kMaximumOutboxBytesWithReplies);
     if (!refusal && deliveringCore == this && !prompt) {
       _answersWait = true;
     } else {

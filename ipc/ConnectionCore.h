@@ -10,6 +10,7 @@
 
 #include "ipc/Connection.h"
 #include "ipc/FrameReader.h"
+#include "ipc/Limits.h"
 #include "ipc/Outbox.h"
 #include "ipc/PendingReplies.h"
 #include "platform/EventLoop.h"
@@ -28,9 +29,10 @@ class ConnectionCore : public std::enable_shared_from_this<ConnectionCore> {
 
   void resume();
   void invalidate();
-  void closeAfterSending();
+  void closeAfterSending(Duration drainTime);
   [[nodiscard]] Result<void> sendCall(std::uint32_t method, std::size_t argumentCount, BodyEncoder encode,
-                                      std::vector<FileDescriptor> descriptors, ReplyHandler& reply);
+                                      std::vector<FileDescriptor> descriptors, ReplyHandler& reply,
+                                      std::size_t outboxLimit = kMaximumOutboxBytes);
   /// `prompt`: the method may go on for long after it has answered, so the answer must not wait for its end.
   void sendReply(std::uint64_t serial, std::size_t count, BodyEncoder encode, bool prompt);
   void sendErrorReply(std::uint64_t serial, const Error& error, bool prompt);
@@ -91,7 +93,7 @@ class ConnectionCore : public std::enable_shared_from_this<ConnectionCore> {
   void readingEnded(End end, const char* reason);
   [[nodiscard]] bool openWatch();
   void awaitWritable();
-  void closeWhenSent();
+  void closeWhenSent(Duration drainTime = kDrainTime);
   void closeNow();
 
   // On the loop's thread or the delivery queue, by whoever is the sender.
@@ -149,7 +151,8 @@ class ConnectionCore : public std::enable_shared_from_this<ConnectionCore> {
   bool _reading = false;
   bool _readingDone = false;
   bool _closed = false;
-  bool _closeTimerRuns = false;
+  /// The shortest that a timer was started for: it closes the socket, whatever is left to send.
+  Duration _drainTime = Duration::max();
 
   // Used by whoever is the sender.
   Outbox _sending;

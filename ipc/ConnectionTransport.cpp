@@ -190,7 +190,7 @@ void ConnectionCore::resumeDelivery() {
   if (_deliveryPaused.exchange(false)) queue->async([core = shared_from_this()] { core->deliver(); });
 }
 
-void ConnectionCore::closeWhenSent() {
+void ConnectionCore::closeWhenSent(Duration drainTime) {
   if (_closed) return;
   _closeWanted = true;
   bool idle = false;
@@ -201,8 +201,12 @@ void ConnectionCore::closeWhenSent() {
     idle = !send && _sender == Sender::nobody;
   }
   if (idle) return closeNow();
-  if (!std::exchange(_closeTimerRuns, true)) {
-    _loop.postAfter(kDrainTime, [self = shared_from_this()] { self->closeNow(); });
+  if (drainTime < _drainTime) {
+    _drainTime = drainTime;
+    // What is to be sent keeps this alive, not a timer that may be set for long.
+    _loop.postAfter(drainTime, [weak = weak_from_this()] {
+      if (const auto self = weak.lock()) self->closeNow();
+    });
   }
   if (send) pump(Sender::loop);
 }

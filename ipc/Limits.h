@@ -41,8 +41,12 @@ inline constexpr std::size_t kReceiveBytes = 64 * 1024;
 inline constexpr std::size_t kMaximumOutboxBytes = 2 * 1024 * 1024;
 
 /// Above this many bytes in the outbox no further call that wants a reply is run: a peer that does not read its
-/// replies is not served. Replies may use the outbox up to twice its size; a reply beyond that ends the connection.
+/// replies is not served.
 inline constexpr std::size_t kOutboxBytesToPauseCalls = 1024 * 1024;
+
+/// How far replies may use the outbox; a reply beyond that ends the connection. The end of aggregation may as well:
+/// some twenty bytes that an aggregator waits for, however slowly it reads.
+inline constexpr std::size_t kMaximumOutboxBytesWithReplies = 2 * kMaximumOutboxBytes;
 
 /// Calls of one connection that wait for a reply. A call beyond is refused with an error.
 inline constexpr std::size_t kMaximumPendingReplies = 65'536;
@@ -53,6 +57,10 @@ inline constexpr std::size_t kMaximumFramesPerTurn = 256;
 /// Open connections of one user: some hundred processes that report, with room to spare, and no more than a fraction
 /// of the descriptors that a daemon may have. Further ones are closed unread.
 inline constexpr std::size_t kMaximumConnectionsPerUser = 512;
+
+/// Bytes of a text that answers a call: the text of what was posted may be longer, and a part of it says more than an
+/// error. The rest of the frame is for what stands beside it.
+inline constexpr std::size_t kMaximumReplyTextBytes = kMaximumFrameBytes - 16 * 1024;
 
 /// Bytes of an error's text on the wire.
 inline constexpr std::size_t kMaximumErrorTextBytes = 4096;

@@ -1,4 +1,6 @@
+#include "foundation/Text.h"
 #include "ipc/ArgumentReader.h"
+#include "ipc/Limits.h"
 #include "ipc/MethodTable.h"
 #include "ipc/SessionProxies.h"
 #include "ipc/Vocabulary.h"
@@ -26,13 +28,19 @@ void writeError(CborWriter& writer, const std::optional<Error>& error) {
   writer.text(error->description);
 }
 
+void writeText(CborWriter& writer, const std::optional<std::string>& text) {
+  if (!text || text->size() <= ipc::kMaximumReplyTextBytes) return writer.optional(text);
+  const auto kept = utf8Prefix(*text, ipc::kMaximumReplyTextBytes);
+  writer.text(std::string(kept) + "\n(" + std::to_string(text->size() - kept.size()) + " more bytes are left out)");
+}
+
 // Typed completions over a reply. A call that wants no answer gives an absent one; a completion that is dropped
 // drops the reply, which then answers with an error.
 
 TextReply textReply(Reply& reply) {
   if (!reply) return nullptr;
   return [reply = std::move(reply)](const std::optional<std::string>& text) mutable {
-    reply.send(1, [&](CborWriter& writer) { writer.optional(text); });
+    reply.send(1, [&](CborWriter& writer) { writeText(writer, text); });
   };
 }
 
@@ -53,7 +61,7 @@ FlushReply flushReply(Reply& reply) {
   if (!reply) return nullptr;
   return [reply = std::move(reply)](const std::optional<std::string>& text, const std::optional<Error>& error) mutable {
     reply.send(2, [&](CborWriter& writer) {
-      writer.optional(text);
+      writeText(writer, text);
       writeError(writer, error);
     });
   };

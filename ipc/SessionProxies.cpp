@@ -211,7 +211,10 @@ Result<void> ReplyInterfaceProxy::sendMessageToClient(const std::optional<Proper
     writer.unsignedInteger(type);
     writer.optional(payload);
   };
-  return Connection(core).send(numberOf(Method::sendMessageToClient), 5, encode);
+  const auto method = numberOf(Method::sendMessageToClient);
+  // Events may be missed by a client that reads slowly, but not that there will be no more of them.
+  const bool isEnd = !sessionInfo && !payload && category == 0 && type == 0;
+  return isEnd ? Connection(core).sendFirmly(method, 5, encode) : Connection(core).send(method, 5, encode);
 }
 
 }  // namespace velk

@@ -68,7 +68,7 @@ class ReplyInterfaceProxy final {
  public:
   explicit ReplyInterfaceProxy(const std::shared_ptr<Connection>& connection) : _connection(connection->core()) {}
   /// The error says why the event is not on its way: the connection has ended, its outbox is full, the event is larger
-  /// than a frame.
+  /// than a frame. The end of aggregation (nothing in any argument) fits into an outbox that takes no more events.
   [[nodiscard]] Result<void> sendMessageToClient(const std::optional<PropertyDictionary>& sessionInfo, double timestamp,
                                                  std::uint16_t category, std::uint16_t type,
                                                  const std::optional<PropertyDictionary>& payload);

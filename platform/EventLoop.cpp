@@ -1,7 +1,8 @@
 #include "platform/EventLoop.h"
 
 #include <asio/post.hpp>
-#include <exception>
+#include <cerrno>
+#include <system_error>
 
 #include "platform/EventLoopState.h"
 #include "platform/Log.h"
@@ -20,24 +21,37 @@ bool EventLoop::State::isCurrent() const noexcept { return loopOfThread == this;
 bool EventLoop::State::tryPost(Task& task) {
   if (forked()) return false;
   Guard guard(_lock);
-  if (_stopped || !startLocked()) return false;
+  if (!startLocked()) return false;
   _posted.push_back(std::move(task));
-  if (!std::exchange(_drainScheduled, true)) asio::post(_io, [this] { drain(); });
+  if (!std::exchange(_drainScheduled, true)) asio::post(_io->context, [this] { drain(); });
   return true;
 }
 
-bool EventLoop::State::startLocked() {
-  if (_started) return true;
+Result<void> EventLoop::State::start() {
+  if (forked()) return failure("EventLoop", EPERM, "it belongs to the process that this one was forked from");
+  Guard guard(_lock);
+  return startLocked();
+}
+
+Result<void> EventLoop::State::startLocked() {
+  if (_stopped) return failure("EventLoop", ECANCELED, "it was stopped");
+  if (_started) return {};
+  try {
+    if (!_io) _io.emplace();
+  } catch (const std::system_error& error) {
+    return failure("EventLoop", error.code().value(), error.what());
+  }
   auto started = startThread(_threadName, [self = shared_from_this()] { self->run(); });
-  if (started) _thread = std::move(*started);
-  _started = started.has_value();
-  return _started;
+  if (!started) return Failure(started.error());
+  _thread = std::move(*started);
+  _started = true;
+  return {};
 }
 
 void EventLoop::State::run() {
   loopOfThread = this;
-  const auto work = asio::make_work_guard(_io);
-  _io.run();
+  const auto work = asio::make_work_guard(_io->context);
+  _io->context.run();
   dropEverything();
   loopOfThread = nullptr;
 }
@@ -55,10 +69,10 @@ void EventLoop::State::drain() {
   _running.clear();
   Guard guard(_lock);
   if (!_posted.empty()) {
-    asio::post(_io, [this] { drain(); });
+    asio::post(_io->context, [this] { drain(); });
   } else {
     _drainScheduled = false;
-    if (_stopped) _io.stop();
+    if (_stopped) _io->context.stop();
   }
 }
 
@@ -67,7 +81,7 @@ void EventLoop::State::stop() {
   {
     Guard guard(_lock);
     if (!std::exchange(_stopped, true) && _started && !std::exchange(_drainScheduled, true)) {
-      asio::post(_io, [this] { drain(); });
+      asio::post(_io->context, [this] { drain(); });
     }
     ended = std::move(_thread);
   }
@@ -108,8 +122,8 @@ void EventLoop::State::armTimer() {
   }
   if (!wake || (_armedFor && *_armedFor <= *wake)) return;
   _armedFor = wake;
-  _timer.expires_at(*wake);
-  _timer.async_wait([this](const std::error_code& error) {
+  _io->timer.expires_at(*wake);
+  _io->timer.async_wait([this](const std::error_code& error) {
     if (!error) fireTimer();
   });
 }
@@ -137,6 +151,8 @@ void EventLoop::postAfter(Duration delay, Task task) {
 }
 
 bool EventLoop::isCurrent() const noexcept { return _state->isCurrent(); }
+
+Result<void> EventLoop::start() { return _state->start(); }
 
 void EventLoop::stop() {
   if (!_state->forked()) _state->stop();

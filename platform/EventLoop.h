@@ -6,6 +6,7 @@
 #include <string>
 #include <string_view>
 
+#include "foundation/Error.h"
 #include "platform/Queue.h"
 
 namespace velk {
@@ -42,6 +43,10 @@ class EventLoop final : public Scheduler {
   void post(Task task);
   /// As `post`, after `delay`; dropped when the loop is stopped before.
   void postAfter(Duration delay, Task task);
+
+  /// Has the thread started now, by those who must know beforehand that what they post will run. An error, and nothing
+  /// is lost by trying again, when the system gives no thread or no descriptors.
+  [[nodiscard]] Result<void> start();
 
   /// True on the loop's own thread.
   [[nodiscard]] bool isCurrent() const noexcept;

@@ -5,6 +5,7 @@
 #include <asio/io_context.hpp>
 #include <asio/steady_timer.hpp>
 #include <memory>
+#include <optional>
 #include <string>
 #include <thread>
 #include <vector>
@@ -25,6 +26,7 @@ class EventLoop::State final : public TimerService, public std::enable_shared_fr
 
   /// False, and `task` untouched, when it will never run.
   [[nodiscard]] bool tryPost(Task& task);
+  [[nodiscard]] Result<void> start();
   void stop();
   [[nodiscard]] bool isCurrent() const noexcept;
   [[nodiscard]] bool forked() const noexcept { return _fork.forked(); }
@@ -35,12 +37,19 @@ class EventLoop::State final : public TimerService, public std::enable_shared_fr
   [[nodiscard]] SteadyTime now() const override { return std::chrono::steady_clock::now(); }
 
   // On the loop's thread only.
-  [[nodiscard]] asio::io_context& io() noexcept { return _io; }
+  [[nodiscard]] asio::io_context& io() noexcept { return _io->context; }
   void enlist(LoopWatchState* watch) { _watches.push_back(watch); }
   void forget(LoopWatchState* watch);
 
  private:
-  bool startLocked() VELK_REQUIRES(_lock);
+  /// What waits for sockets and deadlines: it takes descriptors, so it is made with the thread.
+  struct Io {
+    Io() : context(1), timer(context) {}
+    asio::io_context context;
+    asio::steady_timer timer;
+  };
+
+  [[nodiscard]] Result<void> startLocked() VELK_REQUIRES(_lock);
   void run();
   void drain();
   void dropEverything();
@@ -50,10 +59,10 @@ class EventLoop::State final : public TimerService, public std::enable_shared_fr
   // Constant after construction, or self-synchronised.
   const std::string _threadName;
   const ForkGuard _fork;
-  asio::io_context _io{1};
+  /// Constant once started.
+  std::optional<Io> _io;
 
   // Used on the loop's thread only.
-  asio::steady_timer _timer{_io};
   std::optional<SteadyTime> _armedFor;
   std::vector<Task> _running;
   std::vector<LoopWatchState*> _watches;

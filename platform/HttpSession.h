@@ -117,6 +117,9 @@ class HttpSessionService {
   virtual ~HttpSessionService() = default;
   /// Ends all tasks, whose delegates hear an error, and makes no more. Blocks until that is under way; idempotent.
   virtual void stop() {}
+  /// Ends the tasks of all bulk requests, wherever they are, and those that are still to come: their delegates hear an
+  /// error. All others go on. For the end of the process, which waits for no more of them. Only posts.
+  virtual void endBulk() {}
   [[nodiscard]] virtual std::shared_ptr<HttpSession> makeSession(HttpSessionConfiguration configuration,
                                                                  std::shared_ptr<HttpSessionDelegate> delegate,
                                                                  std::shared_ptr<Queue> delegateQueue) = 0;

@@ -42,6 +42,7 @@ SerialQueueCore::SerialQueueCore(std::shared_ptr<QueueRunner> runner, std::strin
     : _runner(std::move(runner)), _label(std::move(label)), _shortName(lastComponent(_label)) {}
 
 void SerialQueueCore::async(Task task) {
+  if (_fork.forked()) return;
   {
     Guard guard(_lock);
     _incoming.push_back(std::move(task));
@@ -51,7 +52,7 @@ void SerialQueueCore::async(Task task) {
 }
 
 void SerialQueueCore::runSync(void (*work)(void*), void* context) noexcept {
-  if (CurrentQueueScope::contains(this)) return work(context);
+  if (CurrentQueueScope::contains(this) || _fork.forked()) return work(context);
   const auto self = shared_from_this();  // `work` may drop the queue's last reference.
   Waiter waiter;
   bool waits = false;
@@ -80,7 +81,7 @@ void SerialQueueCore::runTurn() noexcept {
 }
 
 /// False when there is none: the queue has become idle, and is no longer the caller's.
-bool SerialQueueCore::nextIsReady() { return _next < _batch.size() || takesBatch(); }
+bool SerialQueueCore::nextIsReady() { return !_fork.forked() && (_next < _batch.size() || takesBatch()); }
 
 bool SerialQueueCore::takesBatch() {
   _batch.clear();

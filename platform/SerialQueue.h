@@ -7,6 +7,7 @@
 #include <string_view>
 #include <vector>
 
+#include "platform/Fork.h"
 #include "platform/Lock.h"
 #include "platform/Queue.h"
 #include "platform/Semaphore.h"
@@ -34,6 +35,7 @@ class QueueRunner {
 ///     idle --sync---> caller --work done--> idle, or runner if tasks came meanwhile
 ///     runner --a sync is next in order--> the caller that waits for it
 ///
+/// In a forked child it locks nothing and runs no more than the task that forked: see ThreadPool.
 class SerialQueueCore : public std::enable_shared_from_this<SerialQueueCore> {
  public:
   SerialQueueCore(std::shared_ptr<QueueRunner> runner, std::string label);
@@ -65,6 +67,7 @@ class SerialQueueCore : public std::enable_shared_from_this<SerialQueueCore> {
   const std::shared_ptr<QueueRunner> _runner;
   const std::string _label;
   const std::string_view _shortName;
+  const ForkGuard _fork;
 
   // The owner's: tasks taken from `_incoming`, the first one that has not run, and who is to own the queue next.
   Tasks _batch;

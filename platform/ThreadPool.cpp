@@ -24,7 +24,10 @@ namespace {
 /// The pool's threads and the queues that wait for one. Its counts are exact: whoever wakes or starts a thread counts
 /// it as running at once. What holds whenever nobody has the lock: while queues wait, `runningThreads` threads run,
 /// or all that may exist do, or (with emergency threads) at least one does.
-class PoolCore final : public QueueRunner, public BlockingObserver {
+///
+/// A task may fork. The child has that task's thread alone, and perhaps the lock as another thread held it: there the
+/// pool does nothing, and the thread ends with its task.
+class PoolCore final : public QueueRunner, public BlockingObserver, public std::enable_shared_from_this<PoolCore> {
  public:
   explicit PoolCore(const ThreadPoolOptions& options)
       : _runningThreads(options.runningThreads != 0 ? options.runningThreads
@@ -32,7 +35,8 @@ class PoolCore final : public QueueRunner, public BlockingObserver {
         _maximumThreads(std::max<std::size_t>(options.maximumThreads, 1)),
         _maximumWhenBlocked(_maximumThreads + options.emergencyThreads),
         _idleThreadLifetime(options.idleThreadLifetime),
-        _isNeverStopped(options.isNeverStopped) {}
+        _isNeverStopped(options.isNeverStopped),
+        _retryLater(options.retryLater) {}
 
   bool schedule(std::shared_ptr<SerialQueueCore> queue) override;
   bool yield(const std::shared_ptr<SerialQueueCore>& queue) override;
@@ -53,6 +57,7 @@ class PoolCore final : public QueueRunner, public BlockingObserver {
   bool wakesOneLocked() VELK_REQUIRES(_lock);
   std::shared_ptr<SerialQueueCore> waitUntilIdle();
   void startOne();
+  void retryStarting();
   void work();
   std::shared_ptr<SerialQueueCore> nextQueue();
   bool parksLocked() VELK_REQUIRES(_lock);
@@ -64,6 +69,8 @@ class PoolCore final : public QueueRunner, public BlockingObserver {
   const std::size_t _maximumWhenBlocked;
   const Duration _idleThreadLifetime;
   const bool _isNeverStopped;
+  const std::function<void(Task)> _retryLater;
+  const ForkGuard _fork;
 
   // Guarded by _lock, under which nobody is called.
   mutable Lock _lock;
@@ -76,6 +83,7 @@ class PoolCore final : public QueueRunner, public BlockingObserver {
   /// Counted, but not in `_threads` yet.
   std::size_t _starting VELK_GUARDED_BY(_lock) = 0;
   bool _refused VELK_GUARDED_BY(_lock) = false;
+  bool _retryIsDue VELK_GUARDED_BY(_lock) = false;
   std::vector<std::thread> _threads VELK_GUARDED_BY(_lock);
   /// Ended, but not joined: by the next thread that ends, or by `stop`.
   std::vector<std::thread> _ended VELK_GUARDED_BY(_lock);
@@ -86,6 +94,7 @@ class PoolCore final : public QueueRunner, public BlockingObserver {
 thread_local const PoolCore* currentPool = nullptr;
 
 bool PoolCore::schedule(std::shared_ptr<SerialQueueCore> queue) {
+  if (_fork.forked()) return false;
   bool starts = false;
   {
     Guard guard(_lock);
@@ -98,6 +107,7 @@ bool PoolCore::schedule(std::shared_ptr<SerialQueueCore> queue) {
 }
 
 bool PoolCore::yield(const std::shared_ptr<SerialQueueCore>& queue) {
+  if (_fork.forked()) return true;  // nobody runs it: the thread is to end
   Guard guard(_lock);
   if (_ready.empty() && _running <= _runningThreads) return false;
   _ready.push_back(queue);
@@ -105,6 +115,7 @@ bool PoolCore::yield(const std::shared_ptr<SerialQueueCore>& queue) {
 }
 
 void PoolCore::willBlock() noexcept {
+  if (_fork.forked()) return;
   bool starts = false;
   {
     Guard guard(_lock);
@@ -115,6 +126,7 @@ void PoolCore::willBlock() noexcept {
 }
 
 void PoolCore::didBlock() noexcept {
+  if (_fork.forked()) return;
   Guard guard(_lock);
   ++_running;
 }
@@ -142,6 +154,7 @@ bool PoolCore::wakesOneLocked() {
 void PoolCore::startOne() {
   auto started = startThread("pool", [this] { work(); });
   bool isNews = false;
+  bool needsRetry = false;
   {
     Guard guard(_lock);
     --_starting;
@@ -151,10 +164,26 @@ void PoolCore::startOne() {
     } else {
       --_total;
       --_running;
+      needsRetry = _retryLater && !_ready.empty() && !std::exchange(_retryIsDue, true);
     }
     _becameIdle.notifyAll();
   }
   if (!started && isNews) log::error("Failed to start a thread: %@", started.error());
+  if (!needsRetry) return;
+  _retryLater([weak = weak_from_this()] {
+    if (const auto self = weak.lock()) self->retryStarting();
+  });
+}
+
+void PoolCore::retryStarting() {
+  if (_fork.forked()) return;
+  bool starts = false;
+  {
+    Guard guard(_lock);
+    _retryIsDue = false;
+    starts = !_ready.empty() && wakesOneLocked();
+  }
+  if (starts) startOne();
 }
 
 void PoolCore::work() {
@@ -171,6 +200,7 @@ void PoolCore::work() {
 
 /// The next queue to run, once there is one and the thread may run. Null: the thread is to end, and counts no more.
 std::shared_ptr<SerialQueueCore> PoolCore::nextQueue() {
+  if (_fork.forked()) return nullptr;
   Guard guard(_lock);
   for (;;) {
     if (!_ready.empty() && _running <= _runningThreads) {
@@ -200,6 +230,7 @@ bool PoolCore::parksLocked() {
 }
 
 void PoolCore::endThread() {
+  if (_fork.forked()) return;
   std::vector<std::thread> ended;
   {
     Guard guard(_lock);
@@ -251,6 +282,7 @@ std::shared_ptr<SerialQueueCore> PoolCore::waitUntilIdle() {
 }
 
 std::size_t PoolCore::threadCount() const {
+  if (_fork.forked()) return 0;
   Guard guard(_lock);
   return _total;
 }

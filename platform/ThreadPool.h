@@ -2,6 +2,7 @@
 #pragma once
 
 #include <cstddef>
+#include <functional>
 #include <memory>
 
 #include "platform/Queue.h"
@@ -21,10 +22,17 @@ struct ThreadPoolOptions {
   Duration idleThreadLifetime = std::chrono::seconds(5);
   /// Nobody will stop the pool: a thread that ends leaves nothing behind that `stop` would wait for.
   bool isNeverStopped = false;
+  /// Runs a task a moment later, on a thread that is none of the pool's: for the next attempt when the system refuses a
+  /// thread and work waits. Without it that work waits for the next task, or for a thread that becomes free.
+  std::function<void(Task)> retryLater;
 };
 
 /// Starts no thread before there is work. `stop` runs what was handed over, drops delayed work, joins all threads;
-/// it blocks, must not be called from a task, and is called by the destructor. In a forked child it does nothing.
+/// it blocks, must not be called from a task, and is called by the destructor.
+///
+/// In a forked child a pool of the parent's does nothing: tasks are destroyed unrun, `sync` runs its work at once, and
+/// nothing is locked, so that a task may fork, and its child may wait, or use a pool of its own. Where the child
+/// returns from such a task, its only thread ends, and with it the process.
 class ThreadPool : public Scheduler {
  public:
   virtual void stop() = 0;

@@ -10,6 +10,7 @@ namespace velk {
 SteadyTime TimerThread::now() const { return systemClock().steadyTime(); }
 
 TimerSchedule::Identifier TimerThread::add(SteadyTime deadline, Duration leeway, TimerSchedule::Action action) {
+  if (_fork.forked()) return 0;
   Guard guard(_lock);
   if (_stopped) return 0;
   const auto before = _schedule.nextWake();
@@ -20,6 +21,7 @@ TimerSchedule::Identifier TimerThread::add(SteadyTime deadline, Duration leeway,
 }
 
 void TimerThread::remove(TimerSchedule::Identifier identifier) {
+  if (_fork.forked()) return;
   // The thread is not told: it wakes once for nothing at worst, which is cheaper than waking it for every removal.
   TimerSchedule::Action dropped;
   Guard guard(_lock);
@@ -27,6 +29,7 @@ void TimerThread::remove(TimerSchedule::Identifier identifier) {
 }
 
 void TimerThread::stop() {
+  if (_fork.forked()) return;
   std::vector<TimerSchedule::Action> dropped;
   std::thread thread;
   {

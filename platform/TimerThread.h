@@ -3,6 +3,7 @@
 
 #include <thread>
 
+#include "platform/Fork.h"
 #include "platform/Lock.h"
 #include "platform/TimerSchedule.h"
 
@@ -10,6 +11,7 @@ namespace velk {
 
 /// Starts its thread with the first deadline; from then on that sleeps until the next one, and without one for ever.
 /// Actions run on it and must only post. `stop` (by the owner, once, from elsewhere) drops what waits and joins it.
+/// In a forked child nothing is taken, dropped or locked.
 class TimerThread final : public TimerService {
  public:
   TimerThread() = default;
@@ -23,6 +25,8 @@ class TimerThread final : public TimerService {
  private:
   void run();
   void startLocked() VELK_REQUIRES(_lock);
+
+  const ForkGuard _fork;
 
   // Guarded by _lock, which is innermost.
   Lock _lock;

@@ -17,6 +17,9 @@ class UnnamedFile {
   /// In the file system of that directory, readable by this process alone. Creates the directory if need be.
   [[nodiscard]] static Result<std::unique_ptr<UnnamedFile>> make(const std::string& directory);
 
+  /// A file that is open already, whatever becomes of its name: its first `size` bytes.
+  [[nodiscard]] static std::shared_ptr<const UnnamedFile> adopt(FileDescriptor file, std::uint64_t size);
+
   /// Fails when there is no room.
   [[nodiscard]] Result<void> append(std::span<const std::uint8_t> bytes);
 
@@ -24,10 +27,10 @@ class UnnamedFile {
   [[nodiscard]] std::uint64_t size() const noexcept { return _size; }
 
  private:
-  explicit UnnamedFile(FileDescriptor file) : _file(std::move(file)) {}
+  explicit UnnamedFile(FileDescriptor file, std::uint64_t size = 0) : _file(std::move(file)), _size(size) {}
 
   const FileDescriptor _file;
-  std::uint64_t _size = 0;
+  std::uint64_t _size;
 };
 
 }  // namespace velk

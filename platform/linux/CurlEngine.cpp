@@ -16,6 +16,10 @@ constexpr Duration kConnectionLinger = std::chrono::seconds(60);
 /// forgets requests that wait for a connection now and then, until they time out.
 constexpr std::size_t kMaximumRequestsPerServer = 8;
 constexpr std::size_t kMaximumRequests = 64;
+/// Beside those: uploads may take an hour each.
+constexpr std::size_t kMaximumBulkRequests = 24;
+/// With the first request to each server that has none under way.
+constexpr std::size_t kMaximumRequestsWithFirstOnes = 256;
 constexpr long kMaximumIdleConnections = 16;
 constexpr std::size_t kMaximumSpareHandles = 4;
 
@@ -53,6 +57,12 @@ void CurlEngine::submit(std::shared_ptr<CurlTask> task) {
 // A task whose engine has gone was completed by it.
 void CurlEngine::unpause(std::shared_ptr<CurlTask> task) { (void)handOver({std::move(task), false}); }
 
+void CurlEngine::endBulk() {
+  Guard guard(_lock);
+  _bulkEnded = true;
+  if (_started && !_stopping) curl_multi_wakeup(_multi.get());
+}
+
 bool CurlEngine::handOver(Command command) {
   Guard guard(_lock);
   if (_stopping || (!_started && !startThreadLocked())) return false;
@@ -86,6 +96,7 @@ void CurlEngine::stop() {
 void CurlEngine::run() {
   std::vector<Command> commands;
   while (takeCommands(commands)) {
+    dropEndedBulk();
     for (auto& command : commands) {
       if (command.isStart) {
         start(std::move(command.task));
@@ -115,6 +126,7 @@ bool CurlEngine::takeCommands(std::vector<Command>& into) {
 }
 
 void CurlEngine::start(std::shared_ptr<CurlTask> task) {
+  if (_bulkDropped && task->request().isBulk) return task->complete(ended(*task));
   _mayHaveConnections = true;
   _idleSince = now();
   enter(std::move(task));
@@ -124,39 +136,51 @@ void CurlEngine::enter(std::shared_ptr<CurlTask> task) {
   auto& server = serverOf(*task);
   if (server.line.empty() && hasRoom(server)) return attempt(std::move(task));
   _lineExpires = std::min(_lineExpires, task->deadline());
-  server.line.push_back(std::move(task));
-  ++_inLine;
+  server.line.push_back({++_lastInLine, std::move(task)});
 }
 
 CurlEngine::Server& CurlEngine::serverOf(const CurlTask& task) {
   const auto& name = task.address().server;
-  return _servers[task.request().isBulk ? name + " bulk" : name];
+  const bool isBulk = task.request().isBulk;
+  auto& server = _servers[isBulk ? name + " bulk" : name];
+  server.isBulk = isBulk;
+  return server;
 }
 
+/// Servers that are slow to answer keep what they have; whoever has nothing yet gets a first request beside them.
 bool CurlEngine::hasRoom(const Server& server) const {
-  return server.running < kMaximumRequestsPerServer && _running.size() < kMaximumRequests;
+  if (server.running == 0) return _running.size() < kMaximumRequestsWithFirstOnes;
+  if (server.running >= kMaximumRequestsPerServer) return false;
+  return server.isBulk ? _bulkRunning < kMaximumBulkRequests : _running.size() - _bulkRunning < kMaximumRequests;
 }
 
 /// Lets those in line go on where others have finished, and forgets servers that nobody talks to.
 void CurlEngine::serveLines() {
   if (_lineExpires <= now()) expireLines();
-  for (auto& [name, server] : _servers) {
-    while (!server.line.empty() && hasRoom(server)) {
-      auto task = std::move(server.line.front());
-      server.line.pop_front();
-      --_inLine;
-      attempt(std::move(task));
-    }
+  while (auto* server = nextToServe()) {
+    auto task = std::move(server->line.front().task);
+    server->line.pop_front();
+    attempt(std::move(task));
   }
-  if (_inLine == 0) _lineExpires = SteadyTime::max();
   std::erase_if(_servers, [](const auto& entry) { return entry.second.running == 0 && entry.second.line.empty(); });
+}
+
+/// Of those servers for which there is room the one for which somebody has waited for longest.
+CurlEngine::Server* CurlEngine::nextToServe() {
+  Server* next = nullptr;
+  for (auto& [name, server] : _servers) {
+    if (server.line.empty() || !hasRoom(server)) continue;
+    if (next == nullptr || server.line.front().number < next->line.front().number) next = &server;
+  }
+  return next;
 }
 
 void CurlEngine::expireLines() {
   const auto time = now();
   _lineExpires = SteadyTime::max();
   for (auto& [name, server] : _servers) {
-    _inLine -= std::erase_if(server.line, [&](const auto& task) {
+    std::erase_if(server.line, [&](const InLine& inLine) {
+      const auto& task = inLine.task;
       if (task->deadline() > time) {
         _lineExpires = std::min(_lineExpires, task->deadline());
         return false;
@@ -187,9 +211,16 @@ void CurlEngine::attempt(std::shared_ptr<CurlTask> task) {
     task->complete(outOfMemory(*task));
     return;
   }
-  ++serverOf(*task).running;
+  countRunning(*task, true);
   CURL* const key = easy.release();
   _running.emplace(key, std::move(transfer));
+}
+
+void CurlEngine::countRunning(const CurlTask& task, bool starts) {
+  auto& server = serverOf(task);
+  const auto count = [starts](std::size_t& number) { starts ? ++number : --number; };
+  count(server.running);
+  if (server.isBulk) count(_bulkRunning);
 }
 
 void CurlEngine::resumePaused(const CurlTask& task) {
@@ -213,7 +244,7 @@ void CurlEngine::finished(CURL* handle, CURLcode code) {
   const auto transfer = std::move(found->second);
   _running.erase(found);
   const auto task = transfer->task();
-  --serverOf(*task).running;
+  countRunning(*task, false);
   const bool waits = task->configuration().waitsForConnectivity && transfer->failedForLackOfNetwork(code);
   const auto error = transfer->error(code);
   curl_multi_remove_handle(_multi.get(), handle);
@@ -279,6 +310,30 @@ void CurlEngine::forgetConnections() {
   curl_multi_setopt(_multi.get(), CURLMOPT_MAXCONNECTS, kMaximumIdleConnections);
 }
 
+/// Once: what comes later does not start.
+void CurlEngine::dropEndedBulk() {
+  if (!_bulkEnded || std::exchange(_bulkDropped, true)) return;
+  const auto dropped = [](const std::shared_ptr<CurlTask>& task) {
+    if (!task->request().isBulk) return false;
+    task->complete(ended(*task));
+    return true;
+  };
+  for (auto running = _running.begin(); running != _running.end();) {
+    if (!dropped(running->second->task())) {
+      ++running;
+      continue;
+    }
+    countRunning(*running->second->task(), false);
+    curl_multi_remove_handle(_multi.get(), running->first);
+    giveEasyBack(Easy(running->first));
+    running = _running.erase(running);
+  }
+  std::erase_if(_waiting, dropped);
+  for (auto& [name, server] : _servers) {
+    std::erase_if(server.line, [&](const InLine& inLine) { return dropped(inLine.task); });
+  }
+}
+
 void CurlEngine::endAll() {
   for (auto& [easy, transfer] : _running) {
     curl_multi_remove_handle(_multi.get(), easy);
@@ -288,7 +343,7 @@ void CurlEngine::endAll() {
   _running.clear();
   for (const auto& task : std::exchange(_waiting, {})) task->complete(ended(*task));
   for (const auto& [name, server] : std::exchange(_servers, {})) {
-    for (const auto& task : server.line) task->complete(ended(*task));
+    for (const auto& inLine : server.line) inLine.task->complete(ended(*inLine.task));
   }
   std::vector<Command> commands;
   {

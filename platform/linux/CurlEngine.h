@@ -4,6 +4,8 @@
 
 #include <curl/curl.h>
 
+#include <atomic>
+#include <cstdint>
 #include <deque>
 #include <memory>
 #include <string>
@@ -35,6 +37,8 @@ class CurlEngine {
   void submit(std::shared_ptr<CurlTask> task);
   /// The task's delegate has caught up with the data: the transfer may go on.
   void unpause(std::shared_ptr<CurlTask> task);
+  /// Ends every bulk task with an error, those that are submitted later as well.
+  void endBulk();
   /// Ends every task with an error, and the thread. Blocks until it is gone; idempotent; not on the thread itself.
   void stop();
 
@@ -52,10 +56,16 @@ class CurlEngine {
   using Easy = std::unique_ptr<CURL, EasyFreer>;
   using Multi = std::unique_ptr<CURLM, MultiFreer>;
 
+  struct InLine {
+    /// The smaller, the longer it has waited.
+    std::uint64_t number;
+    std::shared_ptr<CurlTask> task;
+  };
   /// What goes to one server: so much is sent at once, the rest stands in line.
   struct Server {
+    bool isBulk = false;
     std::size_t running = 0;
-    std::deque<std::shared_ptr<CurlTask>> line;
+    std::deque<InLine> line;
   };
 
   /// Hands a command to the thread; gives it back when the thread is (or cannot be) there no more.
@@ -70,13 +80,16 @@ class CurlEngine {
   [[nodiscard]] Server& serverOf(const CurlTask& task);
   [[nodiscard]] bool hasRoom(const Server& server) const;
   void serveLines();
+  [[nodiscard]] Server* nextToServe();
   void expireLines();
   void attempt(std::shared_ptr<CurlTask> task);
+  void countRunning(const CurlTask& task, bool starts);
   void resumePaused(const CurlTask& task);
   void collectFinished();
   void finished(CURL* easy, CURLcode code);
   void retryWaiting();
   void expireWaiting();
+  void dropEndedBulk();
   void endAll();
   void sleep();
   [[nodiscard]] int sleepMilliseconds() const;
@@ -89,18 +102,21 @@ class CurlEngine {
 
   // The thread's own.
   std::unordered_map<CURL*, std::unique_ptr<CurlTransfer>> _running;
-  /// By the server's name, for bulk with a word behind it. The number of tasks that stand in line, and when the first
-  /// of them may have to leave it.
+  std::size_t _bulkRunning = 0;
+  /// By the server's name, for bulk with a word behind it. When the first of those in line may have to leave it.
   std::unordered_map<std::string, Server> _servers;
-  std::size_t _inLine = 0;
+  std::uint64_t _lastInLine = 0;
   SteadyTime _lineExpires = SteadyTime::max();
   /// Tasks that wait for a network; while there are any, the monitor is open.
   std::vector<std::shared_ptr<CurlTask>> _waiting;
   std::unique_ptr<RouteMonitor> _routes;
   std::vector<Easy> _spare;
   bool _mayHaveConnections = false;
+  bool _bulkDropped = false;
   SteadyTime _idleSince;
 
+  // Self-synchronised.
+  std::atomic<bool> _bulkEnded{false};
   // Guarded by _lock. The multi handle changes on the thread alone, which therefore reads it without the lock.
   Lock _lock;
   Multi _multi;

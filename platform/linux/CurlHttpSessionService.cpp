@@ -49,6 +49,7 @@ class CurlHttpSessionService final : public HttpSessionService {
   ~CurlHttpSessionService() override { _engine->stop(); }
 
   void stop() override { _engine->stop(); }
+  void endBulk() override { _engine->endBulk(); }
 
   std::shared_ptr<HttpSession> makeSession(HttpSessionConfiguration configuration,
                                            std::shared_ptr<HttpSessionDelegate> delegate,

@@ -86,13 +86,8 @@ Result<HttpAddress> parseHttpAddress(const std::string& url) {
 
 bool isHttpAddress(const std::string& url) { return parseHttpAddress(url).has_value(); }
 
-CurlTask::CurlTask(std::shared_ptr<CurlSession> session, HttpRequest request, HttpAddress address,
-                   FileDescriptor bodyFile, std::int64_t bodyFileSize)
-    : _session(std::move(session)),
-      _request(std::move(request)),
-      _address(std::move(address)),
-      _bodyFile(std::move(bodyFile)),
-      _bodyFileSize(bodyFileSize) {}
+CurlTask::CurlTask(std::shared_ptr<CurlSession> session, HttpRequest request, HttpAddress address)
+    : _session(std::move(session)), _request(std::move(request)), _address(std::move(address)) {}
 
 // A task that was never started must not keep its session from becoming invalid.
 CurlTask::~CurlTask() {
@@ -123,12 +118,10 @@ std::shared_ptr<const HttpResponse> CurlTask::response() const {
 
 const HttpSessionConfiguration& CurlTask::configuration() const noexcept { return _session->_configuration; }
 
-int CurlTask::bodyFile() const noexcept {
-  return _request.bodyFile ? _request.bodyFile->file().get() : _bodyFile.get();
-}
+int CurlTask::bodyFile() const noexcept { return _request.bodyFile ? _request.bodyFile->file().get() : -1; }
 
 std::int64_t CurlTask::bodyFileSize() const noexcept {
-  return _request.bodyFile ? static_cast<std::int64_t>(_request.bodyFile->size()) : _bodyFileSize;
+  return _request.bodyFile ? static_cast<std::int64_t>(_request.bodyFile->size()) : 0;
 }
 
 std::size_t CurlTask::maximumResponseBytes() const noexcept {
@@ -218,7 +211,7 @@ std::string CurlSession::sessionDescription() const {
 }
 
 Result<std::shared_ptr<HttpTask>> CurlSession::makeDataTask(HttpRequest request) {
-  return makeTask(std::move(request), FileDescriptor(), 0);
+  return makeTask(std::move(request));
 }
 
 Result<std::shared_ptr<HttpTask>> CurlSession::makeUploadTask(HttpRequest request, const std::string& bodyFilePath) {
@@ -228,11 +221,11 @@ Result<std::shared_ptr<HttpTask>> CurlSession::makeUploadTask(HttpRequest reques
     return failure(kHttpErrorDomain, CURLE_READ_ERROR, "cannot read the file " + bodyFilePath);
   }
   request.body.reset();
-  return makeTask(std::move(request), std::move(file), status.st_size);
+  request.bodyFile = UnnamedFile::adopt(std::move(file), static_cast<std::uint64_t>(status.st_size));
+  return makeTask(std::move(request));
 }
 
-Result<std::shared_ptr<HttpTask>> CurlSession::makeTask(HttpRequest request, FileDescriptor bodyFile,
-                                                        std::int64_t bodyFileSize) {
+Result<std::shared_ptr<HttpTask>> CurlSession::makeTask(HttpRequest request) {
   auto address = parseHttpAddress(request.url);
   if (!address) return Failure(address.error());
   if (auto error = unusable(request, *address)) return Failure(*std::move(error));
@@ -243,8 +236,8 @@ Result<std::shared_ptr<HttpTask>> CurlSession::makeTask(HttpRequest request, Fil
     }
     ++_tasks;
   }
-  return std::shared_ptr<HttpTask>(std::make_shared<CurlTask>(shared_from_this(), std::move(request),
-                                                              *std::move(address), std::move(bodyFile), bodyFileSize));
+  return std::shared_ptr<HttpTask>(
+      std::make_shared<CurlTask>(shared_from_this(), std::move(request), *std::move(address)));
 }
 
 void CurlSession::finishTasksAndInvalidate() {

@@ -8,7 +8,6 @@
 #include <string>
 
 #include "platform/Clock.h"
-#include "platform/FileDescriptor.h"
 #include "platform/HttpSession.h"
 #include "platform/Lock.h"
 
@@ -33,8 +32,7 @@ struct HttpAddress {
 /// those hands an event to the delegate queue and returns.
 class CurlTask : public HttpTask, public std::enable_shared_from_this<CurlTask> {
  public:
-  CurlTask(std::shared_ptr<CurlSession> session, HttpRequest request, HttpAddress address, FileDescriptor bodyFile,
-           std::int64_t bodyFileSize);
+  CurlTask(std::shared_ptr<CurlSession> session, HttpRequest request, HttpAddress address);
   ~CurlTask() override;
 
   void setTaskDescription(std::string description) override;
@@ -52,7 +50,7 @@ class CurlTask : public HttpTask, public std::enable_shared_from_this<CurlTask> 
   [[nodiscard]] const HttpRequest& request() const noexcept { return _request; }
   [[nodiscard]] const HttpAddress& address() const noexcept { return _address; }
   [[nodiscard]] const HttpSessionConfiguration& configuration() const noexcept;
-  /// -1 when the body is in memory.
+  /// -1 when the request has no file as its body.
   [[nodiscard]] int bodyFile() const noexcept;
   [[nodiscard]] std::int64_t bodyFileSize() const noexcept;
   [[nodiscard]] std::size_t maximumResponseBytes() const noexcept;
@@ -66,8 +64,6 @@ class CurlTask : public HttpTask, public std::enable_shared_from_this<CurlTask> 
   const std::shared_ptr<CurlSession> _session;
   const HttpRequest _request;
   const HttpAddress _address;
-  const FileDescriptor _bodyFile;
-  const std::int64_t _bodyFileSize;
   SteadyTime _deadline;
   // Self-synchronised.
   std::atomic<bool> _resumed{false};
@@ -95,8 +91,7 @@ class CurlSession : public HttpSession, public std::enable_shared_from_this<Curl
 
  private:
   friend class CurlTask;
-  [[nodiscard]] Result<std::shared_ptr<HttpTask>> makeTask(HttpRequest request, FileDescriptor bodyFile,
-                                                           std::int64_t bodyFileSize);
+  [[nodiscard]] Result<std::shared_ptr<HttpTask>> makeTask(HttpRequest request);
   /// Null once the session is invalid.
   [[nodiscard]] std::shared_ptr<HttpSessionDelegate> delegate() const;
   void taskEnded();

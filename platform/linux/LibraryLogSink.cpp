@@ -1,9 +1,13 @@
+#include <pthread.h>
+#include <signal.h>
 #include <sys/uio.h>
 #include <syslog.h>
 #include <unistd.h>
 
+#include <cerrno>
 #include <chrono>
 #include <cstdlib>
+#include <ctime>
 #include <optional>
 #include <string_view>
 
@@ -30,18 +34,37 @@ Setting currentSetting() {
   return {setting == "none", std::nullopt};
 }
 
+/// A write into a pipe that nobody reads raises a signal on the writing thread, which may be the host's: it is held
+/// back meanwhile, and taken away again. A line that cannot be written is lost.
+void writeToErrorStream(const iovec* parts, int count) noexcept {
+  sigset_t brokenPipe;
+  sigset_t former;
+  sigset_t pending;
+  sigemptyset(&brokenPipe);
+  sigaddset(&brokenPipe, SIGPIPE);
+  sigemptyset(&pending);
+  sigpending(&pending);
+  pthread_sigmask(SIG_BLOCK, &brokenPipe, &former);
+  const bool isRaised = ::writev(STDERR_FILENO, parts, count) < 0 && errno == EPIPE;
+  const bool isOurs = isRaised && sigismember(&pending, SIGPIPE) == 0;
+  constexpr timespec kNow{};
+  while (isOurs && sigtimedwait(&brokenPipe, nullptr, &kNow) < 0 && errno == EINTR) {
+  }
+  pthread_sigmask(SIG_SETMASK, &former, nullptr);
+}
+
 class ErrorStreamSink final : public Sink {
  public:
   explicit ErrorStreamSink(Level lowest) : _lowest(lowest) {}
 
-  /// In one write, so that lines of several threads stay whole. A line that cannot be written is lost.
+  /// In one write, so that lines of several threads stay whole.
   void write(Level level, std::string_view line) override {
     if (level < _lowest) return;
     constexpr std::string_view kPrefix = "velkreporting: ";
     const iovec parts[] = {{const_cast<char*>(kPrefix.data()), kPrefix.size()},
                            {const_cast<char*>(line.data()), line.size()},
                            {const_cast<char*>("\n"), 1}};
-    [[maybe_unused]] const auto ignored = ::writev(STDERR_FILENO, parts, 3);
+    writeToErrorStream(parts, 3);
   }
 
  private:

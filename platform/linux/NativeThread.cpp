@@ -18,7 +18,7 @@ class BlockedSignals {
   BlockedSignals() noexcept {
     sigset_t blocked;
     sigfillset(&blocked);
-    for (const int fault : {SIGSEGV, SIGBUS, SIGFPE, SIGILL, SIGTRAP, SIGABRT, SIGSYS, SIGPROF}) {
+    for (const int fault : {SIGSEGV, SIGBUS, SIGFPE, SIGILL, SIGTRAP, SIGABRT, SIGSYS}) {
       sigdelset(&blocked, fault);
     }
     pthread_sigmask(SIG_BLOCK, &blocked, &_former);

@@ -35,6 +35,10 @@ Result<std::unique_ptr<UnnamedFile>> UnnamedFile::make(const std::string& direct
   return std::unique_ptr<UnnamedFile>(new UnnamedFile(std::move(file)));
 }
 
+std::shared_ptr<const UnnamedFile> UnnamedFile::adopt(FileDescriptor file, std::uint64_t size) {
+  return std::shared_ptr<const UnnamedFile>(new UnnamedFile(std::move(file), size));
+}
+
 Result<void> UnnamedFile::append(std::span<const std::uint8_t> bytes) {
   while (!bytes.empty()) {
     const ssize_t written = ::pwrite(_file.get(), bytes.data(), bytes.size(), static_cast<off_t>(_size));

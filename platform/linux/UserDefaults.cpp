@@ -129,10 +129,16 @@ class SuiteLock {
       return;
     }
   }
+  ~SuiteLock() {
+    // Closing it would not do: a child that was forked meanwhile has a copy, and would keep everybody out.
+    if (_file) static_cast<void>(::flock(_file.get(), LOCK_UN));
+  }
+  SuiteLock(const SuiteLock&) = delete;
+  SuiteLock& operator=(const SuiteLock&) = delete;
   [[nodiscard]] bool held() const noexcept { return static_cast<bool>(_file); }
 
  private:
-  FileDescriptor _file;  // closing it lets the lock go
+  FileDescriptor _file;
 };
 
 class FileUserDefaults : public UserDefaults {

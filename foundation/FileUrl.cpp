@@ -1,4 +1,4 @@
-#include "session/FileUrl.h"
+#include "foundation/FileUrl.h"
 
 #include "foundation/Text.h"
 
@@ -39,6 +39,7 @@ std::string withoutEscapes(std::string_view text) {
 std::string fileSystemPath(std::string_view url) {
   if (!equalsIgnoringCase(url.substr(0, kScheme.size()), kScheme)) return std::string(url);
   std::string_view rest = url.substr(kScheme.size());
+  if (rest.empty() || rest.front() != '/') return std::string(url);
   if (rest.substr(0, 2) == "//") {
     const std::size_t slash = rest.find('/', 2);
     rest = slash == std::string_view::npos ? std::string_view() : rest.substr(slash);
