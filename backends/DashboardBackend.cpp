@@ -29,6 +29,8 @@ constexpr std::uint16_t kNoticeMethod = 0;
 constexpr std::uint16_t kNoticeRespCode = 2;
 /// Longer than any address: the rest of an answer is none of ours to log.
 constexpr std::size_t kMostLocationBytes = 2048;
+/// What is taken of an answer at all.
+constexpr std::size_t kMostAnswerBytes = 1024 * 1024;
 
 const PropertyValue* present(const PropertyDictionary& section, std::string_view key) {
   const auto* value = section.find(key);
@@ -230,6 +232,7 @@ bool DashboardBackend::uploadLogData(const PropertyArray& logData) {
   request.body = std::make_shared<const std::string>(archive->begin(), archive->end());
   request.requiresHttps = !_isInternal;
   request.isBulk = true;
+  request.maximumResponseBytes = kMostAnswerBytes;
   request.setHeader("Content-Type", "application/octet-stream");
   const auto sender = transport();
   if (!sender) return true;
@@ -255,9 +258,9 @@ bool DashboardBackend::uploadLogData(const PropertyArray& logData) {
 
 /// Numbered like an event; what the base class then does with it is nothing, so that the number is all it takes.
 void DashboardBackend::noticeLocation(const ByteData& answer) {
-  std::string location(answer.begin(),
-                       answer.begin() + static_cast<std::ptrdiff_t>(std::min(answer.size(), kMostLocationBytes)));
+  std::string location(answer.begin(), answer.end());
   if (!isUtf8(location)) location.clear();
+  location.resize(utf8Prefix(location, kMostLocationBytes).size());
   log::standard(backend_texts::kLogDataUploaded, location);
   sendMessage(PropertyDictionary{{kLocationKey, std::move(location)}}, _context.platform.clock.wallTime(),
               kNoticeMethod, kNoticeRespCode, 0);

@@ -24,7 +24,7 @@ constexpr int kMemoryLevel = 8;
 /// A stream that is fed piece by piece. Its own counters may be 32 bits wide, so nobody looks at them.
 class GzipStream {
  public:
-  explicit GzipStream(UnnamedFile& output) : _output(output), _piece(kPieceBytes) {}
+  GzipStream(UnnamedFile& output, ProcessUploads& uploads) : _output(output), _uploads(uploads), _piece(kPieceBytes) {}
   ~GzipStream() {
     if (_isSetUp) deflateEnd(&_stream);
   }
@@ -50,7 +50,7 @@ class GzipStream {
     do {
       _stream.next_out = _piece.data();
       _stream.avail_out = static_cast<uInt>(_piece.size());
-      result = deflate(&_stream, flush);
+      result = compressPiece(flush);
       if (result != Z_OK && result != Z_STREAM_END && result != Z_BUF_ERROR) {
         log::standard(backend_texts::kCompressError, deflateErrorText(result), _stream.msg);
         return false;
@@ -60,6 +60,11 @@ class GzipStream {
     return true;
   }
 
+  int compressPiece(int flush) {
+    const ProcessUploads::CompressionTurn turn(_uploads);
+    return deflate(&_stream, flush);
+  }
+
   bool keep(std::size_t bytes) {
     const auto kept = _output.append(std::span(_piece).first(bytes));
     if (!kept) log::error(backend_texts::kUploadNotKept, kept.error());
@@ -67,6 +72,7 @@ class GzipStream {
   }
 
   UnnamedFile& _output;
+  ProcessUploads& _uploads;
   std::vector<std::uint8_t> _piece;
   z_stream _stream{};
   bool _isSetUp = false;
@@ -81,17 +87,19 @@ CompressedFile inMemory(const FileDescriptor& file, std::uint64_t size) {
   return {Outcome::compressed, std::make_shared<const std::string>(std::move(*compressed)), nullptr};
 }
 
-CompressedFile onDisk(const FileDescriptor& file, std::uint64_t size, const std::string& directory) {
+CompressedFile onDisk(const FileDescriptor& file, std::uint64_t size, const std::string& directory,
+                      ProcessUploads& uploads) {
   auto output = UnnamedFile::make(directory);
   if (!output) {
     log::error(backend_texts::kUploadNotKept, output.error());
     return {};
   }
-  GzipStream stream(**output);
+  GzipStream stream(**output, uploads);
   if (!stream.setUp()) return {};
   std::vector<std::uint8_t> piece(kPieceBytes);
   std::uint64_t done = 0;
   while (done < size) {
+    if (uploads.isStopping()) return {Outcome::abandoned, nullptr, nullptr};
     const auto wanted = static_cast<std::size_t>(std::min<std::uint64_t>(size - done, piece.size()));
     const auto read = readAt(file, done, std::span(piece).first(wanted));
     if (!read) return {Outcome::nothingToRead, nullptr, nullptr};
@@ -107,9 +115,10 @@ CompressedFile onDisk(const FileDescriptor& file, std::uint64_t size, const std:
 
 }  // namespace
 
-CompressedFile gzipFile(const FileDescriptor& file, std::uint64_t size, const std::string& directory) {
+CompressedFile gzipFile(const FileDescriptor& file, std::uint64_t size, const std::string& directory,
+                        ProcessUploads& uploads) {
   if (size == 0) return {Outcome::nothingToRead, nullptr, nullptr};
-  return size <= kMaximumSizeInMemory ? inMemory(file, size) : onDisk(file, size, directory);
+  return size <= kMaximumSizeInMemory ? inMemory(file, size) : onDisk(file, size, directory, uploads);
 }
 
 }  // namespace velk

@@ -6,6 +6,7 @@
 #include <memory>
 #include <string>
 
+#include "backends/ProcessUploads.h"
 #include "platform/FileDescriptor.h"
 #include "platform/UnnamedFile.h"
 
@@ -19,6 +20,7 @@ struct CompressedFile {
     compressed,
     nothingToRead,  ///< the file is empty, or could not be read
     failed,         ///< compressing failed, or there was no room; logged
+    abandoned,      ///< the process is about to end
   };
   Outcome outcome = Outcome::failed;
   // One of the two is there when the file was compressed.
@@ -32,7 +34,9 @@ struct CompressedFile {
 };
 
 /// Reads at most `size` bytes from the file's beginning, whatever becomes of the file meanwhile. What is too large for
-/// memory is kept in a file without a name in the file system of `directory`.
-[[nodiscard]] CompressedFile gzipFile(const FileDescriptor& file, std::uint64_t size, const std::string& directory);
+/// memory is kept in a file without a name in the file system of `directory`; it is compressed in turns with others of
+/// its kind, and given up when `uploads` stops.
+[[nodiscard]] CompressedFile gzipFile(const FileDescriptor& file, std::uint64_t size, const std::string& directory,
+                                      ProcessUploads& uploads);
 
 }  // namespace velk

@@ -104,7 +104,7 @@ bool UploadBackend::uploadFileAtPath(FileUpload& upload) {
       log::error(backend_texts::kUploadTooLarge, *size, kMaximumFileBytes);
       return false;
     }
-    body = gzipFile(upload.file, *size, _context.largeFilesDirectory);
+    body = gzipFile(upload.file, *size, _context.largeFilesDirectory, *_context.uploads);
   }
   if (body.outcome == CompressedFile::Outcome::nothingToRead) log::standard(backend_texts::kInputFileIsEmpty);
   if (body.outcome != CompressedFile::Outcome::compressed) return false;
@@ -169,7 +169,7 @@ bool UploadBackend::postAndWait(ReportingSessionConnectivityInterface& transport
   std::optional<std::string> text(std::in_place, answer->data.begin(), answer->data.end());
   if (!isUtf8(*text)) text.reset();
   const bool isTaken = text && text->find(kTaken) != std::string::npos;
-  if (text && text->size() > kLoggedAnswerBytes) text->resize(kLoggedAnswerBytes);
+  if (text) text->resize(utf8Prefix(*text, kLoggedAnswerBytes).size());
   log::standard(backend_texts::kUploadAnswered, uploadURL, text);
   return isTaken;
 }

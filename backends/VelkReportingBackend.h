@@ -17,6 +17,7 @@
 
 #include "backends/BackendStateHandle.h"
 #include "backends/DottedVersion.h"
+#include "backends/ProcessUploads.h"
 #include "connectivity/ConnectivityInterface.h"
 #include "foundation/Completion.h"
 #include "foundation/Error.h"
@@ -47,6 +48,7 @@ struct BackendContext {
   const DeviceEnvironment& environment;
   /// On a disk with room for what is too large for memory. What is kept there has no name.
   std::string largeFilesDirectory = "/var/tmp";
+  std::shared_ptr<ProcessUploads> uploads = std::make_shared<ProcessUploads>();
 };
 
 /// A file that a client hands over for upload.

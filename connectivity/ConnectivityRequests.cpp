@@ -214,6 +214,8 @@ void ReportingSessionConnectivityHelper::didBecomeInvalidWithError(HttpSession& 
                                                                    const std::optional<Error>& error) {
   _stateQueue->async([self = shared_from_this(), sessionName = session.sessionDescription(), error] {
     log::standard(texts::kDidBecomeInvalidRelease, self->_totalSessionsServedCount.load(), sessionName);
+    // An earlier session of a transport that has been activated again says nothing about the present one.
+    if (!self->_isActive) self->_hasBecomeInvalid = true;
     self->releaseAllIPCTransactions();
     log::standard(texts::kDidBecomeInvalid, sessionName, text(error));
   });

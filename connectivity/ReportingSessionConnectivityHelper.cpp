@@ -95,6 +95,7 @@ void ReportingSessionConnectivityHelper::activateOnQueue(std::uint32_t releaseTi
   _tasks.reserve(kExpectedTasks);
   _runningTasks = 0;
   _isActive = true;
+  _hasBecomeInvalid = false;
   _window->open();
   log::standard(texts::kActivated, sessionIdentifier(), hasDelegate());
 }
@@ -127,6 +128,7 @@ void ReportingSessionConnectivityHelper::invalidateOnQueue() {
     log::standard(texts::kInvalidate, sessionIdentifier());
   } else {
     log::standard(texts::kInvalidateInactive, _totalSessionsServedCount.load());
+    _hasBecomeInvalid = true;
     releaseAllIPCTransactions();
   }
 }
@@ -142,9 +144,12 @@ void ReportingSessionConnectivityHelper::releaseAllIPCTransactions() {
   delegate->releaseIPCTransactions(_totalSessionsServedCount.exchange(0));
 }
 
+// Counted first and asked afterwards, while becoming invalid is noted first and the count taken afterwards: whichever
+// way the two meet, one of them gives the reference back, and the count is taken once.
 void ReportingSessionConnectivityHelper::incrementTotalSessionsServedCount() {
   ++_totalSessionsServedCount;
   log::standard(texts::kServedCountIncremented, sessionIdentifier());
+  if (_hasBecomeInvalid) releaseAllIPCTransactions();
 }
 
 // A timer that is about to fire, or has and was not served yet, has nothing left.

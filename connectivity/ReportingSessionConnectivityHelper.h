@@ -71,7 +71,8 @@ class ReportingSessionConnectivityHelper : public ReportingSessionConnectivityIn
   /// A user has gone. `block` runs on `queue` (null: the state queue): at once while there are other users, else when
   /// the release timer has fired or was stopped.
   void ownerDecrementUsageCountWithBlock(ReleaseBlock block, std::shared_ptr<Queue> queue);
-  /// One more keep-alive reference to give back. Takes effect at once.
+  /// One more keep-alive reference to give back. Takes effect at once: a transport that has become invalid already
+  /// gives it back in this call, and takes the agent's lock for it.
   void incrementTotalSessionsServedCount();
   /// Gives the keep-alive references back. Takes the agent's lock.
   void releaseAllIPCTransactions();
@@ -144,6 +145,8 @@ class ReportingSessionConnectivityHelper : public ReportingSessionConnectivityIn
   std::atomic<std::uint32_t> _totalSessionsServedCount{0};
   std::atomic<std::uint32_t> _usageCount{0};
   std::atomic<bool> _isActive{false};
+  /// What was held for sessions has been given back, and nobody will come by to do so again.
+  std::atomic<bool> _hasBecomeInvalid{false};
   std::atomic<std::uint32_t> _releaseTimeout;
   /// When the release timer fires; `kNoTimer` while it does not run.
   std::atomic<SteadyTime> _releaseTime{kNoTimer};

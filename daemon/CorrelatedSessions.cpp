@@ -1,6 +1,8 @@
 #include "daemon/CorrelatedSessions.h"
 
 #include <algorithm>
+#include <cstddef>
+#include <iterator>
 
 #include "daemon/LogTexts.h"
 #include "platform/Log.h"
@@ -12,6 +14,12 @@ namespace {
 
 using SessionList = CorrelatedSessions::SessionList;
 
+/// Of a list that outlives it.
+struct LevelledSession {
+  std::uint32_t level;
+  const std::shared_ptr<ReportingdSession>* session;
+};
+
 bool contains(const SessionList& list, const ReportingdSession& session) {
   return std::any_of(list.begin(), list.end(), [&](const auto& listed) { return listed.get() == &session; });
 }
@@ -20,14 +28,20 @@ void removeFrom(SessionList& list, const ReportingdSession& session) {
   std::erase_if(list, [&](const auto& listed) { return listed.get() == &session; });
 }
 
-// First session of each level below `level`, so that a level that a client made up (they go to four thousand million)
-// costs no more than the sessions that there are.
-std::map<std::uint32_t, std::shared_ptr<ReportingdSession>> firstSessionsBelow(std::uint32_t level,
-                                                                               const SessionList& list) {
-  std::map<std::uint32_t, std::shared_ptr<ReportingdSession>> first;
+/// First session of each level below `level`, from the root on. A level that a client made up (they go to four thousand
+/// million) costs no more than the sessions that there are. Asked for every session of a tree, under the agent's lock:
+/// a few passes over the list, and nothing allocated for a session.
+std::vector<LevelledSession> firstSessionsBelow(std::uint32_t level, const SessionList& list) {
+  std::vector<LevelledSession> first;
+  first.reserve(list.size());
   for (const auto& session : list) {
-    if (session->hierarchyLevel() < level) first.try_emplace(session->hierarchyLevel(), session);
+    if (const auto its = session->hierarchyLevel(); its < level) first.push_back({its, &session});
   }
+  const auto isBelow = [](const auto& left, const auto& right) { return left.level < right.level; };
+  if (!std::is_sorted(first.begin(), first.end(), isBelow)) std::stable_sort(first.begin(), first.end(), isBelow);
+  first.erase(std::unique(first.begin(), first.end(),
+                          [](const auto& left, const auto& right) { return left.level == right.level; }),
+              first.end());
   return first;
 }
 
@@ -93,16 +107,22 @@ std::optional<std::string> CorrelatedSessions::parentSessionIDString(const Repor
     return std::nullopt;
   }
   const auto ancestors = firstSessionsBelow(level, *list);
-  std::optional<std::string> chain;
-  for (auto wanted = level; wanted-- > 0;) {
-    const auto ancestor = ancestors.find(wanted);
-    if (ancestor == ancestors.end()) {
-      log::standard(daemontexts::kGapInChain, chain);
-      break;
-    }
-    const auto& identifier = ancestor->second->sessionIDString();
-    chain = chain ? identifier + "." + *chain : identifier;
+  // From the parent up to the root, or to the first gap.
+  auto top = ancestors.end();
+  while (top != ancestors.begin() &&
+         std::prev(top)->level + static_cast<std::uint32_t>(ancestors.end() - top) + 1 == level) {
+    --top;
   }
+  std::optional<std::string> chain;
+  for (auto ancestor = top; ancestor != ancestors.end(); ++ancestor) {
+    if (chain) {
+      *chain += '.';
+      *chain += (*ancestor->session)->sessionIDString();
+    } else {
+      chain = (*ancestor->session)->sessionIDString();
+    }
+  }
+  if (ancestors.end() - top != static_cast<std::ptrdiff_t>(level)) log::standard(daemontexts::kGapInChain, chain);
   return chain;
 }
 
@@ -133,8 +153,8 @@ std::shared_ptr<ReportingdSession> CorrelatedSessions::ancestorWithAggregator(co
   if (std::none_of(list->begin(), list->end(), [](const auto& listed) { return listed->hasAggregator(); })) {
     return nullptr;
   }
-  for (const auto& [level, ancestor] : firstSessionsBelow(session.hierarchyLevel(), *list)) {
-    if (ancestor->hasAggregator()) return ancestor;
+  for (const auto& ancestor : firstSessionsBelow(session.hierarchyLevel(), *list)) {
+    if ((*ancestor.session)->hasAggregator()) return *ancestor.session;
   }
   return nullptr;
 }

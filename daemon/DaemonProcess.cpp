@@ -35,7 +35,9 @@ constexpr Duration kActivatedIdleLimit = std::chrono::seconds(30);
 // How long the end of the process waits for sessions to say goodbye, and then for the network to take their last posts.
 constexpr Duration kTeardownTime = std::chrono::seconds(5);
 constexpr Duration kDeliveryTime = std::chrono::seconds(10);
-// How long calls of the diagnostics adaptor may then still take.
+// How long uploads may take of that: nothing is lost with them, since their files stay with the clients.
+constexpr Duration kUploadTime = std::chrono::seconds(2);
+// How long calls of the diagnostics adaptor, and reads of clients' files, may then still take.
 constexpr Duration kAdaptorTime = std::chrono::seconds(2);
 // How far beyond its usual bound the pool may grow while everybody waits for the agent's lock: more than the
 // connections that a few users may have.
@@ -84,6 +86,10 @@ struct DaemonProcess::Parts {
   }
   [[nodiscard]] Listener::Options listenerOptions();
   void reload();
+  /// Of the requests that are under way, after a little time for what a server is about to take.
+  void endUploads();
+  /// Does not return when one of them does not: a file may lie on a disk of its owner's making.
+  void reportUploads() const;
   /// Verification itself says nothing of a key that is missing, and everything that fails for it looks like the
   /// network.
   void reportMissingPublicKey() const;
@@ -252,8 +258,25 @@ bool DaemonProcess::stopsListeningIfIdle() {
   return _parts->idleWatch.isReleased() && _parts->listener->stopIfUnused();
 }
 
+void DaemonProcess::Parts::endUploads() {
+  if (!services.backends.uploads->waitUntilNone(kUploadTime)) http->endBulk();
+}
+
+void DaemonProcess::Parts::reportUploads() const {
+  auto& uploads = *services.backends.uploads;
+  const bool allEnded = uploads.waitUntilNone(kAdaptorTime);
+  if (const auto left = uploads.leftBehind() + uploads.count(); left > 0) {
+    log::standard("stop: uploads left behind: %d; their files stay with their clients", left);
+  }
+  if (allEnded) return;
+  log::error("stop: files of clients that are being uploaded cannot be read; the process ends without them");
+  process::endNow(kExitSoftware);
+}
+
 void DaemonProcess::stop() {
   _parts->idleWatch.stop();
+  // Uploads that wait would take minutes, and would then find no transport.
+  _parts->services.backends.uploads->stop();
   // Whoever waits for a storebag gets none, so that the agent's lock is free.
   _parts->storebagService->stop();
   // Nobody new. A decision that is being taken right now still counts.
@@ -266,6 +289,7 @@ void DaemonProcess::stop() {
   }
   // What the sessions posted.
   _parts->agent->invalidateAllConnectivityHelpers();
+  _parts->endUploads();
   if (!_parts->idleWatch.waitUntilReleased(kDeliveryTime)) {
     log::error("stop: posts are still under way after %d s and are cut off", kDeliveryTime / std::chrono::seconds(1));
   }
@@ -275,6 +299,7 @@ void DaemonProcess::stop() {
   }
   // Uploads wait for their answers on threads of the pool.
   _parts->http->stop();
+  _parts->reportUploads();
   // The threads: first those that hand work over, then those that do it.
   _parts->eventLoop.stop();
   _parts->pool->stop();

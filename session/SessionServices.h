@@ -1,8 +1,6 @@
 // What a session is handed at its creation besides its delegate and its connection.
 #pragma once
 
-#include <atomic>
-#include <cstddef>
 #include <cstdint>
 #include <functional>
 #include <memory>
@@ -49,8 +47,6 @@ struct SessionServices {
   MessageLog& messageLog;
   /// Tests put their own here.
   BackendFactory newBackend = newBackendWithName;
-  /// The uploads of all sessions that are under way or wait, of those that have ended as well.
-  std::shared_ptr<std::atomic<std::size_t>> uploadsOfAll = std::make_shared<std::atomic<std::size_t>>(0);
 };
 
 }  // namespace velk

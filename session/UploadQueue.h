@@ -7,6 +7,7 @@
 #include <memory>
 #include <utility>
 
+#include "backends/ProcessUploads.h"
 #include "platform/Queue.h"
 
 namespace velk {
@@ -18,29 +19,27 @@ class UploadQueue {
   /// descriptor, or a megabyte of log data.
   static constexpr std::size_t kMaximumUploads = 16;
 
-  /// The same for the whole process: what sessions have taken outlives them, and a client may open another.
-  static constexpr std::size_t kMaximumUploadsOfAll = 64;
-
-  /// `ofAll` counts the uploads of all sessions.
-  UploadQueue(Scheduler& scheduler, std::shared_ptr<std::atomic<std::size_t>> ofAll)
+  UploadQueue(Scheduler& scheduler, std::shared_ptr<ProcessUploads> ofAll)
       : _scheduler(scheduler), _ofAll(std::move(ofAll)) {}
 
-  [[nodiscard]] bool isFull() const {
-    return _underWay->load() >= kMaximumUploads || _ofAll->load() >= kMaximumUploadsOfAll;
-  }
+  [[nodiscard]] bool isFull() const { return _underWay->load() >= kMaximumUploads || _ofAll->isFull(); }
 
-  /// Runs the upload behind those that were taken before.
+  /// Runs the upload behind those that were taken before. It is told whether it may begin: when the process is about to
+  /// end it may not, and only answers. It says whether what was to be uploaded has been delivered.
   template <class Upload>
   void run(Upload upload) {
     if (!_queue) _queue = _scheduler.makeSerialQueue("com.tavrin.velkreportingd.uploads");
     ++*_underWay;
-    ++*_ofAll;
+    _ofAll->enter();
     // Run or dropped, it leaves once.
     std::shared_ptr<void> place(nullptr, [underWay = _underWay, ofAll = _ofAll](void*) {
       --*underWay;
-      --*ofAll;
+      ofAll->leave();
     });
-    _queue->async([upload = std::move(upload), place = std::move(place)]() mutable { upload(); });
+    _queue->async([upload = std::move(upload), place = std::move(place), ofAll = _ofAll]() mutable {
+      const bool isDelivered = upload(!ofAll->isStopping());
+      if (!isDelivered && ofAll->isStopping()) ofAll->noteLeftBehind();
+    });
   }
 
   /// Runs the work when all uploads have ended: at once if there are none.
@@ -55,7 +54,7 @@ class UploadQueue {
 
  private:
   Scheduler& _scheduler;
-  const std::shared_ptr<std::atomic<std::size_t>> _ofAll;
+  const std::shared_ptr<ProcessUploads> _ofAll;
   std::shared_ptr<Queue> _queue;
   const std::shared_ptr<std::atomic<std::size_t>> _underWay = std::make_shared<std::atomic<std::size_t>>(0);
 };

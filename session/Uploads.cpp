@@ -1,11 +1,11 @@
 // Files and log data that clients hand over, and where their reports can be seen. The backends do the work.
 #include <utility>
 
+#include "foundation/FileUrl.h"
 #include "foundation/Format.h"
 #include "ipc/Vocabulary.h"
 #include "platform/Log.h"
 #include "session/ClientSession.h"
-#include "session/FileUrl.h"
 #include "session/LogTexts.h"
 
 namespace velk {
@@ -75,29 +75,34 @@ void ClientSession::uploadFileWithURL(std::string url, std::string extensionToke
   FileUpload upload{fileSystemPath(url), std::move(extensionToken), std::move(file)};
   if (_uploads.isFull()) {
     log::error(session_texts::kTooManyUploads, sessionID(), UploadQueue::kMaximumUploads,
-               UploadQueue::kMaximumUploadsOfAll);
+               ProcessUploads::kMaximumUploads);
     finishFileUpload(_services.messageLog, url, upload, false, reply);
     return;
   }
   // Nothing of the session: the upload may outlive it.
   _uploads.run([backends = ownBackends(), &messageLog = _services.messageLog, url = std::move(url),
-                upload = std::move(upload), reply = std::move(reply)]() mutable {
-    const bool taken = offer(backends.get(), [&](VelkReportingBackend& each) { return each.uploadFileAtPath(upload); });
+                upload = std::move(upload), reply = std::move(reply)](bool mayBegin) mutable {
+    const bool taken =
+        mayBegin && offer(backends.get(), [&](VelkReportingBackend& each) { return each.uploadFileAtPath(upload); });
     finishFileUpload(messageLog, url, upload, taken, reply);
+    return upload.isDelivered;
   });
 }
 
 void ClientSession::uploadLogData(PropertyArray logData, LogDataReply reply) {
   if (_uploads.isFull()) {
     log::error(session_texts::kTooManyUploads, sessionID(), UploadQueue::kMaximumUploads,
-               UploadQueue::kMaximumUploadsOfAll);
+               ProcessUploads::kMaximumUploads);
     finishLogData(false, reply);
     return;
   }
-  _uploads.run([backends = ownBackends(), logData = std::move(logData), reply = std::move(reply)]() mutable {
-    finishLogData(offer(backends.get(), [&](VelkReportingBackend& each) { return each.uploadLogData(logData); }),
-                  reply);
-  });
+  _uploads.run(
+      [backends = ownBackends(), logData = std::move(logData), reply = std::move(reply)](bool mayBegin) mutable {
+        const bool taken =
+            mayBegin && offer(backends.get(), [&](VelkReportingBackend& each) { return each.uploadLogData(logData); });
+        finishLogData(taken, reply);
+        return taken;
+      });
 }
 
 }  // namespace velk
