@@ -9,8 +9,10 @@ namespace velk::cinterface {
 
 void destroyContext(VelkReportingDestroyFunction destroy, void* context) noexcept {
   try {
-    ClientRuntime& runtime = ClientRuntime::shared();
-    if (runtime.loop().isCurrent()) return runtime.runCallback([destroy, context] { destroy(context); });
+    // A call that does nothing, without a client or in a forked child, makes nothing for it either.
+    if (ClientRuntime::isOnLoop()) {
+      return ClientRuntime::shared().runCallback([destroy, context] { destroy(context); });
+    }
   } catch (...) {  // short of memory it is destroyed here: late would be never
     logException("destroyContext");
   }

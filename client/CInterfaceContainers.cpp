@@ -14,26 +14,52 @@ using velk::PropertyDictionary;
 using velk::PropertyValue;
 using velk::cinterface::arrayOf;
 using velk::cinterface::dictionaryOf;
+using velk::cinterface::Extent;
+using velk::cinterface::extentOf;
 using velk::cinterface::guarded;
 using velk::cinterface::handOut;
 using velk::cinterface::kMaximumDepth;
+using velk::cinterface::kMaximumValues;
 using velk::cinterface::newValue;
 
 namespace {
 
-/// A bound on the depth of what stands in `container`.
-int depthWithin(const VelkReportingValue* container, const PropertyValue& value) {
-  return value.array() != nullptr || value.dictionary() != nullptr ? container->depth - 1 : 0;
+/// A bound on what stands in `container`.
+Extent boundWithin(const VelkReportingValue* container, const PropertyValue& value) {
+  if (value.array() == nullptr && value.dictionary() == nullptr) return {};
+  return {container->extent.depth - 1, container->extent.values - 1};
+}
+
+/// The extent of a container with a value more.
+Extent withOneMore(Extent container, Extent added) {
+  return {std::max(container.depth, added.depth + 1), container.values + added.values};
+}
+
+bool isWithinBounds(Extent extent) { return extent.depth <= kMaximumDepth && extent.values <= kMaximumValues; }
+
+/// Makes room in a container's extent for a value, whose own is `added` at most. False when there is none. What was
+/// taken out or replaced since is told apart only where it matters: `remaining` answers what the container then holds.
+template <class Remaining>
+bool makeRoom(Extent& container, const PropertyValue& value, Extent added, Remaining remaining) {
+  Extent grown = withOneMore(container, added);
+  if (!isWithinBounds(grown)) grown = withOneMore(extentOf(remaining()), extentOf(value));
+  if (!isWithinBounds(grown)) return false;
+  container = grown;
+  return true;
 }
 
 bool setInDictionary(const char* function, VelkReportingValue* dictionary, const char* key, const PropertyValue& value,
-                     int depth) {
+                     Extent extent) {
   return guarded(function, false, [&] {
     if (dictionaryOf(dictionary) == nullptr || key == nullptr || !velk::isUtf8(key)) return false;
-    if (depth >= kMaximumDepth) return false;
     PropertyValue copy(value);  // the value may be the dictionary itself
+    const auto remaining = [&]() -> PropertyValue {
+      PropertyDictionary others(*dictionaryOf(dictionary));
+      others.remove(key);
+      return others;
+    };
+    if (!makeRoom(dictionary->extent, copy, extent, remaining)) return false;
     dictionary->value.dictionary()->set(key, std::move(copy));
-    dictionary->depth = std::max(dictionary->depth, depth + 1);
     return true;
   });
 }
@@ -58,7 +84,9 @@ VelkReportingValue* fromJson(const char* function, const char* text, bool needsD
     auto parsed = velk::json::parse(text, velk::json::Extensions::tagged);
     if (!parsed) return refuse(parsed.error().description);
     if (needsDictionary && parsed->dictionary() == nullptr) return refuse("the text is no JSON object");
-    return newValue(std::move(*parsed));
+    const Extent extent = extentOf(*parsed);
+    if (extent.values > kMaximumValues) return refuse("there are too many values");
+    return newValue(std::move(*parsed), extent);
   });
 }
 
@@ -66,11 +94,10 @@ VelkReportingValue* fromJson(const char* function, const char* text, bool needsD
 
 bool VelkReportingArrayAppend(VelkReportingValue* array, const VelkReportingValue* value) {
   return guarded(__func__, false, [&] {
-    if (arrayOf(array) == nullptr || value == nullptr || value->depth >= kMaximumDepth) return false;
-    const int depth = value->depth;
+    if (arrayOf(array) == nullptr || value == nullptr) return false;
     PropertyValue copy(value->value);  // the value may be the array itself
+    if (!makeRoom(array->extent, copy, value->extent, [array] { return array->value; })) return false;
     array->value.array()->append(std::move(copy));
-    array->depth = std::max(array->depth, depth + 1);
     return true;
   });
 }
@@ -84,29 +111,29 @@ VelkReportingValue* VelkReportingArrayCopyValue(const VelkReportingValue* array,
   const PropertyArray* within = arrayOf(array);
   if (within == nullptr || index >= within->size()) return nullptr;
   const PropertyValue& value = (*within)[index];
-  return guarded(__func__, nullptr, [&] { return newValue(value, depthWithin(array, value)); });
+  return guarded(__func__, nullptr, [&] { return newValue(value, boundWithin(array, value)); });
 }
 
 bool VelkReportingDictionarySet(VelkReportingValue* dictionary, const char* key, const VelkReportingValue* value) {
-  return value != nullptr && setInDictionary(__func__, dictionary, key, value->value, value->depth);
+  return value != nullptr && setInDictionary(__func__, dictionary, key, value->value, value->extent);
 }
 
 bool VelkReportingDictionarySetBoolean(VelkReportingValue* dictionary, const char* key, bool value) {
-  return setInDictionary(__func__, dictionary, key, value, 0);
+  return setInDictionary(__func__, dictionary, key, value, {});
 }
 
 bool VelkReportingDictionarySetInteger(VelkReportingValue* dictionary, const char* key, int64_t value) {
-  return setInDictionary(__func__, dictionary, key, value, 0);
+  return setInDictionary(__func__, dictionary, key, value, {});
 }
 
 bool VelkReportingDictionarySetReal(VelkReportingValue* dictionary, const char* key, double value) {
-  return setInDictionary(__func__, dictionary, key, value, 0);
+  return setInDictionary(__func__, dictionary, key, value, {});
 }
 
 bool VelkReportingDictionarySetString(VelkReportingValue* dictionary, const char* key, const char* text) {
   if (text == nullptr || !velk::isUtf8(text)) return false;
   return guarded(__func__, false,
-                 [&] { return setInDictionary("VelkReportingDictionarySetString", dictionary, key, text, 0); });
+                 [&] { return setInDictionary("VelkReportingDictionarySetString", dictionary, key, text, {}); });
 }
 
 bool VelkReportingDictionaryRemove(VelkReportingValue* dictionary, const char* key) {
@@ -127,7 +154,7 @@ const char* VelkReportingDictionaryGetKey(const VelkReportingValue* dictionary, 
 VelkReportingValue* VelkReportingDictionaryCopyValue(const VelkReportingValue* dictionary, const char* key) {
   const PropertyValue* value = find(dictionary, key);
   if (value == nullptr) return nullptr;
-  return guarded(__func__, nullptr, [&] { return newValue(*value, depthWithin(dictionary, *value)); });
+  return guarded(__func__, nullptr, [&] { return newValue(*value, boundWithin(dictionary, *value)); });
 }
 
 bool VelkReportingDictionaryGetBoolean(const VelkReportingValue* dictionary, const char* key) {
@@ -135,7 +162,7 @@ bool VelkReportingDictionaryGetBoolean(const VelkReportingValue* dictionary, con
 }
 
 int64_t VelkReportingDictionaryGetInteger(const VelkReportingValue* dictionary, const char* key) {
-  return velk::integerValue(find(dictionary, key));
+  return velk::cinterface::boundedInteger(find(dictionary, key));
 }
 
 double VelkReportingDictionaryGetReal(const VelkReportingValue* dictionary, const char* key) {
@@ -157,9 +184,12 @@ VelkReportingValue* VelkReportingDictionaryCreateFromJSON(const char* text, Velk
 }
 
 char* VelkReportingValueCopyJSON(const VelkReportingValue* value, VelkReportingError** error) {
-  if (value == nullptr) return nullptr;
   if (error != nullptr) *error = nullptr;
   return guarded(__func__, nullptr, [&]() -> char* {
+    if (value == nullptr) {
+      handOut(error, invalidJson("there is no value"));
+      return nullptr;
+    }
     std::string text;
     if (velk::json::write(value->value, text, velk::json::Extensions::tagged)) return strdup(text.c_str());
     handOut(error, invalidJson("a number in the value is not finite"));

@@ -7,15 +7,27 @@
 #include <optional>
 #include <utility>
 
+#include "client/Border.h"
 #include "client/VelkReporting.h"
 #include "client/VelkReportingC.h"
 #include "foundation/PropertyValue.h"
 
+namespace velk::cinterface {
+
+/// How much a value is. Both are bounded: the end of a value takes a call for each level; and containers share what
+/// they hold, so that one which is put into itself again and again costs little until somebody walks it.
+struct Extent {
+  int depth = 0;             ///< containers within each other
+  std::uint64_t values = 1;  ///< all that a walk comes upon, this value included
+};
+
+}  // namespace velk::cinterface
+
 struct VelkReportingValue {
   std::atomic<std::uint32_t> references{1};
   velk::PropertyValue value;
-  /// How many containers stand within each other, at most: bounded, since the end of a value takes a call for each.
-  int depth = 0;
+  /// At most; taken again where it matters.
+  velk::cinterface::Extent extent;
 };
 
 struct VelkReportingError {
@@ -33,26 +45,11 @@ namespace velk::cinterface {
 
 /// Containers within each other, as in the reader of JSON.
 inline constexpr int kMaximumDepth = 64;
+/// A walk over so many takes some milliseconds; no event holds a tenth of them.
+inline constexpr std::uint64_t kMaximumValues = 1'048'576;
 
-/// The border: runs `work`, and answers `fallback` (with a line in the log) when memory or threads are short.
-void logException(const char* function) noexcept;
-template <class Work>
-auto guarded(const char* function, decltype(std::declval<Work>()()) fallback, Work&& work) noexcept
-    -> decltype(work()) {
-  try {
-    return work();
-  } catch (...) {
-    logException(function);
-    return fallback;
-  }
-}
-template <class Work>
-void guardedVoid(const char* function, Work&& work) noexcept {
-  static_cast<void>(guarded(function, false, [&] {
-    work();
-    return false;
-  }));
-}
+using velk::guarded;
+using velk::guardedVoid;
 
 template <class Handle>
 Handle* retain(Handle* handle) noexcept {
@@ -74,7 +71,9 @@ using Owned = std::unique_ptr<Handle, Releasing<Handle>>;
 
 /// A handle that the caller owns.
 [[nodiscard]] VelkReportingValue* newValue(PropertyValue value);
-[[nodiscard]] VelkReportingValue* newValue(PropertyValue value, int depth);
+[[nodiscard]] VelkReportingValue* newValue(PropertyValue value, Extent extent);
+/// Recursive: only for values that are bounded.
+[[nodiscard]] Extent extentOf(const PropertyValue& value);
 template <class Container>
 [[nodiscard]] VelkReportingValue* newValueOrNull(const std::optional<Container>& container) {
   return container ? newValue(PropertyValue(*container)) : nullptr;
@@ -85,6 +84,9 @@ template <class Container>
 [[nodiscard]] const PropertyArray* arrayOf(const VelkReportingValue* value) noexcept;
 /// The same as an argument of the C++ interface.
 [[nodiscard]] std::optional<PropertyDictionary> optionalDictionary(const VelkReportingValue* value);
+
+/// As integerValue, but with unsigned numbers beyond its bound at the bound as well: C has no use for their low bits.
+[[nodiscard]] std::int64_t boundedInteger(const PropertyValue* value) noexcept;
 
 [[nodiscard]] VelkReportingError* newError(const Error& error);
 /// Hands an error out, in the library's domain whatever its own was: null when there is none.

@@ -6,46 +6,41 @@
 
 #include "client/CInterfaceHandles.h"
 #include "foundation/Text.h"
-#include "platform/Log.h"
 
 namespace velk::cinterface {
 
-void logException(const char* function) noexcept {
-  try {
-    log::error("%s: memory or threads are short, nothing was done", function);
-  } catch (...) {  // there is no memory for the line either
-    static_cast<void>(function);
-  }
-}
-
 namespace {
 
-/// Recursive: only for values from readers that bound their depth.
-int depthOf(const PropertyValue& value) {
-  int within = 0;
-  if (const PropertyArray* array = value.array()) {
-    for (const PropertyValue& element : *array) within = std::max(within, depthOf(element));
-    return within + 1;
-  }
-  if (const PropertyDictionary* dictionary = value.dictionary()) {
-    for (const auto& entry : *dictionary) within = std::max(within, depthOf(entry.value));
-    return within + 1;
-  }
-  return 0;
+void addWithin(Extent& extent, const PropertyValue& value) {
+  const Extent within = extentOf(value);
+  extent.depth = std::max(extent.depth, within.depth + 1);
+  extent.values += within.values;
 }
 
 }  // namespace
 
-VelkReportingValue* newValue(PropertyValue value, int depth) {
+Extent extentOf(const PropertyValue& value) {
+  Extent extent;
+  if (const PropertyArray* array = value.array()) {
+    extent.depth = 1;
+    for (const PropertyValue& element : *array) addWithin(extent, element);
+  } else if (const PropertyDictionary* dictionary = value.dictionary()) {
+    extent.depth = 1;
+    for (const auto& entry : *dictionary) addWithin(extent, entry.value);
+  }
+  return extent;
+}
+
+VelkReportingValue* newValue(PropertyValue value, Extent extent) {
   auto* handle = new VelkReportingValue;
   handle->value = std::move(value);
-  handle->depth = depth;
+  handle->extent = extent;
   return handle;
 }
 
 VelkReportingValue* newValue(PropertyValue value) {
-  const int depth = depthOf(value);
-  return newValue(std::move(value), depth);
+  const Extent extent = extentOf(value);
+  return newValue(std::move(value), extent);
 }
 
 const PropertyDictionary* dictionaryOf(const VelkReportingValue* value) noexcept {
@@ -54,6 +49,10 @@ const PropertyDictionary* dictionaryOf(const VelkReportingValue* value) noexcept
 
 const PropertyArray* arrayOf(const VelkReportingValue* value) noexcept {
   return value != nullptr ? std::as_const(value->value).array() : nullptr;
+}
+
+std::int64_t boundedInteger(const PropertyValue* value) noexcept {
+  return value != nullptr && value->unsignedInteger() != nullptr ? INT64_MAX : integerValue(value);
 }
 
 std::optional<PropertyDictionary> optionalDictionary(const VelkReportingValue* value) {
@@ -75,7 +74,7 @@ const PropertyValue* valueOf(const VelkReportingValue* value) { return value != 
 
 template <class From>
 VelkReportingValue* makeValue(const char* function, From from) {
-  return guarded(function, nullptr, [&] { return newValue(PropertyValue(std::move(from)), 0); });
+  return guarded(function, nullptr, [&] { return newValue(PropertyValue(std::move(from)), {}); });
 }
 
 }  // namespace
@@ -104,16 +103,16 @@ VelkReportingValue* VelkReportingValueCreateData(const void* bytes, size_t size)
   return guarded(__func__, nullptr, [&] {
     velk::ByteData data(size);
     if (size != 0) std::memcpy(data.data(), bytes, size);
-    return newValue(PropertyValue(std::move(data)), 0);
+    return newValue(PropertyValue(std::move(data)), {});
   });
 }
 
 VelkReportingValue* VelkReportingArrayCreate(void) {
-  return guarded(__func__, nullptr, [] { return newValue(PropertyArray(), 1); });
+  return guarded(__func__, nullptr, [] { return newValue(PropertyArray()); });
 }
 
 VelkReportingValue* VelkReportingDictionaryCreate(void) {
-  return guarded(__func__, nullptr, [] { return newValue(PropertyDictionary(), 1); });
+  return guarded(__func__, nullptr, [] { return newValue(PropertyDictionary()); });
 }
 
 VelkReportingValue* VelkReportingValueRetain(const VelkReportingValue* value) {
@@ -125,7 +124,7 @@ void VelkReportingValueRelease(VelkReportingValue* value) { velk::cinterface::re
 
 VelkReportingValue* VelkReportingValueCopy(const VelkReportingValue* value) {
   if (value == nullptr) return nullptr;
-  return guarded(__func__, nullptr, [&] { return newValue(value->value, value->depth); });
+  return guarded(__func__, nullptr, [&] { return newValue(value->value, value->extent); });
 }
 
 bool VelkReportingValueIsEqual(const VelkReportingValue* left, const VelkReportingValue* right) {
@@ -139,7 +138,9 @@ VelkReportingValueType VelkReportingValueGetType(const VelkReportingValue* value
 }
 
 bool VelkReportingValueGetBoolean(const VelkReportingValue* value) { return velk::booleanValue(valueOf(value)); }
-int64_t VelkReportingValueGetInteger(const VelkReportingValue* value) { return velk::integerValue(valueOf(value)); }
+int64_t VelkReportingValueGetInteger(const VelkReportingValue* value) {
+  return velk::cinterface::boundedInteger(valueOf(value));
+}
 double VelkReportingValueGetReal(const VelkReportingValue* value) { return velk::doubleValue(valueOf(value)); }
 
 uint64_t VelkReportingValueGetUnsignedInteger(const VelkReportingValue* value) {

@@ -1,5 +1,6 @@
 // The services of the class that need no client object: identifiers, hierarchy tokens, one-shot messages.
 
+#include "client/Border.h"
 #include "client/ClientRuntime.h"
 #include "client/DaemonConnection.h"
 #include "client/LogTexts.h"
@@ -7,6 +8,9 @@
 #include "client/VelkReporting.h"
 #include "client/VelkReportingImplementation.h"
 #include "foundation/Uuid.h"
+#include "ipc/CborWriter.h"
+#include "ipc/Limits.h"
+#include "ipc/MethodTable.h"
 #include "ipc/SessionProxies.h"
 #include "ipc/Vocabulary.h"
 #include "platform/Log.h"
@@ -15,28 +19,33 @@
 namespace velk {
 
 std::string VelkReporting::getPersistentIdentifierForDNU(bool respectConsent) {
-  return velk::getPersistentIdentifierForDNU(ClientRuntime::shared().defaults(), respectConsent);
+  return guarded("getPersistentIdentifierForDNU", {}, [&] {
+    return velk::getPersistentIdentifierForDNU(ClientRuntime::shared().defaults(), respectConsent);
+  });
 }
 
 void VelkReporting::regeneratePersistentIdentifierForDNU(bool respectConsent) {
-  velk::regeneratePersistentIdentifierForDNU(ClientRuntime::shared().defaults(), respectConsent);
+  guardedVoid("regeneratePersistentIdentifierForDNU",
+              [&] { velk::regeneratePersistentIdentifierForDNU(ClientRuntime::shared().defaults(), respectConsent); });
 }
 
 std::optional<PropertyDictionary> VelkReporting::newHierarchyTokenFromParentToken(
     const std::optional<PropertyValue>& parentToken) {
-  PropertyDictionary token;
-  if (!parentToken) {
-    token.set(kVelkReportingHierarchyTokenTokenID, randomUuidText());
-    token.set(kVelkReportingHierarchyTokenLevel, 0);
+  return guarded("newHierarchyTokenFromParentToken", std::nullopt, [&]() -> std::optional<PropertyDictionary> {
+    PropertyDictionary token;
+    if (!parentToken) {
+      token.set(kVelkReportingHierarchyTokenTokenID, randomUuidText());
+      token.set(kVelkReportingHierarchyTokenLevel, 0);
+      return token;
+    }
+    const PropertyDictionary* parent = parentToken->dictionary();
+    const PropertyValue* identifier = parent != nullptr ? parent->find(kVelkReportingHierarchyTokenTokenID) : nullptr;
+    if (identifier == nullptr) return std::nullopt;
+    const std::int64_t level = integerValue(parent->find(kVelkReportingHierarchyTokenLevel));
+    token.set(kVelkReportingHierarchyTokenTokenID, *identifier);
+    token.set(kVelkReportingHierarchyTokenLevel, static_cast<std::int64_t>(static_cast<std::uint64_t>(level) + 1));
     return token;
-  }
-  const PropertyDictionary* parent = parentToken->dictionary();
-  const PropertyValue* identifier = parent != nullptr ? parent->find(kVelkReportingHierarchyTokenTokenID) : nullptr;
-  if (identifier == nullptr) return std::nullopt;
-  const std::int64_t level = integerValue(parent->find(kVelkReportingHierarchyTokenLevel));
-  token.set(kVelkReportingHierarchyTokenTokenID, *identifier);
-  token.set(kVelkReportingHierarchyTokenLevel, static_cast<std::int64_t>(static_cast<std::uint64_t>(level) + 1));
-  return token;
+  });
 }
 
 namespace {
@@ -63,6 +72,18 @@ struct OneMessage {
   std::uint16_t type;
   std::optional<PropertyDictionary> payload;
 };
+
+const char* reasonNotToSend(const OneMessage& message) {
+  CborWriter writer(ipc::kMaximumFrameBytes);
+  writer.beginArray(6);
+  writer.unsignedInteger(static_cast<std::uint32_t>(Method::sendMessageWithSessionInfo));
+  writer.value(message.sessionInfo);
+  writer.optional(message.userInfo);
+  writer.unsignedInteger(message.category);
+  writer.unsignedInteger(message.type);
+  writer.optional(message.payload);
+  return writer.fault() == CborWriter::Fault::none ? nullptr : CborWriter::description(writer.fault());
+}
 
 void sendOneMessage(ClientRuntime& runtime, const OneMessage& message, std::shared_ptr<OneShotSlot> slot) {
   log::standard(texts::kClientStartsLogging);
@@ -92,25 +113,36 @@ bool VelkReporting::sendOneMessageWithSessionInfo(const std::optional<PropertyDi
                                                   const std::optional<PropertyDictionary>& userInfo,
                                                   std::uint16_t category, std::uint16_t type,
                                                   const std::optional<PropertyDictionary>& payload, Error* error) {
-  ClientRuntime& runtime = ClientRuntime::shared();
-  const auto refuse = [error](Error reason) {
-    if (error != nullptr) *error = std::move(reason);
-    return false;
-  };
-  if (auto invalid = validateSessionInfo(sessionInfo)) return refuse(std::move(*invalid));
-  const std::string domain(kVelkReportingErrorDomain);
-  if (category == 0) return refuse({domain, 4, "the category is 0"});
-  if (!runtime.beginOneMessage(kMaximumOneShots)) {
-    return refuse({domain, VelkReportingImplementation::kOutboxFull, "too many single messages are under way"});
-  }
-  auto slot = std::make_shared<OneShotSlot>(runtime);
-  if (error != nullptr) *error = {};
-  OneMessage message{*sessionInfo, userInfo, category, type, payload};
-  message.sessionInfo.set(kVelkReportingSessionInfoBatchEvent, false);  // the event must go out at once
-  runtime.oneMessageQueue()->async([&runtime, message = std::move(message), slot = std::move(slot)]() mutable {
-    sendOneMessage(runtime, message, std::move(slot));
+  return guarded("sendOneMessageWithSessionInfo", false, [&] {
+    ClientRuntime& runtime = ClientRuntime::shared();
+    const auto refuse = [error](Error reason) {
+      if (error != nullptr) *error = std::move(reason);
+      return false;
+    };
+    if (auto invalid = validateSessionInfo(sessionInfo)) return refuse(std::move(*invalid));
+    const std::string domain(kVelkReportingErrorDomain);
+    if (category == 0) return refuse({domain, 4, "the category is 0"});
+    OneMessage message{*sessionInfo, userInfo, category, type, payload};
+    message.sessionInfo.set(kVelkReportingSessionInfoBatchEvent, false);  // the event must go out at once
+    if (const char* reason = reasonNotToSend(message)) {
+      log::error(texts::kOneMessageIsNotSendable, category, reason);
+      return refuse(
+          {domain, VelkReportingImplementation::kNotSendable, std::string("the event cannot be sent: ") + reason});
+    }
+    if (const auto started = runtime.loop().start(); !started) {
+      log::error(texts::kNoThread, "sendOneMessageWithSessionInfo", started.error());
+      return refuse({domain, VelkReportingImplementation::kNoResources, "the library gets no thread"});
+    }
+    if (!runtime.beginOneMessage(kMaximumOneShots)) {
+      return refuse({domain, VelkReportingImplementation::kOutboxFull, "too many single messages are under way"});
+    }
+    auto slot = std::make_shared<OneShotSlot>(runtime);
+    if (error != nullptr) *error = {};
+    runtime.oneMessageQueue()->async([&runtime, message = std::move(message), slot = std::move(slot)]() mutable {
+      sendOneMessage(runtime, message, std::move(slot));
+    });
+    return true;
   });
-  return true;
 }
 
 }  // namespace velk

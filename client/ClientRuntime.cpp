@@ -11,13 +11,17 @@ namespace velk {
 
 namespace {
 
+/// How soon the system is asked again for a thread that it refused.
+constexpr Duration kThreadPause = std::chrono::milliseconds(100);
+
 // Callbacks block in ways that the pool cannot see, so it has to be generous with threads from the start.
-ThreadPoolOptions callbackThreads() {
+ThreadPoolOptions callbackThreads(EventLoop& loop) {
   ThreadPoolOptions options;
   options.runningThreads = 64;
   options.maximumThreads = 64;
   options.idleThreadLifetime = std::chrono::seconds(2);
   options.isNeverStopped = true;
+  options.retryLater = [&loop](Task task) { loop.postAfter(kThreadPause, std::move(task)); };
   return options;
 }
 
@@ -37,10 +41,15 @@ ClientRuntime& ClientRuntime::shared() {
   return runtimes.get([] { return new ClientRuntime; });
 }
 
+bool ClientRuntime::isOnLoop() {
+  const ClientRuntime* const runtime = runtimes.existing();
+  return runtime != nullptr && runtime->_loop.isCurrent();
+}
+
 ClientRuntime::ClientRuntime()
     : _loop("velkreporting"),
-      _callbackThreads(makeThreadPool(callbackThreads())),
-      _periodicTaskThreads(makeThreadPool(callbackThreads())),
+      _callbackThreads(makeThreadPool(callbackThreads(_loop))),
+      _periodicTaskThreads(makeThreadPool(callbackThreads(_loop))),
       _oneMessageQueue(_loop.makeLoopQueue("com.tavrin.VelkReporting.sendOneMessageQueue")) {
   log::setSinkIfNone(log::makeLibrarySink(), log::librarySinkLevel());
   if (!watchesExit.exchange(true)) static_cast<void>(std::atexit(&ClientRuntime::processExits));

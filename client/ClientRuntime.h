@@ -33,6 +33,9 @@ class ClientRuntime {
   /// The process's own. A forked child gets a new one for the clients that it makes itself.
   [[nodiscard]] static ClientRuntime& shared();
 
+  /// Whether this is the thread of `loop()`. Makes nothing, unlike `shared()`.
+  [[nodiscard]] static bool isOnLoop();
+
   /// The library's thread, which never runs the user's code.
   [[nodiscard]] EventLoop& loop() { return _loop; }
 

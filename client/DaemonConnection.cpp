@@ -20,7 +20,13 @@ Result<std::shared_ptr<Connection>> connectToDaemon(ClientRuntime& runtime, std:
 bool isDistrust(const Error& error) { return error.domain == kTrustErrorDomain && error.code == kDistrustedService; }
 
 ProxyErrorHandler loggingHandler(std::string_view text) {
-  return [text](const Error& error) { log::standard(text, error); };
+  return [text](const Error& error) {
+    const auto code = static_cast<ConnectionError>(error.code);
+    const bool isNeverSent = error.domain == kConnectionErrorDomain &&
+                             (code == ConnectionError::tooLarge || code == ConnectionError::notEncodable);
+    if (isNeverSent) return log::error(text, error);
+    log::standard(text, error);
+  };
 }
 
 }  // namespace velk

@@ -21,7 +21,8 @@ inline constexpr std::string_view kTrustErrorDomain = "VelkReportingTrust";
                                                                   std::shared_ptr<Queue> deliveryQueue);
 [[nodiscard]] bool isDistrust(const Error& error);
 
-/// An error handler that fills `text`, which outlives it, with the error and logs it.
+/// An error handler that fills `text`, which outlives it, with the error and logs it: as an error if the call can never
+/// be sent, whatever the daemon does, since its owner hears of that in no other way.
 [[nodiscard]] ProxyErrorHandler loggingHandler(std::string_view text);
 
 }  // namespace velk

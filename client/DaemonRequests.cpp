@@ -25,58 +25,31 @@ void removeUploaded(const FileToHandOver& file) {
   if (!removed) log::standard(texts::kUploadedFileStays, removed.error());
 }
 
-/// A callback of the user, shared between the reply and the error handler: whichever comes runs it, elsewhere, once.
-template <class... Arguments>
-class SharedCallback {
- public:
-  SharedCallback(ClientRuntime& runtime, std::function<void(Arguments...)> callback)
-      : _runtime(&runtime), _callback(std::make_shared<std::function<void(Arguments...)>>(std::move(callback))) {}
-
-  template <class... Given>
-  void operator()(Given... given) const {
-    auto callback = std::exchange(*_callback, nullptr);
-    if (!callback) return;
-    _runtime->runCallback([callback = std::move(callback), given = std::make_tuple(std::move(given)...)] {
-      std::apply(callback, given);
-    });
-  }
-
- private:
-  ClientRuntime* _runtime;
-  std::shared_ptr<std::function<void(Arguments...)>> _callback;
-};
-
 }  // namespace
 
-ConfigurationReply VelkReportingImplementation::statesReply(VelkReporting::StatesCallback callback) {
-  const SharedCallback<const std::optional<PropertyArray>&> shared(_runtime, std::move(callback));
-  return [self = weak_from_this(), shared](const std::optional<PropertyArray>& enabled,
-                                           const std::optional<PropertyArray>& whitelist,
-                                           const std::optional<PropertyArray>& blacklist) {
+ConfigurationReply VelkReportingImplementation::statesReply(const StatesCallback& callback) {
+  return [self = weak_from_this(), callback](const std::optional<PropertyArray>& enabled,
+                                             const std::optional<PropertyArray>& whitelist,
+                                             const std::optional<PropertyArray>& blacklist) {
     if (const auto strong = self.lock()) {
       strong->_reporting->async([lists = strong->_lists, enabled, whitelist, blacklist] {
         lists->replace(std::make_shared<const EventLists>(enabled, whitelist, blacklist));
         log::standard(texts::kCachedLists, enabled ? enabled->size() : 0, whitelist, blacklist);
       });
     }
-    shared(enabled);
+    callback(enabled);
   };
 }
 
-void VelkReportingImplementation::startConfiguration(VelkReporting::StatesCallback completionHandler) {
+void VelkReportingImplementation::startConfiguration(const StatesCallback& completionHandler) {
   const auto connection = _link->connect();
   _link->description().isConfigured = true;
-  if (!connection) {
-    log::standard(texts::kStartConfigurationProxyFailure, noDaemon());
-    SharedCallback<const std::optional<PropertyArray>&>(_runtime,
-                                                        std::move(completionHandler))(std::optional<PropertyArray>());
-    return;
-  }
-  const SharedCallback<const std::optional<PropertyArray>&> onError(_runtime, completionHandler);
-  SessionInterfaceProxy(connection, [onError](const Error& error) {
+  const auto failed = [completionHandler](const Error& error) {
     log::standard(texts::kStartConfigurationProxyFailure, error);
-    onError(std::optional<PropertyArray>());
-  }).startConfigWithCompletionHandler(statesReply(std::move(completionHandler)));
+    completionHandler(std::optional<PropertyArray>());
+  };
+  if (!connection) return failed(noDaemon());
+  SessionInterfaceProxy(connection, failed).startConfigWithCompletionHandler(statesReply(completionHandler));
   fetchDisplayURL(connection);
 }
 
@@ -90,37 +63,35 @@ void VelkReportingImplementation::fetchDisplayURL(const std::shared_ptr<Connecti
 }
 
 void VelkReportingImplementation::fetchReportingStates(const std::optional<PropertyDictionary>& userInfo,
-                                                       VelkReporting::StatesCallback fetchComplete) {
+                                                       const StatesCallback& fetchComplete) {
   const auto connection = _link->connect();
   _link->description().receiveUserInfo(userInfo);
-  const SharedCallback<const std::optional<PropertyArray>&> onError(_runtime, fetchComplete);
-  const auto failed = [onError](const Error& error) {
+  const auto failed = [fetchComplete](const Error& error) {
     log::standard(texts::kFetchStatesProxyFailure, error);
-    onError(std::optional<PropertyArray>());
+    fetchComplete(std::optional<PropertyArray>());
   };
   if (!connection) return failed(noDaemon());
-  SessionInterfaceProxy(connection, failed).fetchStatesWithUserInfo(userInfo, statesReply(std::move(fetchComplete)));
+  SessionInterfaceProxy(connection, failed).fetchStatesWithUserInfo(userInfo, statesReply(fetchComplete));
 }
 
-void VelkReportingImplementation::flush(VelkReporting::FlushCallback completion) {
-  const SharedCallback<const std::optional<Error>&> shared(_runtime, std::move(completion));
-  const auto failed = [shared](const Error& error) {
+void VelkReportingImplementation::flush(const FlushCallback& completion) {
+  const auto failed = [completion](const Error& error) {
     log::standard(texts::kFlushProxyFailure, error);
-    shared(std::optional<Error>(error));
+    completion(std::optional<Error>(error));
   };
   const auto connection = _link->connect();
   if (!connection) return failed(noDaemon());
   SessionInterfaceProxy(connection, failed)
-      .flushMessagesWithCompletion(
-          [self = weak_from_this(), shared](const std::optional<std::string>& text, const std::optional<Error>& error) {
-            if (error) {
-              log::standard(texts::kFlushFailed, *error);
-            } else {
-              log::standard(texts::kFlushedSuccessfully, text);
-              if (const auto strong = self.lock(); strong && text) strong->logText(*text);
-            }
-            shared(error);
-          });
+      .flushMessagesWithCompletion([self = weak_from_this(), completion](const std::optional<std::string>& text,
+                                                                         const std::optional<Error>& error) {
+        if (error) {
+          log::standard(texts::kFlushFailed, *error);
+        } else {
+          log::standard(texts::kFlushedSuccessfully, text);
+          if (const auto strong = self.lock(); strong && text) strong->logText(*text);
+        }
+        completion(error);
+      });
 }
 
 void VelkReportingImplementation::updateSharedDataWithDictionary(const PropertyDictionary& dictionary) {
@@ -162,31 +133,30 @@ Result<std::shared_ptr<const FileToHandOver>> VelkReportingImplementation::openF
 }
 
 void VelkReportingImplementation::uploadFile(const std::string& url, const std::shared_ptr<const FileToHandOver>& file,
-                                             VelkReporting::UploadCallback completionHandler) {
+                                             const UploadCallback& completionHandler) {
   const auto failed = loggingHandler(texts::kUploadFileProxyFailure);
   const auto connection = _link->connect();
   if (!connection) return failed(noDaemon());
   auto descriptor = file->descriptor();
   if (!descriptor) return failed(descriptor.error());
   SessionInterfaceProxy(connection, failed)
-      .uploadFileAtPath(
-          url, randomUuidText(), std::move(*descriptor),
-          [runtime = &_runtime, file, handler = std::move(completionHandler)](bool uploaded, bool isDelivered) {
-            runtime->runCallback([file, handler, uploaded, isDelivered] {
-              if (isDelivered) removeUploaded(*file);
-              if (handler) handler(uploaded, std::nullopt);
-            });
-          });
+      .uploadFileAtPath(url, randomUuidText(), std::move(*descriptor),
+                        [runtime = &_runtime, file, completionHandler](bool uploaded, bool isDelivered) {
+                          runtime->runCallback([file, completionHandler, uploaded, isDelivered] {
+                            if (isDelivered) removeUploaded(*file);
+                            completionHandler.callHere(uploaded, std::optional<Error>());
+                          });
+                        });
 }
 
-void VelkReportingImplementation::uploadLogData(const PropertyArray& logData,
-                                                VelkReporting::UploadCallback completionHandler) {
+void VelkReportingImplementation::uploadLogData(const PropertyArray& logData, const UploadCallback& completionHandler) {
   const auto failed = loggingHandler(texts::kUploadDataArrayProxyFailure);
   const auto connection = _link->connect();
   if (!connection) return failed(noDaemon());
-  const SharedCallback<bool, const std::optional<Error>&> shared(_runtime, std::move(completionHandler));
   SessionInterfaceProxy(connection, failed)
-      .uploadLogData(logData, [shared](bool uploaded, const std::optional<Error>& error) { shared(uploaded, error); });
+      .uploadLogData(logData, [completionHandler](bool uploaded, const std::optional<Error>& error) {
+        completionHandler(uploaded, error);
+      });
 }
 
 }  // namespace velk

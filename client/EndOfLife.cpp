@@ -14,6 +14,8 @@ namespace velk {
 namespace {
 
 constexpr std::chrono::milliseconds kLongestBound = std::chrono::hours(1);
+/// How soon a connection is tried again that took nothing although it had room.
+constexpr Duration kStuckPause = std::chrono::milliseconds(10);
 
 }  // namespace
 
@@ -23,56 +25,70 @@ void VelkReporting::setEndOfLifeBound(std::chrono::milliseconds bound) {
 }
 
 void VelkReportingImplementation::endOfLife(const void* client) {
-  const Clock& clock = _runtime.loop().clock();
   const SteadyTime deadline = _runtime.deadlineFor(_endOfLifeBound.load(std::memory_order_relaxed));
   const bool isOnLoop = _runtime.loop().isCurrent();
   const bool mayWait = !isOnLoop && !_periodicTasks->isInCallback();  // a tick does not end before its callbacks do
   _periodicTasks->withdrawAll(!isOnLoop);
-  if (mayWait) sendHeldEventsWithin(deadline, Turn::behindTicks);
+  if (mayWait) return leave(client, deadline);
+  _runtime.runCallback([self = shared_from_this(), client, deadline] { self->leave(client, deadline); });
+  // Where no such thread is to be had, all of them being the user's just now, the session ends all the same.
+  _reporting->asyncAfter(deadline - _runtime.loop().clock().steadyTime(), [weak = weak_from_this(), client, deadline] {
+    if (const auto self = weak.lock()) self->finishAndClose(client, deadline);
+  });
+}
+
+void VelkReportingImplementation::leave(const void* client, SteadyTime deadline) {
+  const Clock& clock = _runtime.loop().clock();
+  retryAtOnce();
+  sendHeldEventsWithin(deadline, Turn::behindTicks);
   auto done = std::make_shared<Semaphore>();
-  onQueue([client, done](VelkReportingImplementation& self) {
-    self.finishAndClose(client);
+  onQueue([client, done, deadline](VelkReportingImplementation& self) {
+    self.finishAndClose(client, deadline);
     done->signal();
   });
-  if (!mayWait || !done->waitFor(deadline - clock.steadyTime())) return;
+  if (!done->waitFor(deadline - clock.steadyTime())) return;
   const auto connection = _link->current();
   const Duration left = deadline - clock.steadyTime();
   if (connection && left > Duration::zero()) static_cast<void>(connection->waitUntilSent(left));
 }
 
-/// Off the queue: makes room in the connection, again and again, for what did not fit into it.
+/// Off the queue: makes room in the connection, again and again, for what did not fit into it, and waits for a daemon
+/// that was there a moment ago.
 std::size_t VelkReportingImplementation::sendHeldEventsWithin(SteadyTime deadline, Turn turn) {
   const Clock& clock = _runtime.loop().clock();
-  for (;;) {
+  std::size_t events = 0;
+  std::size_t heldBefore = 0;
+  for (Duration pause{};;) {
     struct Look {
       Semaphore over;
-      std::atomic<std::size_t> events{0};
-      std::atomic<bool> isLeft{false};
+      std::size_t events = 0;
+      std::size_t held = 0;
+      std::shared_ptr<Connection> connection;
+      std::optional<Duration> retriesAfter;
     };
     auto look = std::make_shared<Look>();
-    const auto send = [look](VelkReportingImplementation& self) {
-      self.sendHeldEvents();
-      look->events = self.heldEvents();
-      look->isLeft = !self._outbox.held.empty();
+    const auto work = [self = shared_from_this(), look] {
+      self->sendEvents(self->_incoming.takeForWork());
+      self->sendHeldEvents();
+      look->events = self->heldEvents();
+      look->held = self->_outbox.held.size();
+      look->connection = self->_link->current();
+      if (look->connection || self->_link->mayComeBack()) look->retriesAfter = self->_link->pauseLeft();
       look->over.signal();
     };
-    if (turn == Turn::behindTicks) {
-      onQueue(send);
-    } else {
-      _queue->async([self = shared_from_this(), send] {
-        self->sendEvents(self->_incoming.takeForWork());
-        send(*self);
-      });
-    }
-    if (!look->over.waitFor(deadline - clock.steadyTime()) || !look->isLeft) return look->events;
-    const auto connection = _link->current();
-    if (!connection || connection->hasEnded()) return look->events;
-    if (!connection->waitUntilSent(deadline - clock.steadyTime())) return look->events;
+    turn == Turn::behindTicks ? _reporting->asyncAfter(pause, work) : _queue->asyncAfter(pause, work);
+    if (!look->over.waitFor(deadline - clock.steadyTime())) return events;
+    events = look->events;
+    if (look->held == 0 || !look->retriesAfter) return events;
+    if (look->connection && !look->connection->waitUntilSent(deadline - clock.steadyTime())) return events;
+    // One that takes nothing more may not know yet that it has ended.
+    const bool isStuck = std::exchange(heldBefore, look->held) == look->held;
+    pause = std::max(*look->retriesAfter, isStuck ? kStuckPause : Duration::zero());
   }
 }
 
-void VelkReportingImplementation::finishAndClose(const void* client) {
-  _isFinished = true;
+void VelkReportingImplementation::finishAndClose(const void* client, SteadyTime deadline) {
+  if (std::exchange(_isFinished, true)) return;
   _periodicTasks->end();
   sendEvents(_incoming.takeForWork());  // what a tick reported that was not over yet when the last reference went
   sendWhatFits();
@@ -86,8 +102,12 @@ void VelkReportingImplementation::finishAndClose(const void* client) {
   log::standard(texts::kAboutToDealloc, client);
   finishSession();
   _aggregation->releaseAggregationBlock();
-  replaceLoggingBlock(nullptr);
-  _link->close();
+  _loggingBlock = nullptr;
+  _link->close(deadline - _runtime.loop().clock().steadyTime());
+}
+
+void VelkReportingImplementation::retryAtOnce() {
+  _queue->async([self = shared_from_this()] { self->_link->retryAtOnce(); });
 }
 
 std::size_t VelkReportingImplementation::heldEvents() const {
@@ -101,6 +121,7 @@ void VelkReportingImplementation::sendBeforeExit(SteadyTime begun) {
   const Clock& clock = _runtime.loop().clock();
   const Duration bound = _endOfLifeBound.load(std::memory_order_relaxed);
   const SteadyTime deadline = begun + bound;
+  retryAtOnce();
   // What is queued has its turn first, while there is hope that a tick ends: a process that a module's callback ends
   // has none. Nothing is taken along to where it would be stuck.
   if (!_periodicTasks->isInCallback()) {
@@ -110,6 +131,7 @@ void VelkReportingImplementation::sendBeforeExit(SteadyTime begun) {
   }
   const std::size_t lost = sendHeldEventsWithin(deadline, Turn::pastTicks);
   if (lost != 0) log::error("aboutToExit: %u events are lost: no daemon takes them", lost);
+  reportOverflow();
   const auto connection = _link->current();
   const Duration left = deadline - clock.steadyTime();
   if (connection && left > Duration::zero()) static_cast<void>(connection->waitUntilSent(left));

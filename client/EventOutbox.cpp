@@ -1,31 +1,92 @@
 #include "client/EventOutbox.h"
 
+#include <cstdint>
+#include <cstring>
+#include <string_view>
+
+#include "ipc/CborWriter.h"
+#include "ipc/Limits.h"
+#include "ipc/MethodTable.h"
+
 namespace velk {
 
 namespace {
 
 constexpr std::size_t kEntryOverhead = 16;
+/// Below it there are neither too many values in the event nor too many keys in one dictionary, since each takes the
+/// overhead; and it is far from filling a frame.
+constexpr std::size_t kSurelySmall = ipc::kMaximumKeysInMap * kEntryOverhead;
 
-std::size_t sizeOf(const PropertyValue& value, int depth) {
-  if (const auto* text = value.string()) return kEntryOverhead + text->size();
-  if (const auto* bytes = value.data()) return kEntryOverhead + bytes->size();
-  if (depth == 0) return kEntryOverhead;  // deeper than the wire carries: it will be refused there
-  std::size_t size = kEntryOverhead;
-  if (const auto* array = value.array()) {
-    for (const auto& element : *array) size += sizeOf(element, depth - 1);
-  } else if (const auto* dictionary = value.dictionary()) {
-    for (const auto& entry : *dictionary) size += entry.key.size() + sizeOf(entry.value, depth - 1);
+bool isAscii(std::string_view text) noexcept {
+  constexpr std::uint64_t kHighBits = 0x8080808080808080U;
+  std::uint64_t seen = 0;
+  for (; text.size() >= sizeof(seen); text.remove_prefix(sizeof(seen))) {
+    std::uint64_t chunk = 0;
+    std::memcpy(&chunk, text.data(), sizeof(chunk));
+    seen |= chunk;
   }
-  return size;
+  std::uint64_t rest = 0;
+  std::memcpy(&rest, text.data(), text.size());
+  return ((seen | rest) & kHighBits) == 0;
+}
+
+void add(EventEstimate& estimate, const PropertyValue& value, int depth);
+
+void addText(EventEstimate& estimate, std::string_view text) {
+  estimate.size += text.size();
+  if (estimate.isSurelySendable) estimate.isSurelySendable = isAscii(text);
+}
+
+void add(EventEstimate& estimate, const PropertyArray& array, int depth) {
+  for (const auto& element : array) {
+    if (estimate.size > EventRoom::kMaximumBytes) return;
+    add(estimate, element, depth);
+  }
+}
+
+void add(EventEstimate& estimate, const PropertyDictionary& dictionary, int depth) {
+  for (const auto& entry : dictionary) {
+    if (estimate.size > EventRoom::kMaximumBytes) return;
+    addText(estimate, entry.key);
+    add(estimate, entry.value, depth);
+  }
+}
+
+/// `depth` counts the containers that may still stand within each other.
+void add(EventEstimate& estimate, const PropertyValue& value, int depth) {
+  estimate.size += kEntryOverhead;
+  if (const auto* text = value.string()) return addText(estimate, *text);
+  if (const auto* bytes = value.data()) {
+    estimate.size += bytes->size();
+    return;
+  }
+  const auto* array = value.array();
+  const auto* dictionary = value.dictionary();
+  if (array == nullptr && dictionary == nullptr) return;
+  if (depth == 0) {
+    estimate.isSurelySendable = false;  // deeper than the wire carries
+  } else if (array != nullptr) {
+    add(estimate, *array, depth - 1);
+  } else {
+    add(estimate, *dictionary, depth - 1);
+  }
 }
 
 }  // namespace
 
-std::size_t estimatedSize(const PropertyDictionary& message) {
-  constexpr int kDepth = 32;
-  std::size_t size = kEntryOverhead;
-  for (const auto& entry : message) size += entry.key.size() + sizeOf(entry.value, kDepth);
-  return size;
+EventEstimate estimateEvent(const PropertyDictionary& message) {
+  EventEstimate estimate{kEntryOverhead, true};
+  add(estimate, message, ipc::kMaximumDepth - 2);  // within the body's array and the message itself
+  if (estimate.size >= kSurelySmall) estimate.isSurelySendable = false;
+  return estimate;
+}
+
+const char* reasonNotToSend(const PropertyDictionary& message) {
+  CborWriter writer(ipc::kMaximumFrameBytes);
+  writer.beginArray(2);
+  writer.unsignedInteger(static_cast<std::uint32_t>(Method::sendMessageWithDictionary));
+  writer.value(message);
+  return writer.fault() == CborWriter::Fault::none ? nullptr : CborWriter::description(writer.fault());
 }
 
 bool EventRoom::reserve(std::size_t size) noexcept {

@@ -13,6 +13,8 @@ inline constexpr std::string_view kSessionDisabled = "initWithSessionInfo: the s
 inline constexpr std::string_view kNotEntitled = "initWithSessionInfo: IPC not entitled, %d";
 inline constexpr std::string_view kFailedToConnect = "initWithSessionInfo: Failed to connect to daemon";
 inline constexpr std::string_view kFailedToCreateQueue = "initWithSessionInfo: Failed to create reporting queue";
+inline constexpr std::string_view kNoThread =
+    "%s: the library gets no thread: %s; raise the limits of this process on threads and descriptors, and try again";
 inline constexpr std::string_view kConnectionInvalidated = "initWithSessionInfo: IPC connection invalidated";
 inline constexpr std::string_view kConnectionInterrupted = "initWithSessionInfo: IPC connection interrupted";
 
@@ -42,11 +44,20 @@ inline constexpr std::string_view kUrlNotAvailable = "URL not available";
 inline constexpr std::string_view kMissingCategory = "Missing mandatory parameter 'category'";
 inline constexpr std::string_view kMissingType = "Missing mandatory parameter 'type'";
 inline constexpr std::string_view kSentMessage = "sendMessageWithDictionary: %s";
+inline constexpr std::string_view kEventIsNotSendable = "sendMessageWithDictionary: Event %u cannot be sent: %s";
 inline constexpr std::string_view kEventIsFiltered = "Event %u is filtered by storebag";
 inline constexpr std::string_view kDelegateIsSet = "Message Sent Delegate is set to %x:";
 inline constexpr std::string_view kDelegateReads = "Message Sent Delegate reads %x:";
 inline constexpr std::string_view kLoggingBlockSet = "setMessageLoggingBlock: called";
 inline constexpr std::string_view kNotifyCalled = "notifyMessageWasSent: called";
+inline constexpr std::string_view kDelegateIsSlow =
+    "notifyMessageWasSent: the delegate is slower than messages come: until it has caught up, some are dropped";
+inline constexpr std::string_view kDelegateWasSlow =
+    "notifyMessageWasSent: %u messages were dropped: the delegate is slower than they come";
+inline constexpr std::string_view kLoggingBlockIsSlow =
+    "setMessageLoggingBlock: the block is slower than texts come: until it has caught up, some are dropped";
+inline constexpr std::string_view kLoggingBlockWasSlow =
+    "setMessageLoggingBlock: %u texts were dropped: the block is slower than they come";
 inline constexpr std::string_view kFlushMessages = "flushMessages:";
 inline constexpr std::string_view kFlushedSuccessfully =
     "flushMessagesWithCompletion: flushed session successfully with reply %s";
@@ -59,12 +70,22 @@ inline constexpr std::string_view kFileUrlIsNil = "uploadFileWithURL: fileURL pr
 inline constexpr std::string_view kNoExtension =
     "uploadFileWithURL: Failed to get sandbox extension for path %s, errno %d";
 inline constexpr std::string_view kUploadedFileStays = "uploadFileWithURL: An uploaded file stays: %s";
+inline constexpr std::string_view kLogDataIsNoDictionary =
+    "uploadDataArray: What is no dictionary stands in the log data array";
 inline constexpr std::string_view kLogDataArrayIsEmpty = "uploadDataArray: Log data array is empty";
+
+// What goes wrong in the library itself
+inline constexpr std::string_view kNothingWasDone =
+    "%s: nothing was done: %s; raise the limits of this process on memory and threads, and try again";
 
 // Aggregation and the end
 inline constexpr std::string_view kSendMessageToClient = "sendMessageToClient: %u, %u";
 inline constexpr std::string_view kAggregationBlockThrew =
     "sendMessageToClient: Exception during invocation of aggregation block. Disabling aggregation";
+inline constexpr std::string_view kAggregationBlockIsSlow =
+    "sendMessageToClient: the aggregation block is slower than events come: until it has caught up, some are dropped";
+inline constexpr std::string_view kAggregationBlockWasSlow =
+    "sendMessageToClient: %u events were dropped: the aggregation block is slower than they come";
 inline constexpr std::string_view kAboutToDealloc =
     "aboutToDealloc: VelkReporting client session %p is about to dealloc";
 
@@ -103,6 +124,8 @@ inline constexpr std::string_view kOneMessageNoProxy =
     "sendOneMessageWithSessionInfo: Failed to get remote object proxy";
 inline constexpr std::string_view kOneMessageInvalidated = "sendOneMessageWithSessionInfo: IPC connection invalidated";
 inline constexpr std::string_view kOneMessageInterrupted = "sendOneMessageWithSessionInfo: IPC connection interrupted";
+inline constexpr std::string_view kOneMessageIsNotSendable =
+    "sendOneMessageWithSessionInfo: Event %u cannot be sent: %s";
 inline constexpr std::string_view kOneMessageReply = "sendOneMessageWithSessionInfo: %s";
 
 }  // namespace velk::texts

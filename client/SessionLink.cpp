@@ -15,12 +15,14 @@ namespace velk {
 namespace {
 
 constexpr Duration kFirstPause = std::chrono::milliseconds(100);
-/// Of somebody who has something to say.
-constexpr Duration kLongestPause = std::chrono::seconds(10);
+/// Of somebody who is about to end.
+constexpr Duration kLongestLastPause = std::chrono::milliseconds(200);
 /// Of somebody who only wants to be known: a device without a daemon is not kept awake.
 constexpr Duration kLongestQuietPause = std::chrono::minutes(5);
 /// A connection that ends sooner was not wanted: this session is one too many, or the daemon cannot live.
 constexpr Duration kFairLife = std::chrono::seconds(1);
+/// What a service manager, or somebody who installs another version, may take to bring a daemon back.
+constexpr Duration kRestartTime = std::chrono::seconds(30);
 
 }  // namespace
 
@@ -41,10 +43,16 @@ SessionLink::SessionLink(ClientRuntime& runtime, std::shared_ptr<Queue> queue, S
 
 void SessionLink::open(std::function<void()> whenInterrupted) {
   _whenInterrupted = std::move(whenInterrupted);
-  static_cast<void>(connect());
+  if (!tryToConnect() && _description.hasAggregationBlock) reconnectLater();
 }
 
 std::shared_ptr<Connection> SessionLink::connect() {
+  auto connection = tryToConnect();
+  if (!connection) reconnectLater();
+  return connection;
+}
+
+std::shared_ptr<Connection> SessionLink::tryToConnect() {
   auto connection = current();
   if (connection && !connection->hasEnded()) return connection;
   if (connection) forgetConnection();
@@ -57,6 +65,9 @@ std::shared_ptr<Connection> SessionLink::connect() {
   _connectedAt = now();
   setCurrent(connection);
   describeSession(connection);
+  // From here on the queue deals with what comes: the first time this is another thread, which touches nothing of the
+  // queue's any more.
+  connection->resume();
   return connection;
 }
 
@@ -64,13 +75,14 @@ SteadyTime SessionLink::now() const { return _runtime.loop().clock().steadyTime(
 
 void SessionLink::forgetConnection() {
   setCurrent(nullptr);
+  _lostAt = now();
   if (now() - _connectedAt < kFairLife) return growPause();
   _pause = Duration::zero();
   _quietPause = Duration::zero();
 }
 
 void SessionLink::growPause() {
-  _pause = std::clamp(2 * _pause, kFirstPause, kLongestPause);
+  _pause = std::clamp(2 * _pause, kFirstPause, _longestPause);
   _nextAttempt = now() + _pause;
 }
 
@@ -88,6 +100,14 @@ Duration SessionLink::pauseLeft() const {
   if (_pause == Duration::zero()) return Duration::zero();
   return std::max<Duration>(Duration::zero(), _nextAttempt - now());
 }
+
+void SessionLink::retryAtOnce() {
+  _longestPause = kLongestLastPause;
+  _pause = std::min(_pause, _longestPause);
+  _nextAttempt = now();
+}
+
+bool SessionLink::mayComeBack() const { return _lostAt && now() - *_lostAt < kRestartTime; }
 
 std::shared_ptr<Connection> SessionLink::makeConnection() {
   auto made = connectToDaemon(_runtime, _queue);
@@ -110,7 +130,6 @@ std::shared_ptr<Connection> SessionLink::makeConnection() {
     log::standard(texts::kConnectionInterrupted);
     if (const auto link = self.lock()) link->wasInterrupted(interrupted);
   });
-  connection->resume();
   return connection;
 }
 
@@ -158,13 +177,13 @@ void SessionLink::reconnectLater() {
     const auto link = self.lock();
     if (!link) return;
     link->_reconnects = false;
-    if (!link->connect()) link->reconnectLater();
+    if (!link->tryToConnect()) link->reconnectLater();
   });
 }
 
-void SessionLink::close() {
+void SessionLink::close(Duration drainTime) {
   _isClosed = true;
-  if (const auto connection = current()) connection->closeAfterSending();
+  if (const auto connection = current()) connection->closeAfterSending(drainTime);
 }
 
 }  // namespace velk

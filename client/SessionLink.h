@@ -50,7 +50,7 @@ class SessionLink : public std::enable_shared_from_this<SessionLink> {
 
   /// A connection that works, made now if need be; null when nobody answers. After an attempt that failed, or a
   /// connection that ended within a second, the next one is made at the earliest after a pause that grows from 100 ms
-  /// to 10 s.
+  /// to 10 s; it is made even if nobody asks for it again.
   [[nodiscard]] std::shared_ptr<Connection> connect();
 
   /// The connection as it is, or null. Any thread.
@@ -62,10 +62,18 @@ class SessionLink : public std::enable_shared_from_this<SessionLink> {
   /// How long until `connect` would try again.
   [[nodiscard]] Duration pauseLeft() const;
 
-  /// Says goodbye behind what was sent. No connection is made any more.
-  void close();
+  /// For a client whose last moments have come: the next `connect` tries at once, and pauses are short from here on.
+  void retryAtOnce();
+  /// Whether somebody in his last moments should wait for a daemon that does not answer. It was there, and went away no
+  /// longer ago than a restart takes: then it should. Where no daemon is, or has been for long, nobody waits for one.
+  [[nodiscard]] bool mayComeBack() const;
+
+  /// Says goodbye behind what was sent; a daemon that reads slowly is waited for that long, or for a connection's own
+  /// moment if that is longer. No connection is made any more.
+  void close(Duration drainTime);
 
  private:
+  [[nodiscard]] std::shared_ptr<Connection> tryToConnect();
   [[nodiscard]] std::shared_ptr<Connection> makeConnection();
   void describeSession(const std::shared_ptr<Connection>& connection);
   void wasInterrupted(const std::weak_ptr<Connection>& connection);
@@ -90,7 +98,9 @@ class SessionLink : public std::enable_shared_from_this<SessionLink> {
   bool _isClosed = false;
   SteadyTime _connectedAt{};
   SteadyTime _nextAttempt{};
+  std::optional<SteadyTime> _lostAt;
   Duration _pause{};
+  Duration _longestPause = std::chrono::seconds(10);  ///< of somebody who has something to say
   Duration _quietPause{};
   bool _reconnects = false;
 };

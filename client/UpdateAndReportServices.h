@@ -10,7 +10,10 @@
 namespace velk {
 
 /// Called with nothing when the module is to update its measurements; with a dictionary, empty and the module's alone
-/// until it returns, when it is to fill in its statistics. One that throws has added nothing.
+/// until it returns, when it is to fill in its statistics: numbers, texts and the like under keys that it shares with
+/// other modules; dictionaries and arrays under one key are joined, of other values the last to come stays. On any
+/// thread, perhaps at the same time as other modules'. One that throws has added nothing, which costs an error line;
+/// one that does not return holds up all calls of its client.
 using VelkReportingServiceBlock = std::function<void(PropertyDictionary* statistics)>;
 
 /// Immutable: any thread.

@@ -8,7 +8,12 @@
 // Any thread may call any operation. Callbacks run on threads of the library that are there only while they are needed;
 // a callback may take its time and may wait for another one. Message texts and aggregated events arrive in order, one
 // at a time; answers to different calls may arrive at the same time. A callback that throws ends the process, except
-// where it says otherwise.
+// where it says otherwise. What a callback captured belongs to the library from the call on, and ends once, behind its
+// last use or where it turns out that there is none; like the callback itself, never on the library's permanent thread.
+// A callback may make any call, and may let go of the last reference. An empty one is none.
+//
+// No operation throws. What the system refuses (memory, a thread, descriptors) is an error line in the log, and the
+// answer is null, false, nothing or empty.
 //
 // When the last reference goes, what was handed over is sent, the session is finished, and the connection is closed. A
 // process that exits with a reference left sends what was handed over too. Both wait for it within a bound.
@@ -45,9 +50,10 @@ class VELK_EXPORT VelkReporting : public std::enable_shared_from_this<VelkReport
   using FlushCallback = std::function<void(const std::optional<Error>& error)>;
   using UploadCallback = std::function<void(bool uploaded, const std::optional<Error>& error)>;
 
-  /// A client, or null (and a line in the log) without session info, with a "ComponentType" outside 5 to 30, or with
-  /// an "EnableFlag" of 0. `frameworksToCheck` is handed to the daemon. With an aggregation block the client is
-  /// handed its own events and those of the sessions below it.
+  /// A client, or null, with a line of the default level: without session info, with a "ComponentType" outside 5 to 30,
+  /// with an "EnableFlag" of 0; and, with an error line, when the system gives the library no thread or no descriptors,
+  /// which may be tried again. The texts of `frameworksToCheck` are handed to the daemon. With an aggregation block the
+  /// client is handed its own events and those of the sessions below it. The caller owns the client.
   [[nodiscard]] static std::shared_ptr<VelkReporting> initWithSessionInfo(
       const std::optional<PropertyDictionary>& sessionInfo, const std::optional<PropertyDictionary>& userInfo,
       const PropertyArray& frameworksToCheck, VelkReportingAggregationBlock aggregationBlock = nullptr);
@@ -58,51 +64,74 @@ class VELK_EXPORT VelkReporting : public std::enable_shared_from_this<VelkReport
 
   /// How long the last release of this object may wait for what was handed over to leave (one second unless set; 0 to
   /// an hour), and how long the end of the process may, by `exit` or a return from `main`, while this object is there.
-  /// What has not left by then is lost. `_exit`, and the end by a signal, wait for nothing.
+  /// What has not left by then is lost. A daemon that went away within the last half minute is waited for as well: it
+  /// may be on its way back; one that was not there is asked once more, and not waited for. `_exit`, and the end by a
+  /// signal, wait for nothing.
   void setEndOfLifeBound(std::chrono::milliseconds bound);
 
-  /// Has the daemon build the session's backends; once, before events are sent.
+  /// Has the daemon build the session's backends; once, before events are sent. The handler is called once: with
+  /// nothing, and a line in the log, when no daemon answers; the session is then configured as soon as one does.
   void startConfigurationWithCompletionHandler(StatesCallback completionHandler);
-  /// Gives the session a new user info and asks which backends are enabled now.
+  /// Gives the session a new user info and asks which backends are enabled now. The callback is called once: with
+  /// nothing, and a line in the log, when no daemon answers; one that comes later is told the user info all the same.
   void fetchReportingStatesWithUserInfo(const std::optional<PropertyDictionary>& userInfo,
                                         StatesCallback fetchComplete);
 
-  /// Sends an event. False, with error code 4, only for category 0: an event that the storebag filters, and one that
-  /// finds the outbox full, answer true.
+  /// Sends an event. False, with error code 4, only for category 0: an event that the storebag filters answers true,
+  /// and so does one that is not taken, then with an error (8, 9 or 12, as below).
   bool sendMessageWithCategory(std::uint16_t category, std::uint16_t type,
                                const std::optional<PropertyDictionary>& payload = std::nullopt, Error* error = nullptr);
   /// Sends a message dictionary ("ParametersCategory", "ParametersType", "ParametersPayload", "ParametersFlag").
   /// False without error when the storebag filters it; false with an error for a missing category or type (code 7),
-  /// a category of 0 (4), and when the outbox is full (8).
+  /// a category of 0 (4), when the outbox is full (8), in a forked child (9), and, with a line in the log, for what can
+  /// never be sent (12): more than 1 MiB, 65,536 values or 4,096 keys in one dictionary, dictionaries and arrays more
+  /// than 31 deep (the message is the first), text that is no UTF-8.
   bool sendMessageWithDictionary(const PropertyDictionary& dictionary, Error* error = nullptr);
 
   /// Has the daemon post what it batched for this session. Always true.
   bool flushMessages();
+  /// The same. The callback is called once, with what became of it: no error, the session's, or, with a line in the
+  /// log, the connection's when no daemon answers.
   void flushMessagesWithCompletion(FlushCallback completion);
-  /// Marks the session as finished gracefully. Overtakes what is still queued, and awaits nothing.
+  /// Marks the session as finished gracefully. Overtakes what is still queued, and awaits nothing. The last release
+  /// does the same behind what is queued.
   void finishSession();
 
-  // Data that the sessions of one hierarchy share: it travels with the events of all of them.
+  // Data that the sessions of one hierarchy share: it travels with the events of all of them. Lost, with a line in the
+  // log, when no daemon answers.
   void updateSharedDataWithDictionary(const PropertyDictionary& dictionary);
   /// Without a value the key is removed.
   void updateSharedDataForKey(const std::string& key, const std::optional<PropertyValue>& value);
 
+  /// Takes effect with the next message that is sent. The delegate is never owned here, but for a call of it.
   void setMessageSentDelegate(std::weak_ptr<VelkReportingMessageSentDelegate> delegate);
   [[nodiscard]] std::shared_ptr<VelkReportingMessageSentDelegate> messageSentDelegate() const;
-  /// Is given the text of each message that left, and the address at which reports can be viewed.
+  /// Is given the text of each message that left, and the address at which reports can be viewed. While it is slow,
+  /// 16,384 texts (or 8 MiB of them) wait for it; the log hears of those that are dropped beyond that.
   void setMessageLoggingBlock(LoggingBlock block);
+
+  // The daemon's latest answer to a configuration or a fetch. Before the first one everything passes.
 
   /// True when the list of allowed categories is empty or holds this one.
   [[nodiscard]] bool isWhitelistedEvent(std::uint16_t category) const;
   [[nodiscard]] bool isBlacklistedEvent(std::uint16_t category) const;
 
+  /// True when the backend "upload_server" is enabled.
   [[nodiscard]] bool serverSupportsFileUpload() const;
-  /// Hands a file (a path, or a file URL) to the daemon for upload: opened here, without following links. When the
-  /// server says that it has the file, it is removed, unless another one has taken its name; the callback hears whether
-  /// an upload was attempted. False as well while 64 files of this object wait for their answers.
+  /// Hands a file to the daemon for upload: a path, or a file address ("file:/PATH", "file://HOST/PATH", its escapes
+  /// resolved; the host does not count). It is opened here, without following links. When the server says that it has
+  /// the file, it is removed, unless another one has taken its name, and then the callback hears whether an upload was
+  /// attempted. False when it cannot be opened, for a path that is no UTF-8 (its address may be), and while 64 files of
+  /// this object wait for their answers. Directories, FIFOs, links and what else is no file are handed over and
+  /// answered with false. Keep the object until the callback came: with its last reference the session is closed; an
+  /// upload that was not answered by then may go on, but nobody waits for its answer: the callback may never be
+  /// called, and the file stay even when it is delivered.
   bool uploadFileWithURL(const std::optional<std::string>& fileURL, UploadCallback completionHandler);
+  /// Uploads log data: dictionaries. False for none, and (with an error line) when something else stands among them.
+  /// The callback is called once with the daemon's answer; not at all, with a line in the log, when no daemon answers.
   bool uploadDataArray(const std::optional<PropertyArray>& logData, UploadCallback completionHandler);
-  /// The key of the digest that goes with each post of the "qrs" backend. False without a key.
+  /// The key of the digest that goes with each post of the "qrs" backend, by the algorithm of number 0; with any other
+  /// number there is no digest. False without a key.
   bool setDigestKey(const std::optional<ByteData>& digestKey, std::uint32_t algorithm);
 
   // Periodic tasks: while the log timer runs, each tick asks the modules that want it to update their measurements;
@@ -142,7 +171,8 @@ class VELK_EXPORT VelkReporting : public std::enable_shared_from_this<VelkReport
       const std::optional<PropertyValue>& parentToken);
 
   /// Reports a single event without a client object. True: it was taken; delivery is not reported. False, with an
-  /// error: 2 no session info, 3 client type outside 5 to 30, 4 category 0, 8 too many are waiting.
+  /// error: 2 no session info, 3 client type outside 5 to 30, 4 category 0, 8 too many are waiting, 13 the system gives
+  /// the library no thread or no descriptors.
   static bool sendOneMessageWithSessionInfo(const std::optional<PropertyDictionary>& sessionInfo,
                                             const std::optional<PropertyDictionary>& userInfo, std::uint16_t category,
                                             std::uint16_t type, const std::optional<PropertyDictionary>& payload,

@@ -7,7 +7,8 @@ namespace velk {
 
 VelkReportingAggregationObject::VelkReportingAggregationObject(VelkReportingAggregationBlock aggregationBlock,
                                                                std::shared_ptr<Queue> callbackQueue)
-    : _callbackQueue(std::move(callbackQueue)) {
+    : _callbackQueue(std::move(callbackQueue)),
+      _room(std::make_shared<CallbackRoom>(texts::kAggregationBlockIsSlow, texts::kAggregationBlockWasSlow)) {
   if (aggregationBlock) {
     _aggregationBlock = std::make_shared<const VelkReportingAggregationBlock>(std::move(aggregationBlock));
   }
@@ -29,14 +30,11 @@ void VelkReportingAggregationObject::sendMessageToClient(std::optional<PropertyD
   Event event{std::move(sessionInfo), timestamp, category, type, std::move(payload)};
   // The end needs no room, so that it is heard however far behind the block is; one of them is enough.
   const bool ends = event.endsAggregation();
-  const std::size_t size = event.size();
-  if (ends ? _endIsWaiting.exchange(true) : !_waiting.reserve(size)) return;
-  _callbackQueue->async([self = shared_from_this(), event = std::move(event), ends, size] {
-    if (ends) {
-      self->_endIsWaiting = false;
-    } else {
-      self->_waiting.release(size);
-    }
+  if (ends && _endIsWaiting.exchange(true)) return;
+  auto place = ends ? CallbackRoom::Place() : _room->reserve(event.size());
+  if (!ends && !place) return;
+  _callbackQueue->async([self = shared_from_this(), event = std::move(event), ends, place = std::move(place)] {
+    if (ends) self->_endIsWaiting = false;
     self->runBlock(event);
   });
 }
@@ -49,9 +47,6 @@ void VelkReportingAggregationObject::runBlock(const Event& event) {
   } catch (...) {  // the client's own code: whatever it throws must not end its process
     log::standard(texts::kAggregationBlockThrew);
     releaseAggregationBlock();
-  }
-  if (const std::size_t lost = _waiting.takeOverflowCount()) {
-    log::error("sendMessageToClient: %u events were dropped: the aggregation block is slower than they come", lost);
   }
 }
 

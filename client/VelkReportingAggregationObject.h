@@ -4,7 +4,7 @@
 #include <atomic>
 #include <memory>
 
-#include "client/EventOutbox.h"
+#include "client/CallbackRoom.h"
 #include "client/VelkReporting.h"
 #include "ipc/SessionInterface.h"
 #include "platform/Lock.h"
@@ -14,7 +14,7 @@ namespace velk {
 
 /// Called on the library's thread; runs the client's block, if there is one, on `callbackQueue`, in order. A block
 /// that throws is released and never called again. What waits for a slow block is bounded: events beyond that are
-/// dropped, which costs an error line, but never the end of the aggregation. Lives as long as its connection.
+/// dropped, which the log hears of, but never the end of the aggregation. Lives as long as its connection.
 class VelkReportingAggregationObject : public ClientSessionReplyInterface,
                                        public std::enable_shared_from_this<VelkReportingAggregationObject> {
  public:
@@ -43,7 +43,7 @@ class VelkReportingAggregationObject : public ClientSessionReplyInterface,
   void runBlock(const Event& event);
 
   const std::shared_ptr<Queue> _callbackQueue;
-  EventRoom _waiting;
+  const std::shared_ptr<CallbackRoom> _room;
   std::atomic<bool> _endIsWaiting{false};
   mutable Lock _lock;
   SharedBlock _aggregationBlock VELK_GUARDED_BY(_lock);

@@ -26,7 +26,9 @@ VelkReportingImplementation::VelkReportingImplementation(ClientRuntime& runtime,
       _orderedCallbacks(runtime.makeCallbackQueue("com.tavrin.VelkReporting.callbacks")),
       _lists(std::make_shared<CurrentEventLists>()),
       _aggregation(std::make_shared<VelkReportingAggregationObject>(std::move(aggregationBlock), _orderedCallbacks)),
-      _mayLinger(booleanValue(description.sessionInfo.find(kVelkReportingSessionInfoBatchEvent))) {
+      _mayLinger(booleanValue(description.sessionInfo.find(kVelkReportingSessionInfoBatchEvent))),
+      _roomForMessages(std::make_shared<CallbackRoom>(texts::kDelegateIsSlow, texts::kDelegateWasSlow)),
+      _roomForTexts(std::make_shared<CallbackRoom>(texts::kLoggingBlockIsSlow, texts::kLoggingBlockWasSlow)) {
   description.hasAggregationBlock = _aggregation->hasAggregationBlock();
   _link = std::make_shared<SessionLink>(runtime, _queue, std::move(description), _aggregation, _lists);
 }
@@ -55,11 +57,15 @@ VelkReportingImplementation::Sent VelkReportingImplementation::sendMessage(std::
     log::standard(texts::kEventIsFiltered, category);
     return Sent::filtered;
   }
-  return enqueueEvent(message) ? Sent::taken : Sent::outboxFull;
+  const EventEstimate estimate = estimateEvent(message);
+  if (const char* reason = estimate.isSurelySendable ? nullptr : reasonNotToSend(message)) {
+    log::error(texts::kEventIsNotSendable, category, reason);
+    return Sent::notSendable;
+  }
+  return enqueueEvent(message, estimate.size) ? Sent::taken : Sent::outboxFull;
 }
 
-bool VelkReportingImplementation::enqueueEvent(const PropertyDictionary& message) {
-  const std::size_t size = estimatedSize(message);
+bool VelkReportingImplementation::enqueueEvent(const PropertyDictionary& message, std::size_t size) {
   if (!_outbox.reserve(size)) return false;
   const IncomingEvents::Ticket ticket = _incoming.add(message, size);
   if (ticket != 0) _reporting->async([self = shared_from_this(), ticket] { self->takeIncoming(ticket); });
@@ -109,7 +115,7 @@ bool VelkReportingImplementation::trySending(const PropertyDictionary& message) 
   if (sent) return true;
   const auto code = static_cast<ConnectionError>(sent.error().code);
   if (code == ConnectionError::outboxFull || code == ConnectionError::ended) return false;
-  log::standard(texts::kSendMessageProxyFailure, sent.error());  // it can never be sent
+  log::error(texts::kSendMessageProxyFailure, sent.error());  // it can never be sent
   return true;
 }
 
@@ -170,15 +176,16 @@ void VelkReportingImplementation::finishSession() {
   }
 }
 
-void VelkReportingImplementation::setMessageSentDelegate(std::weak_ptr<VelkReportingMessageSentDelegate> delegate) {
-  log::standard(texts::kDelegateIsSet, reinterpret_cast<std::uintptr_t>(delegate.lock().get()));
+void VelkReportingImplementation::setMessageSentDelegate(std::weak_ptr<VelkReportingMessageSentDelegate> delegate,
+                                                         std::uintptr_t identity) {
+  log::standard(texts::kDelegateIsSet, identity);
   Guard guard(_lock);
   _weakMessageSentDelegate.swap(delegate);
 }
 
-std::shared_ptr<VelkReportingMessageSentDelegate> VelkReportingImplementation::messageSentDelegate() const {
+std::weak_ptr<VelkReportingMessageSentDelegate> VelkReportingImplementation::weakMessageSentDelegate() const {
   Guard guard(_lock);
-  return _weakMessageSentDelegate.lock();
+  return _weakMessageSentDelegate;
 }
 
 void VelkReportingImplementation::unregisterPeriodicTask(std::uint32_t module) {
@@ -186,29 +193,30 @@ void VelkReportingImplementation::unregisterPeriodicTask(std::uint32_t module) {
 }
 
 void VelkReportingImplementation::notifyMessageWasSent(const PropertyDictionary& message) {
-  onQueue([message](VelkReportingImplementation& self) {
-    auto delegate = self.messageSentDelegate();
-    if (!delegate) return;
+  auto place = _roomForMessages->reserve(estimatedSize(message));
+  if (!place) return;
+  onQueue([message = message, place = std::move(place)](VelkReportingImplementation& self) mutable {
+    auto weakDelegate = self.weakMessageSentDelegate();
+    if (weakDelegate.expired()) return;
     log::standard(texts::kNotifyCalled);
-    self._orderedCallbacks->async([client = self._client, message, delegate = std::move(delegate)] {
-      if (const auto strong = client.lock()) delegate->didSendMessageForReportingClient(strong, message);
+    self._orderedCallbacks->async([weakClient = self._client, message = std::move(message),
+                                   weakDelegate = std::move(weakDelegate), place = std::move(place)] {
+      const auto delegate = weakDelegate.lock();
+      const auto client = weakClient.lock();
+      if (delegate && client) delegate->didSendMessageForReportingClient(client, message);
     });
   });
 }
 
 void VelkReportingImplementation::logText(const std::string& text) {
   if (!_loggingBlock) return;
-  _orderedCallbacks->async([block = _loggingBlock, text] { (*block)(text); });
+  auto place = _roomForTexts->reserve(text.size());
+  if (!place) return;
+  _orderedCallbacks->async([block = _loggingBlock, text, place = std::move(place)] { (*block)(text); });
 }
 
-void VelkReportingImplementation::setMessageLoggingBlock(VelkReporting::LoggingBlock block) {
+void VelkReportingImplementation::setMessageLoggingBlock(LoggingBlock block) {
   log::standard(texts::kLoggingBlockSet);
-  replaceLoggingBlock(block ? std::make_shared<const VelkReporting::LoggingBlock>(std::move(block)) : nullptr);
-}
-
-void VelkReportingImplementation::replaceLoggingBlock(SharedLoggingBlock block) {
-  // What the old one owns may wait for this thread when it ends: it ends where callbacks run.
-  if (_loggingBlock) _orderedCallbacks->async([old = std::move(_loggingBlock)] {});
   _loggingBlock = std::move(block);
 }
 

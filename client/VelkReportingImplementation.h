@@ -11,6 +11,7 @@
 #include <optional>
 #include <string>
 
+#include "client/CallbackRoom.h"
 #include "client/ClientRuntime.h"
 #include "client/EventLists.h"
 #include "client/EventOutbox.h"
@@ -18,6 +19,7 @@
 #include "client/PeriodicTasks.h"
 #include "client/ReportingQueue.h"
 #include "client/SessionLink.h"
+#include "client/SharedCallback.h"
 #include "client/VelkReporting.h"
 #include "client/VelkReportingAggregationObject.h"
 #include "platform/HandedFile.h"
@@ -30,18 +32,28 @@ class VelkReportingImplementation final : public LeavingClient,
   /// Codes of errors that only the library makes.
   static constexpr int kOutboxFull = 8;
   static constexpr int kForkedChild = 9;
+  static constexpr int kNotSendable = 12;
+  static constexpr int kNoResources = 13;
   /// Files whose upload has not been answered yet: each takes two of the host's descriptors.
   static constexpr std::size_t kMaximumFilesHeld = 64;
+
+  using StatesCallback = SharedCallback<const std::optional<PropertyArray>&>;
+  using FlushCallback = SharedCallback<const std::optional<Error>&>;
+  using UploadCallback = SharedCallback<bool, const std::optional<Error>&>;
+  using LoggingBlock = std::shared_ptr<VelkReporting::LoggingBlock>;
 
   VelkReportingImplementation(ClientRuntime& runtime, SessionDescription description,
                               VelkReportingAggregationBlock aggregationBlock);
   /// Connects; on the creator's thread, once, before anything else. `client` is the object that this stands behind.
   void open(std::weak_ptr<VelkReporting> client);
+  /// False only for what was left half made, for want of memory: it has no end either.
+  [[nodiscard]] bool isOpen() const noexcept { return _periodicTasks != nullptr; }
 
   // Any thread.
 
   /// In a forked child every operation does nothing.
   [[nodiscard]] bool isForeign() const noexcept { return _forkGuard.forked(); }
+  [[nodiscard]] ClientRuntime& runtime() const noexcept { return _runtime; }
   [[nodiscard]] const CurrentEventLists& lists() const { return *_lists; }
   /// Queues work on the reporting queue, behind the events handed over so far; it owns this object until it has run.
   template <class Work>
@@ -59,7 +71,7 @@ class VelkReportingImplementation final : public LeavingClient,
       self.runBehindHeldEvents([&self, work = std::move(work)]() mutable { work(self); });
     });
   }
-  enum class Sent { taken, filtered, outboxFull, notFromForkedChild };
+  enum class Sent { taken, filtered, outboxFull, notFromForkedChild, notSendable };
   /// Tells the delegate of a valid message and queues it, unless the daemon wants no such events.
   Sent sendMessage(std::uint16_t category, const PropertyDictionary& message);
   /// The file is held open until its upload has been answered, so that nothing else is taken for it; no more than some
@@ -67,8 +79,8 @@ class VelkReportingImplementation final : public LeavingClient,
   [[nodiscard]] Result<std::shared_ptr<const FileToHandOver>> openForUpload(const std::string& path);
   /// Directly over the connection, past everything that is queued.
   void finishSession();
-  /// The end: what was queued is sent, the session finished, the connection closed. Waits for that within a bound,
-  /// unless it runs on the library's own thread.
+  /// The end: what was queued is sent, the session finished, the connection closed. Waits for that within a bound; on
+  /// the library's own thread and in a callback of a module a thread for callbacks waits instead.
   void endOfLife(const void* client);
   void setEndOfLifeBound(Duration bound) noexcept { _endOfLifeBound.store(bound, std::memory_order_relaxed); }
   /// Sends what was queued, past a tick that does not end in time; the session goes on for as long as the process does.
@@ -76,32 +88,30 @@ class VelkReportingImplementation final : public LeavingClient,
 
   /// From here on messages are brought to the queue, which knows the delegate.
   void expectMessageSentDelegate() noexcept { _mayHaveDelegate.store(true, std::memory_order_relaxed); }
-  [[nodiscard]] std::shared_ptr<VelkReportingMessageSentDelegate> messageSentDelegate() const;
+  [[nodiscard]] std::weak_ptr<VelkReportingMessageSentDelegate> weakMessageSentDelegate() const;
 
   [[nodiscard]] PeriodicTasks& periodicTasks() const { return *_periodicTasks; }
   void unregisterPeriodicTask(std::uint32_t module);
 
   // On the reporting queue.
 
-  void setMessageSentDelegate(std::weak_ptr<VelkReportingMessageSentDelegate> delegate);
-  void startConfiguration(VelkReporting::StatesCallback completionHandler);
-  void fetchReportingStates(const std::optional<PropertyDictionary>& userInfo,
-                            VelkReporting::StatesCallback fetchComplete);
-  void flush(VelkReporting::FlushCallback completion);
+  /// `identity` is what the log tells of it: on the library's thread nobody owns the delegate even for a moment.
+  void setMessageSentDelegate(std::weak_ptr<VelkReportingMessageSentDelegate> delegate, std::uintptr_t identity);
+  void startConfiguration(const StatesCallback& completionHandler);
+  void fetchReportingStates(const std::optional<PropertyDictionary>& userInfo, const StatesCallback& fetchComplete);
+  void flush(const FlushCallback& completion);
   void updateSharedDataWithDictionary(const PropertyDictionary& dictionary);
   void updateSharedDataForKey(const std::string& key, const std::optional<PropertyValue>& value);
   void setDigestKey(const ByteData& key, std::int32_t algorithm);
-  void setMessageLoggingBlock(VelkReporting::LoggingBlock block);
+  void setMessageLoggingBlock(LoggingBlock block);
   void uploadFile(const std::string& url, const std::shared_ptr<const FileToHandOver>& file,
-                  VelkReporting::UploadCallback completionHandler);
-  void uploadLogData(const PropertyArray& logData, VelkReporting::UploadCallback completionHandler);
+                  const UploadCallback& completionHandler);
+  void uploadLogData(const PropertyArray& logData, const UploadCallback& completionHandler);
 
  private:
-  using SharedLoggingBlock = std::shared_ptr<const VelkReporting::LoggingBlock>;
-
   /// Queues an event. False when the outbox is full.
-  [[nodiscard]] bool enqueueEvent(const PropertyDictionary& message);
-  /// Tells the delegate of a message, in order, on a thread for callbacks.
+  [[nodiscard]] bool enqueueEvent(const PropertyDictionary& message, std::size_t size);
+  /// Tells the delegate of a message, in order, on a thread for callbacks; bounded from here on.
   void notifyMessageWasSent(const PropertyDictionary& message);
   void takeIncoming(IncomingEvents::Ticket ticket);
   void sendEvents(std::vector<IncomingEvents::Event> events);
@@ -114,14 +124,15 @@ class VelkReportingImplementation final : public LeavingClient,
   /// The number of events that were left when it last looked.
   std::size_t sendHeldEventsWithin(SteadyTime deadline, Turn turn);
   void retryLater(Duration delay);
+  void retryAtOnce();
   void reportOverflow();
   void wasInterrupted();
-  void finishAndClose(const void* client);
+  void leave(const void* client, SteadyTime deadline);
+  void finishAndClose(const void* client, SteadyTime deadline);
   [[nodiscard]] std::size_t heldEvents() const;
   void fetchDisplayURL(const std::shared_ptr<Connection>& connection);
   void logText(const std::string& text);
-  void replaceLoggingBlock(SharedLoggingBlock block);
-  [[nodiscard]] ConfigurationReply statesReply(VelkReporting::StatesCallback callback);
+  [[nodiscard]] ConfigurationReply statesReply(const StatesCallback& callback);
 
   // Constant after construction.
   ClientRuntime& _runtime;
@@ -141,6 +152,8 @@ class VelkReportingImplementation final : public LeavingClient,
   EventOutbox _outbox;
   IncomingEvents _incoming;
   std::atomic<Duration> _endOfLifeBound{ClientRuntime::kEndOfLifeBound};
+  const std::shared_ptr<CallbackRoom> _roomForMessages;
+  const std::shared_ptr<CallbackRoom> _roomForTexts;
   std::atomic<bool> _mayHaveDelegate{false};  ///< once true it stays so
   /// Shared with the files.
   const std::shared_ptr<std::atomic<std::size_t>> _filesHeld = std::make_shared<std::atomic<std::size_t>>(0);
@@ -149,7 +162,7 @@ class VelkReportingImplementation final : public LeavingClient,
   std::weak_ptr<VelkReportingMessageSentDelegate> _weakMessageSentDelegate VELK_GUARDED_BY(_lock);
 
   // On the reporting queue.
-  SharedLoggingBlock _loggingBlock;
+  LoggingBlock _loggingBlock;
   bool _retryIsPending = false;
   SteadyTime _lastTaken{};
   bool _isFinished = false;

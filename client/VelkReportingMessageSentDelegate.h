@@ -10,6 +10,8 @@ namespace velk {
 class VelkReporting;
 
 /// Hears of every valid message that a client hands over, filtered or not. Called in order, on the library's threads.
+/// While it is slow, 16,384 messages (or 8 MiB of them) wait for it; the log hears of those that are dropped beyond
+/// that. One that throws ends the process.
 class VelkReportingMessageSentDelegate {
  public:
   virtual ~VelkReportingMessageSentDelegate() = default;
