@@ -68,7 +68,11 @@ Answer Collector::post(const std::string& path, const HeaderList& headers, std::
   post->wireBytes = wire.size();
   post->bodyBytes = body->size();
   const Result<std::int64_t> number = keep(*post, path, headers);
-  if (!number) return refuse(path, 500, number.error().description);
+  if (!number) {
+    // Senders are not told where things stand on this machine.
+    (void)refuse(path, 500, number.error().description);
+    return sentence(500, "the post cannot be kept");
+  }
   _announcer.post(*number, path, *post, _options.digestKey.has_value());
   return {200, "{}", "application/json", {}};
 }

@@ -6,6 +6,7 @@
 #include <ostream>
 
 #include "platform/Directories.h"
+#include "tools/CommandLine.h"
 #include "tools/collector/DigestKey.h"
 
 namespace velk::collector {
@@ -109,18 +110,18 @@ std::variant<CollectorOptions, tools::ExitCode> readCollectorOptions(std::vector
   describe(app, line);
   describeFaults(app, line);
   describeDashboardFaults(app, line.options.dashboard);
+  const bool json = tools::asksForJson(arguments);
   std::reverse(arguments.begin(), arguments.end());
   try {
     app.parse(std::move(arguments));
   } catch (const CLI::ParseError& problem) {
-    return app.exit(problem, out, error) == 0 ? tools::ExitCode::ok : tools::ExitCode::usage;
+    return tools::finishParsing(app, problem, json, out, error);
   }
   fillDefaults(line, app.count("--dashboard-port") > 0);
   if (!line.digestKey.empty()) {
     Result<ByteData> key = digestKeyFromArgument(line.digestKey);
     if (!key) {
-      error << "velkcollector: " << key.error().description << "\n";
-      return tools::ExitCode::noInput;
+      return tools::complain(error, "velkcollector", json, tools::ExitCode::noInput, key.error().description);
     }
     line.options.digestKey = std::move(*key);
   }

@@ -51,7 +51,11 @@ Answer Dashboard::postLogData(const HeaderList& headers, std::string_view archiv
   if (entries == nullptr) return refuse(400, "log data is an array");
   Result<std::int64_t> number = _logDataTaken + 1;
   if (_store != nullptr) number = _store->addLogData(archive, entries->size(), _clock.wallTime());
-  if (!number) return refuse(500, number.error().description);
+  if (!number) {
+    // Senders are not told where things stand on this machine.
+    (void)refuse(500, number.error().description);
+    return sentence(500, "the log data cannot be kept");
+  }
   ++_logDataTaken;
   const std::string location = locationOf(*number, headers);
   _announcer.logData(*number, entries->size(), archive.size(), location);

@@ -31,6 +31,7 @@ void bindColumn(sqlite3_stmt* statement, int column, std::int64_t number) {
 void bindColumn(sqlite3_stmt* statement, int column, double number) { sqlite3_bind_double(statement, column, number); }
 
 Result<void> Database::open(const std::string& path, const char* schema) {
+  _path = path;
   // SQLite would make the file readable for others, and its journal files take the mode of the first.
   if (!files::exists(path)) {
     if (Result<void> made = files::writeAtomically(path, {}, 0600); !made) return made;
@@ -79,8 +80,10 @@ Result<std::int64_t> Database::end(Result<std::int64_t> outcome) {
 std::int64_t Database::lastRow() const { return sqlite3_last_insert_rowid(_handle.get()); }
 
 Failure Database::problem(const char* doing) const {
-  return failure("database", sqlite3_errcode(_handle.get()),
-                 std::string("cannot ") + doing + ": " + sqlite3_errmsg(_handle.get()));
+  const int code = sqlite3_errcode(_handle.get());
+  std::string sentence = std::string("cannot ") + doing + " " + _path + ": " + sqlite3_errmsg(_handle.get());
+  if (code == SQLITE_NOTADB || code == SQLITE_CORRUPT) sentence += ". Put it aside, and a new one is begun";
+  return failure("database", code, std::move(sentence));
 }
 
 }  // namespace velk::collector

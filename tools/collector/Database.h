@@ -59,6 +59,7 @@ class Database {
  private:
   [[nodiscard]] Failure problem(const char* doing) const;
 
+  std::string _path;
   std::unique_ptr<sqlite3, DatabaseClose> _handle;
 };
 

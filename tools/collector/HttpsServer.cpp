@@ -95,9 +95,11 @@ class Server final : public HttpsServer {
   Result<int> bind(const std::string& address, int port) override {
     const int bound = port == 0 ? _server.bind_to_any_port(address) : (_server.bind_to_port(address, port) ? port : -1);
     if (bound > 0) return bound;
-    return failure("collector", 1,
-                   "cannot listen on " + address + " port " + std::to_string(port) +
-                       ": the address is not this machine's, or the port is taken or not allowed");
+    return failure(
+        "collector", 1,
+        "cannot listen on " + address + " port " + std::to_string(port) +
+            ": the address is not this machine's, or the port is taken or not allowed. --listen names another "
+            "address, --port another port; 0 takes one that is free");
   }
 
   void serve() override {

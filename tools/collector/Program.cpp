@@ -7,6 +7,7 @@
 
 #include "platform/Clock.h"
 #include "platform/Files.h"
+#include "tools/CommandLine.h"
 #include "tools/JsonLines.h"
 #include "tools/collector/Announcer.h"
 #include "tools/collector/Collector.h"
@@ -22,12 +23,6 @@ namespace velk::collector {
 namespace {
 
 using tools::ExitCode;
-
-/// Writes the sentence and hands the status on.
-ExitCode fail(std::ostream& error, ExitCode code, const std::string& sentence) {
-  error << "velkcollector: " << sentence << std::endl;
-  return code;
-}
 
 Result<CertificateFiles> certificates(const CollectorOptions& options) {
   if (!options.certificateFile.empty()) {
@@ -99,29 +94,32 @@ ExitCode run(std::vector<std::string> arguments, std::ostream& out, std::ostream
   const auto read = readCollectorOptions(std::move(arguments), out, error);
   if (const ExitCode* code = std::get_if<ExitCode>(&read)) return *code;
   const CollectorOptions& options = std::get<CollectorOptions>(read);
+  const auto fail = [&](ExitCode code, const std::string& sentence) {
+    return tools::complain(error, "velkcollector", options.json, code, sentence);
+  };
 
   const auto names = certificates(options);
-  if (!names) return fail(error, ExitCode::cannotCreate, names.error().description);
+  if (!names) return fail(ExitCode::cannotCreate, names.error().description);
   const auto store = openStore(options);
-  if (!store) return fail(error, ExitCode::cannotCreate, store.error().description);
+  if (!store) return fail(ExitCode::cannotCreate, store.error().description);
 
   tools::JsonLines lines(out);
   Announcer announcer(lines, options.json, options.quiet || options.sink);
   Collector collector(options, store->get(), announcer, systemClock());
   const auto dashboardStore = openDashboardStore(options);
-  if (!dashboardStore) return fail(error, ExitCode::cannotCreate, dashboardStore.error().description);
+  if (!dashboardStore) return fail(ExitCode::cannotCreate, dashboardStore.error().description);
   Dashboard dashboard(dashboardStore->get(), announcer, systemClock());
   const auto uploadStore = openUploadStore(options);
-  if (!uploadStore) return fail(error, ExitCode::cannotCreate, uploadStore.error().description);
+  if (!uploadStore) return fail(ExitCode::cannotCreate, uploadStore.error().description);
   Uploads uploads(options, uploadStore->get(), announcer, systemClock());
   auto server = HttpsServer::make(collector, dashboard, uploads, names->serverPath, names->serverKeyPath);
-  if (!server) return fail(error, ExitCode::configuration, server.error().description);
+  if (!server) return fail(ExitCode::configuration, server.error().description);
   const Result<int> port = (*server)->bind(options.listenAddress, options.port);
-  if (!port) return fail(error, ExitCode::unavailable, port.error().description);
+  if (!port) return fail(ExitCode::unavailable, port.error().description);
   const auto listener = openListener(options, dashboard);
-  if (!listener) return fail(error, ExitCode::unavailable, listener.error().description);
+  if (!listener) return fail(ExitCode::unavailable, listener.error().description);
   if (const Result<void> written = writePortFile(options.portFile, *port); !written) {
-    return fail(error, ExitCode::cannotCreate, written.error().description);
+    return fail(ExitCode::cannotCreate, written.error().description);
   }
 
   const auto dashboardPort = *listener ? std::optional((*listener)->port()) : std::nullopt;
@@ -130,7 +128,8 @@ ExitCode run(std::vector<std::string> arguments, std::ostream& out, std::ostream
   const bool orderly = serveUntilStopped(**server, signals);
   if (*listener) (*listener)->stop();
   announcer.stopped(collector.totals());
-  return orderly ? ExitCode::ok : fail(error, ExitCode::ioError, "the server can take no connections any longer");
+  if (!orderly) return fail(ExitCode::ioError, "the server can take no connections any longer");
+  return lines.good() ? ExitCode::ok : fail(ExitCode::ioError, "standard output took no more: lines are missing");
 }
 
 }  // namespace velk::collector

@@ -1,7 +1,9 @@
 #include "tools/collector/Uploads.h"
 
 #include <algorithm>
+#include <cerrno>
 #include <filesystem>
+#include <system_error>
 
 #include "foundation/Uuid.h"
 #include "platform/Files.h"
@@ -12,6 +14,8 @@ namespace {
 constexpr std::string_view kNameParameter = "filename=";
 constexpr std::string_view kLastParameter = "&raw=";
 constexpr std::string_view kUploadPath = "/upload";
+constexpr int kNoRoom = 507;
+constexpr const char* kErrorDomain = "upload";
 
 int digitValue(char character) {
   if (character >= '0' && character <= '9') return character - '0';
@@ -48,10 +52,14 @@ std::string uploadedFileName(std::string_view target) {
 IncomingUpload::IncomingUpload(std::string path) : _path(std::move(path)) {
   if (_path.empty()) return;
   if (const auto made = files::createEmpty(_path, 0600); !made) {
-    _refusal = made.error();
+    _refusal = Error{kErrorDomain, kNotKept, made.error().description};
     return;
   }
   _file.open(_path, std::ios::binary | std::ios::app);
+}
+
+Failure IncomingUpload::notKept() const {
+  return failure(kErrorDomain, kNotKept, "cannot write " + _path + ": " + std::generic_category().message(errno));
 }
 
 IncomingUpload::~IncomingUpload() {
@@ -65,7 +73,7 @@ Result<void> IncomingUpload::add(std::string_view bytes) {
   if (const auto sound = _check.take(bytes); !sound) return sound;
   if (_path.empty()) return {};
   _file.write(bytes.data(), static_cast<std::streamsize>(bytes.size()));
-  if (!_file) return failure("upload", 2, "there is no room for the file");
+  if (!_file) return notKept();
   return {};
 }
 
@@ -79,7 +87,7 @@ Result<std::uint64_t> IncomingUpload::finish() {
   if (_refusal) return Failure(*_refusal);
   if (!_path.empty()) {
     _file.close();
-    if (!_file) return failure("upload", 2, "there is no room for the file");
+    if (!_file) return notKept();
   }
   return _check.finish();
 }
@@ -89,11 +97,19 @@ std::unique_ptr<IncomingUpload> Uploads::begin() const {
                                                             : std::string());
 }
 
+/// Senders are not told where things stand on this machine.
+Answer Uploads::cannotKeep(const Error& error) {
+  _announcer.refused(std::string(kUploadPath), kNoRoom, error.description);
+  return {kNoRoom, "the upload cannot be kept\n", "text/plain", {}};
+}
+
 Answer Uploads::end(IncomingUpload& upload, bool whole, const std::string& target) {
   if (_options.postStatus && *_options.postStatus != 200) {
     return refuse(*_options.postStatus, "this collector was told to answer so");
   }
   const Result<std::uint64_t> size = upload.finish();
+  if (!size && size.error().domain == kErrorDomain && size.error().code == IncomingUpload::kNotKept)
+    return cannotKeep(size.error());
   if (!size) return refuse(400, size.error().description);
   if (!whole) return refuse(400, "the body did not come whole");
   const std::string name = uploadedFileName(target);
@@ -101,7 +117,7 @@ Answer Uploads::end(IncomingUpload& upload, bool whole, const std::string& targe
   if (_store != nullptr) {
     number = _store->keep({upload.path(), name, target, upload.wireBytes(), *size}, _clock.wallTime());
   }
-  if (!number) return refuse(500, number.error().description);
+  if (!number) return cannotKeep(number.error());
   _announcer.upload(*number, name, *size, upload.wireBytes());
   return {200, "success", "text/plain", {}};
 }

@@ -29,6 +29,8 @@ inline constexpr std::uint64_t kMaximumUploadedFileBytes = std::uint64_t{64} * 1
 /// One upload on its way, on its connection's thread. What was not kept in the end leaves no file behind.
 class IncomingUpload {
  public:
+  static constexpr int kNotKept = 2;
+
   /// An empty path: nothing is kept.
   explicit IncomingUpload(std::string path);
   ~IncomingUpload();
@@ -37,7 +39,7 @@ class IncomingUpload {
 
   /// False when the rest need not come: `finish` says why.
   [[nodiscard]] bool take(std::string_view bytes);
-  /// The size of the file when it came whole and sound.
+  /// The size of the file when it came whole and sound. An error with the code `kNotKept` is the collector's own.
   [[nodiscard]] Result<std::uint64_t> finish();
 
   [[nodiscard]] const std::string& path() const { return _path; }
@@ -45,6 +47,7 @@ class IncomingUpload {
 
  private:
   [[nodiscard]] Result<void> add(std::string_view bytes);
+  [[nodiscard]] Failure notKept() const;
 
   const std::string _path;
   std::ofstream _file;
@@ -66,6 +69,7 @@ class Uploads {
 
  private:
   [[nodiscard]] Answer refuse(int status, const std::string& reason);
+  [[nodiscard]] Answer cannotKeep(const Error& error);
 
   const CollectorOptions& _options;
   UploadStore* const _store;

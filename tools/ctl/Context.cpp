@@ -24,7 +24,7 @@ void Context::report(const PropertyDictionary& object, const std::string& words)
   } else if (!words.empty()) {
     out << words << std::endl;
   }
-  if (!out) fail(ExitCode::ioError, "the result could not be written");
+  if (!out) fail(ExitCode::ioError, "the result could not be written to standard output");
 }
 
 void Context::fail(ExitCode code, const std::string& sentence) {

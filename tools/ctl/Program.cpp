@@ -3,6 +3,7 @@
 #include <CLI/CLI.hpp>
 #include <algorithm>
 
+#include "tools/CommandLine.h"
 #include "tools/ctl/Commands.h"
 
 namespace velk::ctl {
@@ -22,11 +23,12 @@ ExitCode run(std::vector<std::string> arguments, std::ostream& out, std::ostream
   addConsentCommand(app, context);
   addStorebagCommands(app, context);
 
+  const bool json = tools::asksForJson(arguments);
   std::reverse(arguments.begin(), arguments.end());
   try {
     app.parse(std::move(arguments));
   } catch (const CLI::ParseError& problem) {
-    return app.exit(problem, out, error) == 0 ? ExitCode::ok : ExitCode::usage;
+    return tools::finishParsing(app, problem, json, out, error);
   }
   return context.exitCode;
 }

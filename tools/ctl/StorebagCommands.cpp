@@ -89,6 +89,7 @@ void sign(Context& context, const SignOptions& options) {
   if (options.outputPath.empty()) {
     context.out.write(reinterpret_cast<const char*>(envelope->data()), static_cast<std::streamsize>(envelope->size()));
     context.out.flush();
+    if (!context.out) context.fail(ExitCode::ioError, "the envelope could not be written to standard output");
     return;
   }
   if (!writeFile(context, options.outputPath, *envelope, 0644)) return;
