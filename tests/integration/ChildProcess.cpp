@@ -47,10 +47,23 @@ bool LineCollector::waitForPart(const std::string& part, std::size_t from, std::
       .has_value();
 }
 
+void LineCollector::waitForEnd() const {
+  static_cast<void>(waitFor([](const std::string&) { return false; }));
+}
+
 std::size_t LineCollector::count(const std::string& part) const {
   std::size_t found = 0;
   for (const auto& line : lines()) found += line.find(part) != std::string::npos ? 1 : 0;
   return found;
+}
+
+std::size_t LineCollector::countOnceThereAre(std::size_t expected, const std::string& part) const {
+  std::size_t found = 0;
+  static_cast<void>(waitFor([&](const std::string& line) {
+    found += line.find(part) != std::string::npos ? 1 : 0;
+    return found >= expected;
+  }));
+  return count(part);
 }
 
 namespace {

@@ -35,7 +35,13 @@ class LineCollector {
                                                    std::chrono::milliseconds patience = kPatience) const;
   [[nodiscard]] bool waitForPart(const std::string& part, std::size_t from = 0,
                                  std::chrono::milliseconds patience = kPatience) const;
+  /// Waits until no more lines can come.
+  void waitForEnd() const;
+  /// How many lines that are here now hold `part`.
   [[nodiscard]] std::size_t count(const std::string& part) const;
+  /// The same, once there are `expected` of them (or that cannot be any more): a program's lines come by a way of their
+  /// own, and may be behind its answers.
+  [[nodiscard]] std::size_t countOnceThereAre(std::size_t expected, const std::string& part) const;
 
  private:
   mutable Lock _lock;

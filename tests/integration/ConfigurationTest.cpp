@@ -86,7 +86,7 @@ TEST(Configuration, StartedAgainKeepsTheBackends) {
   EXPECT_EQ(first, second);
   EXPECT_TRUE(
       daemon.log().waitForPart("<3>startConfigWithCompletionHandler: has been called more than once for session 77"));
-  EXPECT_EQ(daemon.log().count("createBackendsWithStorebag: Creating backends for session 77"), 1U);
+  EXPECT_EQ(daemon.log().countOnceThereAre(1, "createBackendsWithStorebag: Creating backends for session 77"), 1U);
   EXPECT_EQ(session.finish(), 0);
   ASSERT_TRUE(server.waitForEvents(2, {0}));
   EXPECT_EQ(eventsOf(server, 0).size(), 2U) << "one start and one health message";
@@ -109,14 +109,14 @@ TEST(Configuration, WaitsForUserInfo) {
   lists = fetch(late);
   ASSERT_EQ(lists.size(), 3U);
   EXPECT_EQ(lists[0], kSplunk);
-  EXPECT_EQ(daemon.log().count("receivedUserInfo: Received new user info for session 5"), 1U);
+  EXPECT_EQ(daemon.log().countOnceThereAre(1, "receivedUserInfo: Received new user info for session 5"), 1U);
 
   EXPECT_EQ(fetch(late)[0], kSplunk);
   EXPECT_EQ(fetch(PropertyValue())[0], kSplunk) << "required and absent: the old one stays";
-  EXPECT_EQ(daemon.log().count("receivedUserInfo: Received new user info for session 5"), 1U);
+  EXPECT_EQ(daemon.log().countOnceThereAre(1, "receivedUserInfo: Received new user info for session 5"), 1U);
 
   EXPECT_EQ(fetch(PropertyDictionary{{"_clientName", "Stranger"}})[0], kNobody);
-  EXPECT_EQ(daemon.log().count("receivedUserInfo: Received new user info for session 5"), 2U);
+  EXPECT_EQ(daemon.log().countOnceThereAre(2, "receivedUserInfo: Received new user info for session 5"), 2U);
 }
 
 TEST(Configuration, WithoutRequiredUserInfoSkipsConsent) {
@@ -237,7 +237,7 @@ TEST(Configuration, HelperIsReleasedAfterItsTimeout) {
 
   ControlledSession second(daemon);
   EXPECT_EQ(second.open(9, 2)[0], kSplunk);
-  EXPECT_EQ(daemon.log().count("Creating shared connectivity helper for userInfoKey test:unit"), 2U);
+  EXPECT_EQ(daemon.log().countOnceThereAre(2, "Creating shared connectivity helper for userInfoKey test:unit"), 2U);
 }
 
 TEST(Configuration, SessionsOfOneClientAndServiceShareAHelper) {
@@ -252,8 +252,9 @@ TEST(Configuration, SessionsOfOneClientAndServiceShareAHelper) {
   ASSERT_EQ(second.open(9, 2, {}, PropertyDictionary{{"_clientName", "media"}, {"_serviceName", "calls"}}).size(), 3U);
   ASSERT_EQ(third.open(9, 3, {}, PropertyDictionary{{"_clientName", "media"}}).size(), 3U);
 
-  EXPECT_EQ(daemon.log().count("Creating shared connectivity helper for userInfoKey media:calls"), 1U);
-  EXPECT_EQ(daemon.log().count("Found existing shared connectivity helper for userInfoKey media:calls"), 1U);
+  EXPECT_EQ(daemon.log().countOnceThereAre(1, "Creating shared connectivity helper for userInfoKey media:calls"), 1U);
+  EXPECT_EQ(daemon.log().countOnceThereAre(1, "Found existing shared connectivity helper for userInfoKey media:calls"),
+            1U);
   EXPECT_TRUE(daemon.log().waitForPart("Creating shared connectivity helper for userInfoKey media:"));
 }
 

@@ -74,7 +74,9 @@ void Daemon::start() {
 int Daemon::stop() {
   _process->signal(SIGTERM);
   const auto status = _process->wait();
-  return status ? *status : -1;
+  if (!status) return -1;
+  log().waitForEnd();
+  return *status;
 }
 
 void Daemon::kill() {

@@ -113,7 +113,10 @@ class CollectorProcess {
   }
   int stop() {
     _process.signal(SIGTERM);
-    return _process.wait().value_or(-1);
+    const auto status = _process.wait();
+    if (!status) return -1;
+    lines().waitForEnd();
+    return *status;
   }
 
  private:
@@ -171,7 +174,7 @@ TEST(Dashboard, OneShotsLeaveTheDescriptorCountFlat) {
     EXPECT_EQ(session.finish(), 0);
     EXPECT_EQ(daemon.stop(), 0);
     ASSERT_TRUE(daemon.log().waitForPart("main: Asked to stop."));
-    EXPECT_EQ(daemon.log().count("createBackendsWithStorebag: Creating backends for session 5"), 103U);
+    EXPECT_EQ(daemon.log().countOnceThereAre(103, "createBackendsWithStorebag: Creating backends for session 5"), 103U);
     EXPECT_FALSE(port.hasDatagram());
   }
 }
@@ -216,6 +219,7 @@ TEST(Dashboard, LogDataGoesToTheCollectorWhichSaysWhereItIs) {
     EXPECT_TRUE(daemon.log().waitForPart("DashboardBackend(uploadLogData): Log data uploaded to " + location));
   }
   EXPECT_TRUE(daemon.log().waitForPart("uploadLogData: Log data array upload successful"));
+  ASSERT_TRUE(collector.lines().waitForPart(collector.url("/logdata/2")));
   const auto taken = collector.events("logData");
   ASSERT_EQ(taken.size(), 2U);
   EXPECT_EQ(integerValue(taken[0].find("entries")), 2);

@@ -193,7 +193,7 @@ TEST(LastMoments, EverLastingTransportsHoldNothingOfTheProcess) {
   }
   EXPECT_EQ(daemon.process().wait(), 0);
   EXPECT_TRUE(waitForStartsAndHealth(server, 12));
-  EXPECT_GE(daemon.log().count("Special case of dealing with ever-lasting connectivity helper"), 1U);
+  EXPECT_GE(daemon.log().countOnceThereAre(1, "Special case of dealing with ever-lasting connectivity helper"), 1U);
 }
 
 }  // namespace

@@ -50,7 +50,7 @@ TEST(Lifecycle, LeavesOnlyAfterTheLastHelperLetGo) {
   }
   EXPECT_EQ(daemon.process().wait(), 0);
   EXPECT_TRUE(server.waitForEvents(2, {0})) << "start and health message had arrived before";
-  EXPECT_EQ(daemon.log().count("releaseIPCTransactions: IPC transaction ended"), 1U);
+  EXPECT_EQ(daemon.log().countOnceThereAre(1, "releaseIPCTransactions: IPC transaction ended"), 1U);
 }
 
 TEST(Lifecycle, StaysWhileAConnectionIsOpen) {

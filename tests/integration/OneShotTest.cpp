@@ -68,7 +68,7 @@ TEST(OneShot, BuildsItsBackendsAnewEachTime) {
   }
   ASSERT_TRUE(one.server.waitForEvents(3, {7}));
   for (const auto& event : eventsOf(one.server, 7)) EXPECT_EQ(integerValue(event.find("_eventNumber")), 1);
-  EXPECT_EQ(one.daemon.log().count("createBackendsWithStorebag: Creating backends for session 5"), 3U);
+  EXPECT_EQ(one.daemon.log().countOnceThereAre(3, "createBackendsWithStorebag: Creating backends for session 5"), 3U);
 }
 
 TEST(OneShot, PayloadNamedClientDataIsUnwrapped) {

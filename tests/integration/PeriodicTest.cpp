@@ -160,7 +160,7 @@ TEST_F(Periodic, TheLastReleaseInACallbackEndsTheSessionAndLosesNothing) {
   EXPECT_EQ(client->process().errors().count("is about to dealloc"), 1U);
   EXPECT_EQ(client->finish(), 0);
   EXPECT_EQ(daemon->stop(), 0);
-  EXPECT_EQ(daemon->log().count("invalidateReportingSession: ReportingdSession"), 1U);
+  EXPECT_EQ(daemon->log().countOnceThereAre(1, "invalidateReportingSession: ReportingdSession"), 1U);
 }
 
 TEST_F(Periodic, ReportsGoOnWhenTheDaemonComesBack) {

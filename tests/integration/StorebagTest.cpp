@@ -40,10 +40,14 @@ TEST(Storebag, IsFetchedOnceVerifiedAndCached) {
   struct stat status {};
   ASSERT_EQ(stat(file->c_str(), &status), 0);
   EXPECT_EQ(status.st_mode & 0777U, 0600U);
-  EXPECT_EQ(daemon.log().count("fetchNetworkStorebag: Storebag Server URL: " + server.url("/bags/vindle/heather")), 1U);
-  EXPECT_EQ(daemon.log().count("fetchStorebagWithName: storebag 'heather' has been saved to disk cache"), 1U);
-  EXPECT_EQ(daemon.log().count("storebagForSession: Cached storebag found for client type 9"), 1U);
-  EXPECT_EQ(daemon.log().count("New storebag 'heather' received: maxAge 600, Last-Modified '(null)'"), 1U);
+  EXPECT_EQ(daemon.log().countOnceThereAre(
+                1, "fetchNetworkStorebag: Storebag Server URL: " + server.url("/bags/vindle/heather")),
+            1U);
+  EXPECT_EQ(daemon.log().countOnceThereAre(1, "fetchStorebagWithName: storebag 'heather' has been saved to disk cache"),
+            1U);
+  EXPECT_EQ(daemon.log().countOnceThereAre(1, "storebagForSession: Cached storebag found for client type 9"), 1U);
+  EXPECT_EQ(daemon.log().countOnceThereAre(1, "New storebag 'heather' received: maxAge 600, Last-Modified '(null)'"),
+            1U);
 }
 
 TEST(Storebag, ThatAnotherKeySignedIsNeitherUsedNorCached) {
@@ -93,7 +97,7 @@ TEST(Storebag, WithoutSeedFallsBackToRelease) {
   Daemon daemon(server);
 
   EXPECT_TRUE(isConfigured(openOnce(daemon, 9, 1)));
-  EXPECT_EQ(daemon.log().count("Seed section is missing in the storebag."), 1U);
+  EXPECT_EQ(daemon.log().countOnceThereAre(1, "Seed section is missing in the storebag."), 1U);
 }
 
 TEST(Storebag, OfAnInternalBuildIsTheInternalSection) {

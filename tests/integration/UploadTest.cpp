@@ -93,8 +93,9 @@ TEST_F(Upload, WhatIsNoFileOrHoldsNothingStays) {
     EXPECT_TRUE(std::filesystem::exists(path));
   }
   EXPECT_EQ(session.finish(), 0);
-  EXPECT_EQ(daemon.log().count("UploadBackend(uploadFileAtPath): Only upload a regular file."), 3U);
-  EXPECT_EQ(daemon.log().count("UploadBackend(uploadFileAtPath): Input file is empty"), 1U);
+  ASSERT_TRUE(daemon.log().waitForPart("UploadBackend(uploadFileAtPath): Input file is empty")) << "the last of them";
+  EXPECT_EQ(daemon.log().countOnceThereAre(1, "UploadBackend(uploadFileAtPath): Input file is empty"), 1U);
+  EXPECT_EQ(daemon.log().countOnceThereAre(3, "UploadBackend(uploadFileAtPath): Only upload a regular file."), 3U);
   EXPECT_TRUE(server.posts().empty());
   EXPECT_EQ(daemon.stop(), 0);
 }
@@ -246,7 +247,7 @@ TEST_F(Upload, KilledClientsFreeTheirSlotsAtOnceAndTheDaemonInTheEnd) {
   EXPECT_TRUE(std::filesystem::exists(directory / "log0"));
 }
 
-TEST_F(Upload, DaemonThatIsToldToStopCutsThemOff) {
+TEST_F(Upload, DaemonThatIsToldToStopLeavesThemBehind) {
   Daemon daemon(server, daemonOptions);
   TlsTestServer::Response silence;
   silence.silent = true;
@@ -255,7 +256,41 @@ TEST_F(Upload, DaemonThatIsToldToStopCutsThemOff) {
   server.setPostResponse(silence);
   session.send(call(directory.write("log", "text")));
   ASSERT_TRUE(server.waitForPosts(1));
+  // Minutes of work for whoever would still compress them.
+  constexpr int kWaiting = 15;
+  for (int number = 0; number < kWaiting; ++number) {
+    const auto large = directory.write("large" + std::to_string(number), "begin");
+    std::filesystem::resize_file(large, 200'000'000);
+    session.send(call(large));
+  }
+  EXPECT_EQ(session.call({{"method", "fetchDisplayURL"}}).size(), 1U) << "behind them";
   EXPECT_EQ(daemon.stop(), 0);
+  EXPECT_EQ(daemon.log().countOnceThereAre(1, "stop: uploads left behind: 16; their files stay with their clients"),
+            1U);
+  EXPECT_EQ(daemon.log().count("are still under way after"), 0U) << "nobody waits for a server that never answers";
+  EXPECT_EQ(daemon.log().countOnceThereAre(1, "UploadBackend(uploadFileAtPath): Uploading file "), 1U)
+      << "the others were not begun";
+  EXPECT_TRUE(std::filesystem::exists(directory / "log"));
+  EXPECT_TRUE(std::filesystem::exists(directory / "large0"));
+}
+
+TEST_F(Upload, OneThatTheServerIsAboutToTakeIsStillDeliveredAtTheEnd) {
+  Daemon daemon(server, daemonOptions);
+  ControlledSession session(daemon);
+  ASSERT_EQ(session.open(9, 1).size(), 3U);
+  Semaphore arrived;
+  server.tls().setHandler([&](const TlsTestServer::Request& request) {
+    arrived.signal();
+    EXPECT_TRUE(daemon.log().waitForPart("main: Asked to stop."));
+    EXPECT_EQ(TlsTestServer::gunzip(request.body), "text");
+    return answering("success");
+  });
+  const auto path = directory.write("log", "text");
+  session.send(call(path));
+  ASSERT_TRUE(arrived.waitFor(kPatience));
+  EXPECT_EQ(daemon.stop(), 0);
+  EXPECT_EQ(daemon.log().count("left behind"), 0U);
+  EXPECT_EQ(daemon.log().countOnceThereAre(1, "UploadBackend(uploadFileAtPath): sending to |"), 1U);
 }
 
 }  // namespace

@@ -15,8 +15,10 @@
 #include <cstdlib>
 #include <cstring>
 #include <fstream>
+#include <functional>
 #include <future>
 #include <iostream>
+#include <map>
 #include <memory>
 #include <set>
 #include <sstream>
@@ -87,6 +89,44 @@ std::string actions() {
   return text.str();
 }
 
+/// Signals for the process while its own thread takes none: they wait, unless another thread takes them, for which
+/// there is time. Those that were taken.
+std::string signalItself() {
+  const std::set<int> numbers{SIGHUP,  SIGINT,  SIGUSR1,   SIGUSR2, SIGPIPE, SIGALRM,
+                              SIGTERM, SIGCHLD, SIGVTALRM, SIGPROF, SIGIO,   SIGRTMIN + 1};
+  std::map<int, struct sigaction> former;
+  struct sigaction doingNothing {};
+  doingNothing.sa_handler = [](int) {};
+  sigset_t all;
+  sigset_t formerMask;
+  sigfillset(&all);
+  pthread_sigmask(SIG_SETMASK, &all, &formerMask);
+  for (const int number : numbers) {
+    sigaction(number, &doingNothing, &former[number]);
+    kill(getpid(), number);
+  }
+  std::this_thread::sleep_for(std::chrono::milliseconds(100));
+  std::string taken;
+  for (const int number : numbers) {
+    sigset_t one;
+    sigemptyset(&one);
+    sigaddset(&one, number);
+    constexpr timespec kNow{};
+    if (sigtimedwait(&one, nullptr, &kNow) != number) taken += " " + std::to_string(number);
+    sigaction(number, &former[number], nullptr);
+  }
+  pthread_sigmask(SIG_SETMASK, &formerMask, nullptr);
+  return taken;
+}
+
+/// Whoever read the standard error stream is gone.
+void breakErrorStream() {
+  int ends[2] = {};
+  if (pipe(ends) != 0 || dup2(ends[1], STDERR_FILENO) < 0) std::abort();
+  close(ends[0]);
+  close(ends[1]);
+}
+
 void handleSignals() {
   struct sigaction action {};
   action.sa_handler = [](int number) { ++(number == SIGPIPE ? brokenPipes : endedChildren); };
@@ -125,7 +165,11 @@ const char* useParentsClient(VelkReporting& client) {
   client.startLogTimerWithInterval(1, 1, 7, 1);
   client.stopLogTimer();
   client.finishSession();
-  return called ? "a callback" : nullptr;
+  if (called) return "a callback";
+  // What needs no client is at the child's service, whatever its parent's threads were about.
+  const auto root = VelkReporting::newHierarchyTokenFromParentToken(std::nullopt);
+  if (!root || !VelkReporting::newHierarchyTokenFromParentToken(*root)) return "a hierarchy token";
+  return nullptr;
 }
 
 class Host {
@@ -158,9 +202,13 @@ class Host {
     } else if (command == "stop-senders") {
       stopSenders();
     } else if (command == "block-a-module") {
-      tick(false);
+      tick([] {
+        for (;;) pause();
+      });
     } else if (command == "exit-in-a-module") {
-      tick(true);
+      tick([] { std::exit(0); });
+    } else if (command == "release-in-a-module") {
+      tick([this] { _client.reset(); });
     } else if (command == "fill") {
       result = fill();
     } else if (command == "flush") {
@@ -181,12 +229,25 @@ class Host {
       _client.reset();
     } else if (command == "leave-it-to-a-static") {
       ofStaticStorage = std::move(_client);
+    } else if (command == "leave-it-to-an-exit-handler") {
+      std::atexit([] { ofStaticStorage.reset(); });
+      ofStaticStorage = std::move(_client);
+    } else if (command == "leave-it-to-an-inner-static") {
+      static std::shared_ptr<VelkReporting> ofInnerStorage;  // ends before the library's own exit handler
+      ofInnerStorage = std::move(_client);
+    } else if (command == "exit-in-a-callback") {
+      _client->flushMessagesWithCompletion([](const auto&) { std::exit(0); });
+      for (;;) pause();
     } else if (command == "threads") {
       result = threadNames();
     } else if (command == "descriptors") {
       result = descriptors();
     } else if (command == "actions") {
       result = actions();
+    } else if (command == "signal-itself") {
+      result = signalItself();
+    } else if (command == "break-error-stream") {
+      breakErrorStream();
     } else if (command == "signals") {
       result = " " + std::to_string(brokenPipes) + " " + std::to_string(endedChildren);
     } else if (command == "fork") {
@@ -195,6 +256,15 @@ class Host {
       int times = 0;
       words >> times;
       for (int each = 0; each < times && result.empty(); ++each) result = forked();
+    } else if (command == "fork-with-its-own") {
+      int n = 0;
+      words >> n;
+      result = forkedWithItsOwn(n);
+    } else if (command == "spawn-often") {
+      int times = 0;
+      std::string path;
+      words >> times >> path;
+      result = spawnOften(times, path);
     } else if (command == "become-another") {
       say(line);
       execl("/proc/self/exe", "host_process", "descriptors", nullptr);
@@ -258,17 +328,20 @@ class Host {
     _senders.clear();
   }
 
-  /// A module whose callback never returns, or ends the process. Waits until it is called.
-  void tick(bool exits) {
+  /// Calls `action` in the callback of a module. Waits until it is called, but not for its end.
+  void tick(std::function<void()> action) {
     auto entered = std::make_shared<std::promise<void>>();
     auto isEntered = entered->get_future();
-    _client->registerPeriodicTaskForModule(1, true, false, [entered, exits](auto*) {
+    auto leave = std::make_shared<std::promise<void>>();
+    auto mayLeave = leave->get_future().share();
+    _client->registerPeriodicTaskForModule(1, true, false, [entered, mayLeave, action = std::move(action)](auto*) {
       entered->set_value();
-      if (exits) std::exit(0);
-      for (;;) pause();
+      mayLeave.wait();  // this object is nobody else's any more
+      action();
     });
     _client->startLogTimerWithInterval(3600, 0, 9, 1);
     isEntered.get();
+    leave->set_value();
   }
 
   /// Sends until events are refused, and ten more; how many were taken, and how many were not.
@@ -329,11 +402,62 @@ class Host {
       _client.reset();
       std::exit(0);  // all exit handlers of the parent
     }
+    return waitFor(child);
+  }
+
+  /// Nothing, or how the child failed.
+  static std::string waitFor(pid_t child) {
     int status = -1;
     while (waitpid(child, &status, 0) < 0 && errno == EINTR) {
     }
     if (WIFSIGNALED(status)) return " ended by signal " + std::to_string(WTERMSIG(status));
     return WEXITSTATUS(status) == 0 ? "" : " status " + std::to_string(WEXITSTATUS(status));
+  }
+
+  /// A child that makes a client, sends an event, has a child that finds both clients to be others', and exits.
+  std::string forkedWithItsOwn(int n) {
+    std::fflush(stdout);
+    const pid_t child = fork();
+    if (child < 0) return std::string(" fork: ") + std::strerror(errno);
+    if (child != 0) return waitFor(child);
+    alarm(kPatienceSeconds);
+    const auto parents = std::move(_client);
+    create(n);
+    if (!configure().empty() || !send(n, 1).empty()) _exit(1);
+    const pid_t grandchild = fork();
+    if (grandchild == 0) {
+      alarm(kPatienceSeconds);
+      if (useParentsClient(*parents) != nullptr || useParentsClient(*_client) != nullptr) _exit(2);
+      std::exit(0);
+    }
+    if (grandchild < 0 || !waitFor(grandchild).empty()) _exit(3);
+    std::exit(0);
+  }
+
+  /// Other programs, started while a thread has the library open and close what it can. Each tells what it inherited.
+  static std::string spawnOften(int times, const std::string& path) {
+    std::atomic<bool> stops{false};
+    std::thread churning([&] {
+      while (!stops) {
+        const auto client = VelkReporting::initWithSessionInfo(sessionInfo(99), userInfo(), {});
+        client->setEndOfLifeBound(std::chrono::milliseconds(0));
+        client->uploadFileWithURL(path, nullptr);
+        VelkReporting::sendOneMessageWithSessionInfo(sessionInfo(98), userInfo(), 8, 1, std::nullopt);
+      }
+    });
+    std::string result;
+    for (int each = 0; each < times && result.empty(); ++each) {
+      std::fflush(stdout);
+      const pid_t child = fork();
+      if (child == 0) {
+        execl("/proc/self/exe", "host_process", "descriptors", nullptr);
+        _exit(127);
+      }
+      result = child < 0 ? " fork failed" : waitFor(child);
+    }
+    stops = true;
+    churning.join();
+    return result;
   }
 
   std::shared_ptr<VelkReporting> _client;

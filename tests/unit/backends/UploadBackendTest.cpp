@@ -4,9 +4,15 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
+#include <atomic>
+#include <cstdlib>
 #include <filesystem>
+#include <optional>
+#include <thread>
 
+#include "connectivity/ReportingSessionConnectivityHelper.h"
 #include "platform/HandedFile.h"
+#include "tests/support/FakeHttpSession.h"
 #include "tests/support/TemporaryDirectory.h"
 #include "tests/unit/backends/BackendFixture.h"
 
@@ -269,16 +275,89 @@ TEST_F(UploadBackendTest, FilesOfAnySizeButTheLargestAreTaken) {
   EXPECT_TRUE(server->requests.empty());
 }
 
+TEST_F(UploadBackendTest, LargeFilesAreGivenUpWhenTheProcessEnds) {
+  const auto path = directory.write("log", "text");
+  std::filesystem::resize_file(path, kMaximumSizeInMemory + 1);
+  context.uploads->stop();
+  EXPECT_FALSE(upload(path));
+  EXPECT_TRUE(server->requests.empty());
+  const FileDescriptor file(::open(path.c_str(), O_RDONLY | O_CLOEXEC));
+  EXPECT_EQ(gzipFile(file, kMaximumSizeInMemory + 1, directory.path(), *context.uploads).outcome,
+            CompressedFile::Outcome::abandoned);
+}
+
+// A turn is for a piece: while all turns are taken a large file waits, and a small one goes past it.
+TEST_F(UploadBackendTest, LargeFilesTakeTurnsAndSmallOnesNone) {
+  const auto large = directory.write("large", "text");
+  std::filesystem::resize_file(large, kMaximumSizeInMemory + 1);
+  std::optional<ProcessUploads::CompressionTurn> first(std::in_place, *context.uploads);
+  std::optional<ProcessUploads::CompressionTurn> second(std::in_place, *context.uploads);
+  std::atomic<bool> done{false};
+  CompressedFile compressed;
+  std::thread compressing([&] {
+    const FileDescriptor file(::open(large.c_str(), O_RDONLY | O_CLOEXEC));
+    compressed = gzipFile(file, kMaximumSizeInMemory + 1, directory.path(), *context.uploads);
+    done = true;
+  });
+  EXPECT_TRUE(upload(directory.write("small", "text")));
+  EXPECT_FALSE(done);
+  first.reset();
+  compressing.join();
+  EXPECT_EQ(compressed.outcome, CompressedFile::Outcome::compressed);
+}
+
+TEST_F(UploadBackendTest, LogsALongAnswerUpToAWholeCharacter) {
+  server->answer = std::string(4095, 'x') + "\xC3\xA9 success";
+  EXPECT_TRUE(upload(directory.write("log", "text")));
+  EXPECT_TRUE(delivered) << "the whole of it is read";
+  EXPECT_EQ(log.count("UploadBackend(uploadFileAtPath): sending to |https://logs.example/up|, Json output: " +
+                      std::string(4095, 'x')),
+            1);
+}
+
+// The whole way: what the backend allows is what the HTTP session is told, and its end is the upload's end.
+TEST_F(UploadBackendTest, AServerThatNeverAnswersHoldsAnUploadForAMinute) {
+  FakeHttpSessionService http;
+  fakes.setHttpSessionService(&http);
+  const auto helper = ReportingSessionConnectivityHelper::initWithDelegate(
+      platform, {}, ReportingSessionConnectivityHelper::POSTRequestMode(), {});
+  helper->activate(30);
+  fakes.scheduler.runUntilIdle();
+  backend->setReportingSessionConnectivityDelegate(helper);
+  bool taken = false;
+  std::thread uploading([&] { taken = upload(directory.write("log", "text")); });
+  std::shared_ptr<FakeHttpTask> task;
+  for (int waits = 0; !task && waits < 60'000; ++waits) {
+    fakes.scheduler.runUntilIdle();
+    task = http.waitForTask(0, std::chrono::milliseconds(1));
+  }
+  if (!task) std::abort();  // the thread above would wait for ever
+  EXPECT_EQ(task->request().timeout, std::chrono::seconds(60));
+  EXPECT_TRUE(task->request().isBulk);
+  task->fail(28, "logs.example: Operation timed out");
+  fakes.scheduler.runUntilIdle();
+  uploading.join();
+  EXPECT_TRUE(taken);
+  EXPECT_FALSE(delivered);
+  EXPECT_EQ(log.count(log::Level::error, "UploadBackend(uploadFileAtPath): post logs.example: Operation timed out"), 1);
+  helper->invalidate();
+  fakes.scheduler.runUntilIdle();
+  fakes.setHttpSessionService(nullptr);
+}
+
 TEST_F(UploadBackendTest, ReadsNoMoreThanTheSizeItSaw) {
   const auto path = directory.write("log", "0123456789");
   const FileDescriptor file(::open(path.c_str(), O_RDONLY | O_CLOEXEC));
-  EXPECT_EQ(inflated(*gzipFile(file, 4, directory.path()).inMemory), "0123");
-  EXPECT_EQ(inflated(*gzipFile(file, 100, directory.path()).inMemory), "0123456789") << "it has become shorter";
-  const auto large = gzipFile(file, kMaximumSizeInMemory + 1, directory.path());
+  ProcessUploads uploads;
+  EXPECT_EQ(inflated(*gzipFile(file, 4, directory.path(), uploads).inMemory), "0123");
+  EXPECT_EQ(inflated(*gzipFile(file, 100, directory.path(), uploads).inMemory), "0123456789")
+      << "it has become shorter";
+  const auto large = gzipFile(file, kMaximumSizeInMemory + 1, directory.path(), uploads);
   EXPECT_EQ(large.outcome, CompressedFile::Outcome::compressed);
   ASSERT_EQ(::truncate(path.c_str(), 0), 0);
-  EXPECT_EQ(gzipFile(file, 4, directory.path()).outcome, CompressedFile::Outcome::nothingToRead);
-  EXPECT_EQ(gzipFile(file, kMaximumSizeInMemory + 1, directory.path()).outcome, CompressedFile::Outcome::nothingToRead);
+  EXPECT_EQ(gzipFile(file, 4, directory.path(), uploads).outcome, CompressedFile::Outcome::nothingToRead);
+  EXPECT_EQ(gzipFile(file, kMaximumSizeInMemory + 1, directory.path(), uploads).outcome,
+            CompressedFile::Outcome::nothingToRead);
 }
 
 }  // namespace

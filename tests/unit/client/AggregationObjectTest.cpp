@@ -85,13 +85,14 @@ TEST_F(AggregationObjectTest, ReleasedBlockEndsWhereCallbacksRun) {
 
 TEST_F(AggregationObjectTest, WhatWaitsForASlowBlockIsBoundedInNumber) {
   const auto object = makeListening();
-  for (std::size_t event = 0; event < EventRoom::kMaximumEvents + 5; ++event) {
+  for (std::size_t event = 0; event < CallbackRoom::kMaximumWaiting + 5; ++event) {
     send(*object, static_cast<std::uint16_t>(event));
   }
-  EXPECT_EQ(scheduler.pendingTasks(), EventRoom::kMaximumEvents);
+  EXPECT_EQ(scheduler.pendingTasks(), CallbackRoom::kMaximumWaiting);
+  EXPECT_EQ(log.count(log::Level::error, texts::kAggregationBlockIsSlow), 1) << "at once: it may never catch up";
   scheduler.runUntilIdle();
-  ASSERT_EQ(heard.size(), EventRoom::kMaximumEvents) << "the oldest are kept, in order";
-  EXPECT_EQ(heard.back().type, EventRoom::kMaximumEvents - 1);
+  ASSERT_EQ(heard.size(), CallbackRoom::kMaximumWaiting) << "the oldest are kept, in order";
+  EXPECT_EQ(heard.back().type, CallbackRoom::kMaximumWaiting - 1);
   EXPECT_EQ(log.count(log::Level::error,
                       "sendMessageToClient: 5 events were dropped: the aggregation block is slower than they come"),
             1);
@@ -102,7 +103,7 @@ TEST_F(AggregationObjectTest, WhatWaitsForASlowBlockIsBoundedInNumber) {
 
 TEST_F(AggregationObjectTest, WhatWaitsForASlowBlockIsBoundedInBytes) {
   const auto object = makeListening();
-  constexpr std::size_t kBytes = EventRoom::kMaximumBytes / 8;
+  constexpr std::size_t kBytes = CallbackRoom::kMaximumBytes / 8;
   for (std::uint16_t event = 0; event < 10; ++event) send(*object, event, kBytes);
   EXPECT_EQ(scheduler.pendingTasks(), 7U);
   scheduler.runUntilIdle();
@@ -111,7 +112,7 @@ TEST_F(AggregationObjectTest, WhatWaitsForASlowBlockIsBoundedInBytes) {
 
 TEST_F(AggregationObjectTest, EndIsHeardHoweverFarBehindTheBlockIs) {
   const auto object = makeListening();
-  constexpr std::size_t kBytes = EventRoom::kMaximumBytes / 2;
+  constexpr std::size_t kBytes = CallbackRoom::kMaximumBytes / 2;
   for (std::uint16_t event = 0; event < 3; ++event) send(*object, event, kBytes);
   end(*object);
   end(*object);

@@ -102,6 +102,26 @@ TEST(CInterfaceValue, ReadingsAreLenientWhereTheySaySo) {
   VelkReportingValueRelease(negative);
 }
 
+TEST(CInterfaceValue, NumbersBeyondABoundStayAtIt) {
+  VelkReportingValue* dictionary = VelkReportingDictionaryCreateFromJSON(
+      R"({"most": 18446744073709551615, "above": 9223372036854775808, "huge": 1e300, "least": -1e300})", nullptr);
+  ASSERT_NE(dictionary, nullptr);
+  EXPECT_EQ(VelkReportingDictionaryGetInteger(dictionary, "most"), INT64_MAX) << "not -1";
+  EXPECT_EQ(VelkReportingDictionaryGetInteger(dictionary, "above"), INT64_MAX);
+  EXPECT_EQ(VelkReportingDictionaryGetInteger(dictionary, "huge"), INT64_MAX);
+  EXPECT_EQ(VelkReportingDictionaryGetInteger(dictionary, "least"), INT64_MIN);
+  VelkReportingValue* most = VelkReportingDictionaryCopyValue(dictionary, "most");
+  EXPECT_EQ(VelkReportingValueGetInteger(most), INT64_MAX);
+  EXPECT_EQ(VelkReportingValueGetUnsignedInteger(most), UINT64_MAX) << "the value itself is kept";
+  EXPECT_EQ(VelkReportingValueGetReal(most), 18446744073709551615.0);
+  EXPECT_TRUE(VelkReportingValueGetBoolean(most));
+  VelkReportingValueRelease(most);
+  VelkReportingValueRelease(dictionary);
+  VelkReportingValue* none = VelkReportingValueCreateReal(std::nan(""));
+  EXPECT_EQ(VelkReportingValueGetInteger(none), 0);
+  VelkReportingValueRelease(none);
+}
+
 TEST(CInterfaceValue, TextAndDataKeepTheirZeros) {
   VelkReportingValue* text = VelkReportingValueCreateStringWithLength("a\0b", 3);
   std::size_t length = 0;
@@ -151,26 +171,30 @@ TEST(CInterfaceValue, OperationsOfTheWrongTypeChangeNothing) {
 }
 
 TEST(CInterfaceValue, ContainersStandWithinEachOtherUpToABound) {
-  VelkReportingValue* value = VelkReportingArrayCreate();
-  int depth = 1;
-  while (VelkReportingArrayAppend(value, value) && depth < 1000) ++depth;
-  EXPECT_EQ(depth, 64);
-  VelkReportingValue* dictionary = VelkReportingDictionaryCreate();
-  EXPECT_FALSE(VelkReportingDictionarySet(dictionary, "deep", value));
-  VelkReportingValue* inner = VelkReportingArrayCopyValue(value, 0);
-  EXPECT_TRUE(VelkReportingDictionarySet(dictionary, "deep", inner)) << "one level less";
-  VelkReportingValueRelease(inner);
-  VelkReportingValueRelease(dictionary);
-  VelkReportingValueRelease(value);
-
   std::string text;
   for (int level = 0; level < 60; ++level) text += '[';
   text += std::string(60, ']');
-  VelkReportingValue* read = VelkReportingValueCreateFromJSON(text.c_str(), nullptr);
-  depth = 60;
-  while (VelkReportingArrayAppend(read, read) && depth < 1000) ++depth;
-  EXPECT_EQ(depth, 64) << "what is read counts as well";
-  VelkReportingValueRelease(read);
+  for (VelkReportingValue* value :
+       {VelkReportingArrayCreate(), VelkReportingValueCreateFromJSON(text.c_str(), nullptr)}) {
+    for (;;) {
+      VelkReportingValue* outer = VelkReportingArrayCreate();
+      if (!VelkReportingArrayAppend(outer, value)) {
+        VelkReportingValueRelease(outer);
+        break;
+      }
+      VelkReportingValueRelease(value);
+      value = outer;
+    }
+    EXPECT_EQ(jsonOf(value), std::string(64, '[') + std::string(64, ']'));
+    VelkReportingValue* dictionary = VelkReportingDictionaryCreate();
+    EXPECT_FALSE(VelkReportingDictionarySet(dictionary, "deep", value));
+    EXPECT_EQ(VelkReportingDictionaryGetCount(dictionary), 0U);
+    VelkReportingValue* inner = VelkReportingArrayCopyValue(value, 0);
+    EXPECT_TRUE(VelkReportingDictionarySet(dictionary, "deep", inner)) << "one level less";
+    VelkReportingValueRelease(inner);
+    VelkReportingValueRelease(dictionary);
+    VelkReportingValueRelease(value);
+  }
 }
 
 TEST(CInterfaceValue, JsonGoesBothWays) {
@@ -203,6 +227,21 @@ TEST(CInterfaceValue, JsonIsChecked) {
   VelkReportingErrorRelease(error);
   EXPECT_EQ(VelkReportingValueCopyJSON(real, nullptr), nullptr);
   VelkReportingValueRelease(real);
+}
+
+TEST(CInterfaceValue, AnErrorSlotIsAlwaysWritten) {
+  VelkReportingError* error = reinterpret_cast<VelkReportingError*>(&error);  // as one that was never initialised
+  VelkReportingValue* value = VelkReportingValueCreateFromJSON("1", &error);
+  EXPECT_EQ(error, nullptr);
+  error = reinterpret_cast<VelkReportingError*>(&error);
+  VelkReportingTextFree(VelkReportingValueCopyJSON(value, &error));
+  EXPECT_EQ(error, nullptr);
+  VelkReportingValueRelease(value);
+  error = reinterpret_cast<VelkReportingError*>(&error);
+  EXPECT_EQ(VelkReportingValueCopyJSON(nullptr, &error), nullptr);
+  EXPECT_EQ(VelkReportingErrorGetCode(error), 11);
+  EXPECT_STREQ(VelkReportingErrorGetDescription(error), "there is no value");
+  VelkReportingErrorRelease(error);
 }
 
 TEST(CInterfaceValue, ErrorsAreOwned) {

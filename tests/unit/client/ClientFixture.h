@@ -3,8 +3,10 @@
 
 #include <gtest/gtest.h>
 
+#include <functional>
 #include <memory>
 #include <optional>
+#include <string_view>
 #include <utility>
 
 #include "client/VelkReporting.h"
@@ -21,6 +23,16 @@ inline PropertyDictionary userInfo() { return {{"_clientName", "Test"}, {"_servi
 inline PropertyDictionary message(int category, int type = 1) {
   return {{"ParametersCategory", category}, {"ParametersType", type}};
 }
+
+/// Runs something when a line is written, on the thread that writes it.
+struct Trigger : log::Sink {
+  Trigger(std::string_view text, std::function<void()> action) : line(text), run(std::move(action)) {}
+  void write(log::Level, std::string_view written) override {
+    if (written == line) run();
+  }
+  const std::string_view line;
+  const std::function<void()> run;
+};
 
 class VelkReportingTest : public ::testing::Test {
  protected:

@@ -1,4 +1,5 @@
 // Daemons that come, go and are slow; the last reference; forks.
+#include <poll.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
@@ -6,10 +7,52 @@
 #include <thread>
 
 #include "client/LogTexts.h"
+#include "platform/LocalSocket.h"
 #include "tests/unit/client/ClientFixture.h"
 
 namespace velk::test {
 namespace {
+
+/// In place of the fixture's log while one lives: a log whose lines can be waited for.
+class WaitedForLog {
+ public:
+  WaitedForLog() { log::setSink(_sink); }
+  ~WaitedForLog() { log::setSink(nullptr); }
+  WaitedForLog(const WaitedForLog&) = delete;
+  WaitedForLog& operator=(const WaitedForLog&) = delete;
+
+  [[nodiscard]] std::size_t count(std::string_view part) const {
+    Guard guard(_sink->lock);
+    return _sink->countLocked(part);
+  }
+  /// Waits until `count` lines hold `part`; false when they did not in time.
+  [[nodiscard]] bool waitFor(std::string_view part, std::size_t count = 1) const {
+    const auto deadline = std::chrono::steady_clock::now() + kPatience;
+    Guard guard(_sink->lock);
+    while (_sink->countLocked(part) < count) {
+      if (!_sink->changed.waitUntil(_sink->lock, deadline)) return _sink->countLocked(part) >= count;
+    }
+    return true;
+  }
+
+ private:
+  struct Sink : log::Sink {
+    void write(log::Level, std::string_view line) override {
+      Guard guard(lock);
+      lines.emplace_back(line);
+      changed.notifyAll();
+    }
+    [[nodiscard]] std::size_t countLocked(std::string_view part) const VELK_REQUIRES(lock) {
+      std::size_t found = 0;
+      for (const auto& line : lines) found += line.find(part) != std::string::npos ? 1 : 0;
+      return found;
+    }
+    Lock lock;
+    Condition changed;
+    std::vector<std::string> lines VELK_GUARDED_BY(lock);
+  };
+  const std::shared_ptr<Sink> _sink = std::make_shared<Sink>();
+};
 
 using LifecycleTest = VelkReportingTest;
 
@@ -156,6 +199,23 @@ TEST_F(LifecycleTest, ReconnectsAlthoughThereIsNothingToSay) {
   EXPECT_TRUE(heard->waitFor(kPatience));
 }
 
+TEST_F(LifecycleTest, ReachesADaemonThatComesLaterAlthoughThereIsNothingMoreToSay) {
+  const auto client = makeClient();
+  client->startConfigurationWithCompletionHandler(nullptr);
+  EXPECT_TRUE(flush(*client)) << "nobody is there";
+  _daemon.start();
+  EXPECT_TRUE(_daemon.waitForCalls("startConfigWithCompletionHandler", 1));
+}
+
+TEST_F(LifecycleTest, ReachesADaemonThatComesLaterBecauseItListens) {
+  auto heard = std::make_shared<Semaphore>();
+  const auto client = makeClient([heard](auto&&...) { heard->signal(); });
+  _daemon.start();
+  ASSERT_TRUE(_daemon.waitForCalls("setSessionInfo", 1));
+  _daemon.sendToClient(PropertyDictionary{{"SessionID", 8}}, 1, 2, 3, std::nullopt);
+  EXPECT_TRUE(heard->waitFor(kPatience));
+}
+
 TEST_F(LifecycleTest, ReconnectsAfterAGoodbyeToo) {
   _daemon.start();
   const auto client = makeClient();
@@ -163,6 +223,28 @@ TEST_F(LifecycleTest, ReconnectsAfterAGoodbyeToo) {
   _daemon.endConnections();
   EXPECT_TRUE(_daemon.waitForCalls("setSessionInfo", 2));
   EXPECT_FALSE(flush(*client));
+}
+
+TEST_F(LifecycleTest, DaemonsThatHangUpAtOnceFindTheLinkWhole) {
+  const TemporaryDirectory directory;
+  const std::string path = directory.path() + "/socket";
+  auto bound = bindLocalSocket(path, "the test");
+  ASSERT_TRUE(bound);
+  setenv("VELKREPORTING_SOCKET", path.c_str(), 1);
+  std::atomic<bool> ends{false};
+  std::thread daemon([&] {
+    while (!ends) {
+      pollfd wanted{bound->socket.get(), POLLIN, 0};
+      if (poll(&wanted, 1, 10) > 0) static_cast<void>(acceptLocalSocket(bound->socket.get()));  // closed at once
+    }
+  });
+  // Each connects on this thread, and hears on the library's that it is over, perhaps while this one is still at it.
+  for (int round = 0; round < 300; ++round) {
+    const auto client = makeClient();
+    client->setEndOfLifeBound(std::chrono::milliseconds(0));
+  }
+  ends = true;
+  daemon.join();
 }
 
 TEST_F(LifecycleTest, DaemonThatEndsEveryConnectionIsNotAskedForOneWithEveryCall) {
@@ -232,6 +314,49 @@ TEST_F(LifecycleTest, FullOutboxRefusesAndSaysSo) {
   EXPECT_TRUE(client->sendMessageWithCategory(1, 1)) << "the category form answers true all the same";
 }
 
+TEST_F(LifecycleTest, OverflowIsToldOnceADaemonIsThereHoweverOftenItGoes) {
+  const WaitedForLog log;
+  const auto client = makeClient();
+  std::size_t refusedBefore = 0;
+  for (const std::size_t refused : {5U, 3U, 8U}) {
+    std::size_t left = refused;
+    while (left != 0) {
+      Error error;
+      client->sendMessageWithCategory(1, 1, std::nullopt, &error);
+      if (error.code == 8) --left;
+    }
+    EXPECT_EQ(log.count("events were refused"), refusedBefore) << "nobody is there yet";
+    _daemon.start();
+    EXPECT_TRUE(log.waitFor(std::to_string(refused) + " events were refused while the daemon was away or slow"));
+    EXPECT_EQ(log.count("events were refused"), ++refusedBefore);
+    _daemon.stop();
+    ASSERT_TRUE(log.waitFor(texts::kConnectionInterrupted, refusedBefore));
+  }
+}
+
+TEST_F(LifecycleTest, OverflowIsToldAtTheEndAlthoughNoDaemonComes) {
+  auto client = makeClient();
+  Error error;
+  while (error.code != 8) client->sendMessageWithCategory(1, 1, std::nullopt, &error);
+  client.reset();
+  EXPECT_TRUE(_log.contains(": 1 events were refused while the daemon was away or slow"));
+  EXPECT_TRUE(_log.contains("aboutToDealloc: 16384 events are lost"));
+}
+
+TEST_F(LifecycleTest, FinishSessionAwaitsNothing) {
+  auto client = makeClient();
+  client->finishSession();
+  EXPECT_TRUE(_log.contains("finishSession: Failed to get remote object proxy: no daemon answers"));
+  _daemon.start();
+  flush(*client);
+  ASSERT_TRUE(_daemon.waitForCalls("setSessionInfo", 1));
+  _daemon.holdCalls(true);
+  client->sendMessageWithCategory(1, 1);
+  client->finishSession();  // returns although the daemon takes nothing
+  _daemon.holdCalls(false);
+  EXPECT_TRUE(_daemon.waitForCalls("finishSessionGracefully", 1));
+}
+
 TEST_F(LifecycleTest, LastReferenceWaitsForRoomAndKeepsTheOrder) {
   _daemon.start();
   auto client = makeClient();
@@ -256,6 +381,47 @@ TEST_F(LifecycleTest, LastReferenceWaitsForRoomAndKeepsTheOrder) {
   const auto calls = _daemon.calls();
   EXPECT_EQ(calls[calls.size() - 2].method, "updateSharedDataWithDictionary") << "it overtakes no event";
   EXPECT_FALSE(_log.contains("are lost"));
+}
+
+TEST_F(LifecycleTest, LastReferenceDoesNotWaitForAnAttemptThatIsDueMuchLater) {
+  const WaitedForLog log;
+  auto client = makeClient();
+  client->setEndOfLifeBound(std::chrono::minutes(1));
+  for (int event = 0; event < 50; ++event) client->sendMessageWithCategory(1, 1);
+  // Each pause is twice as long as the one before it.
+  ASSERT_TRUE(log.waitFor(texts::kFailedToConnect, 5));
+  _daemon.start();
+  client.reset();
+  ASSERT_TRUE(_daemon.waitForCalls("finishSessionGracefully", 1));
+  EXPECT_EQ(_daemon.count("sendMessageWithDictionary"), 50U);
+  EXPECT_EQ(log.count("are lost"), 0U);
+}
+
+TEST_F(LifecycleTest, LastReferenceWaitsForADaemonThatWasThereAMomentAgo) {
+  const WaitedForLog log;
+  _daemon.start();
+  auto client = makeClient();
+  client->setEndOfLifeBound(std::chrono::minutes(1));
+  EXPECT_TRUE(configure(*client));
+  _daemon.stop();
+  ASSERT_TRUE(log.waitFor(texts::kConnectionInterrupted));
+  for (int event = 0; event < 50; ++event) client->sendMessageWithCategory(1, 1);
+  const std::size_t before = log.count(texts::kFailedToConnect);
+  std::thread releasing([released = std::move(client)]() mutable { released.reset(); });
+  EXPECT_TRUE(log.waitFor(texts::kFailedToConnect, before + 5));
+  _daemon.start();
+  releasing.join();
+  ASSERT_TRUE(_daemon.waitForCalls("finishSessionGracefully", 1));
+  EXPECT_EQ(_daemon.count("sendMessageWithDictionary"), 50U);
+  EXPECT_EQ(log.count("are lost"), 0U);
+}
+
+TEST_F(LifecycleTest, LastReferenceDoesNotWaitForADaemonThatWasNeverThere) {
+  auto client = makeClient();
+  client->setEndOfLifeBound(std::chrono::hours(1));
+  for (int event = 0; event < 50; ++event) client->sendMessageWithCategory(1, 1);
+  client.reset();
+  EXPECT_TRUE(_log.contains("aboutToDealloc: 50 events are lost"));
 }
 
 }  // namespace

@@ -53,16 +53,6 @@ class PeriodicLifecycleTest : public VelkReportingTest {
   }
 };
 
-/// Runs something when a line is written, on the thread that writes it.
-struct Trigger : log::Sink {
-  Trigger(std::string_view text, std::function<void()> action) : line(text), run(std::move(action)) {}
-  void write(log::Level, std::string_view written) override {
-    if (written == line) run();
-  }
-  const std::string_view line;
-  const std::function<void()> run;
-};
-
 TEST_F(PeriodicLifecycleTest, AReportArrivesAsARealtimeEvent) {
   _daemon.start();
   const auto client = makeClient();

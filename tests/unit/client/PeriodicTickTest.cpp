@@ -187,6 +187,46 @@ TEST_F(PeriodicTickTest, AModuleMayUnregisterItselfAndOthersFromItsCallback) {
   EXPECT_EQ(_log.count("unregisterPeriodTaskForModule: 3 doesn't exist"), 1);
 }
 
+TEST_F(PeriodicTickTest, AModuleMayStopAndStartTheTimerFromItsCallback) {
+  std::vector<bool> reports;
+  registerModule(1, true, true, [&](PropertyDictionary* statistics) {
+    reports.push_back(statistics != nullptr);
+    if (reports.size() != 2) return;
+    _tasks->stopLogTimer();
+    _tasks->startLogTimer(20, 3, 3, 4);
+  });
+  start(10, 3);
+  runAll();
+  passInterval(10s);
+  passInterval(0s);  // the new timer's first tick, at once
+  EXPECT_EQ(reports.size(), 3U);
+  passInterval(10s);
+  EXPECT_EQ(reports.size(), 3U) << "the new interval holds";
+  passInterval(10s);
+  passInterval(20s);
+  EXPECT_EQ(reports, (std::vector<bool>{false, false, false, false, true})) << "the count began anew";
+  stop();
+}
+
+TEST_F(PeriodicTickTest, AModuleThatNeverReturnsHoldsUpItsQueueAndNothingElse) {
+  registerModule(1, true, true, [](PropertyDictionary*) {});
+  start(10, 1);
+  auto stuck = std::move(_workers.front());
+  _workers.clear();
+  bool ran = false;
+  _queue->async([&ran] { ran = true; });
+  for (int interval = 0; interval < 1000; ++interval) passInterval(10s);
+  EXPECT_FALSE(ran);
+  EXPECT_EQ(ticks(), 1U);
+  EXPECT_LE(_scheduler.pendingTasks(), 1U) << "ticks do not pile up";
+  EXPECT_FALSE(sawTimeout());
+  stuck();  // it would not: but what it left must end with the test
+  stuck = nullptr;
+  runAll();
+  EXPECT_TRUE(ran);
+  stop();
+}
+
 TEST_F(PeriodicTickTest, WhatACallbackRegistersItMayTakeBack) {
   Owned owned;
   registerModule(1, true, false, [&](PropertyDictionary*) {

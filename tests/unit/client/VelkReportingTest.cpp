@@ -295,6 +295,21 @@ TEST_F(ClientUploadTest, LinksAndDirectoriesReachTheDaemon) {
   EXPECT_EQ(_daemon.calls().back().arguments[2], PropertyValue(true)) << "a descriptor came along";
 }
 
+TEST_F(ClientUploadTest, AddressesOfFilesAreReadAsTheDaemonReadsThem) {
+  _daemon.start();
+  _daemon.setDeliversUploads(true);
+  const auto client = makeClient();
+  for (const char* scheme : {"FILE://", "file:", "File://localhost", "file://"}) {
+    const auto path = _directory.write("a log", "text");
+    EXPECT_TRUE(upload(*client, scheme + _directory.path() + "/a%20log")) << scheme;
+    EXPECT_FALSE(files::exists(path)) << scheme;
+  }
+  // A name may look like the beginning of an address.
+  EXPECT_TRUE(upload(*client, _directory.write("file:log", "text")));
+  EXPECT_TRUE(upload(*client, _directory.write("100%20", "text")));
+  EXPECT_FALSE(files::exists(_directory / "100%20"));
+}
+
 TEST_F(ClientUploadTest, HoldsSoManyFilesAndNoMore) {
   _daemon.start();
   _daemon.holdCalls(true);

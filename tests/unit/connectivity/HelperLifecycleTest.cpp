@@ -94,6 +94,34 @@ TEST_F(ConnectivityHelperTest, InvalidatingAnActiveHelperReturnsTheTransactionsW
   EXPECT_EQ(logged("didBecomeInvalidWithError: session <%@> invalidated with error %@", {identifier(), nullptr}), 1);
 }
 
+// A session may end after its transport: nobody would come by again to give its reference back.
+TEST_F(ConnectivityHelperTest, ASessionThatEndsAfterItsTransportReturnsItsTransactionAtOnce) {
+  const auto active = makeActive(4);
+  active->incrementTotalSessionsServedCount();
+  active->invalidate();
+  scheduler().runUntilIdle();
+  active->incrementTotalSessionsServedCount();
+  EXPECT_EQ(owner->released, (std::vector<std::uint32_t>{1, 1}));
+
+  const auto inactive = make(4);
+  inactive->invalidate();
+  scheduler().runUntilIdle();
+  inactive->incrementTotalSessionsServedCount();
+  EXPECT_EQ(owner->released, (std::vector<std::uint32_t>{1, 1, 0, 1}));
+}
+
+TEST_F(ConnectivityHelperTest, ATransportThatIsActiveAgainKeepsTransactionsUntilItIsInvalidAgain) {
+  const auto helper = makeActive(4);
+  helper->invalidate();
+  helper->activate(30);
+  scheduler().runUntilIdle();
+  helper->incrementTotalSessionsServedCount();
+  EXPECT_EQ(owner->released, (std::vector<std::uint32_t>{0}));
+  helper->invalidate();
+  scheduler().runUntilIdle();
+  EXPECT_EQ(owner->released, (std::vector<std::uint32_t>{0, 1}));
+}
+
 TEST_F(ConnectivityHelperTest, ItsSessionKeepsItAliveUntilItIsInvalid) {
   auto helper = makeActive(4);
   const std::weak_ptr<Helper> weak = helper;

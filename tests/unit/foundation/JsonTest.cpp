@@ -137,5 +137,13 @@ TEST(JsonParser, KeepsTheKindsOfNumbers) {
   EXPECT_NE(json::parse("18446744073709551616")->real(), nullptr);
 }
 
+TEST(Json, RefusesHalvesOfSurrogatePairs) {
+  for (const char* text : {R"("\udc00")", R"("\ud800")", R"("\ud800\ud800")", R"({"\udfff": 1})", R"(["a\udc00b"])"}) {
+    EXPECT_FALSE(json::parse(text)) << text;
+  }
+  EXPECT_EQ(json::parse(R"("\udc00")").error().description, "half of a surrogate pair stands alone (at byte 8)");
+  EXPECT_EQ(*json::parse(R"("\ud83d\ude00")")->string(), "\U0001f600");
+}
+
 }  // namespace
 }  // namespace velk

@@ -42,14 +42,23 @@ TEST(FormatText, DescribesValuesOnOneLine) {
 
 TEST(Description, ShowsEvenWhatJsonRefuses) {
   const PropertyValue value(PropertyDictionary{{"bad\xff\n", PropertyArray{std::string("\x01")}}});
-  EXPECT_EQ(description(&value), "{\"bad\xff\\n\":[\"\\u0001\"]}");
+  EXPECT_EQ(description(&value), R"({"bad\xff\n":["\u0001"]})");
 }
 
 TEST(WithoutControlCharacters, LeavesNothingThatBeginsALine) {
   EXPECT_EQ(withoutControlCharacters("a\nb\rc\x1b[31m\x7f"), "a\\nb\\rc\\x1b[31m\\x7f");
   EXPECT_EQ(withoutControlCharacters("x\u2028y\u0085z\u00e4"), "x\\u2028y\\u0085z\u00e4");
-  EXPECT_EQ(withoutControlCharacters("\u20ac \u00a9 \xc2"), "\u20ac \u00a9 \xc2") << "their first bytes are innocent";
+  EXPECT_EQ(withoutControlCharacters("\u20ac \u00a9 \U0001f600"), "\u20ac \u00a9 \U0001f600");
   EXPECT_EQ(withoutControlCharacters(""), "");
+}
+
+TEST(WithoutControlCharacters, LeavesNothingThatIsNoText) {
+  EXPECT_EQ(withoutControlCharacters("a\xff\xc3\xa4\xe2\x82"), "a\\xff\xc3\xa4\\xe2\\x82");
+  EXPECT_EQ(withoutControlCharacters("\x9b"
+                                     "31m\xed\xa0\x80"),
+            "\\x9b31m\\xed\\xa0\\x80")
+      << "a terminal's own bytes";
+  EXPECT_EQ(withoutControlCharacters("\xc2"), "\\xc2");
 }
 
 TEST(Split, KeepsBlanksAndEmptyParts) {
@@ -74,6 +83,15 @@ TEST(Utf8, AcceptsTheStandardAndNothingElse) {
     EXPECT_FALSE(isUtf8(bad)) << hexadecimal(bytes(bad));
   }
   EXPECT_EQ(utf16Length("a\u00e4\U0001F600"), 4U);
+}
+
+TEST(Utf8, PrefixEndsWithAWholeCharacter) {
+  const std::string_view text = "a\xC3\xA9\xF0\x9F\x98\x80z";
+  const std::size_t expected[] = {0, 1, 1, 3, 3, 3, 3, 7, 8, 8};
+  for (std::size_t most = 0; most < std::size(expected); ++most) {
+    EXPECT_EQ(utf8Prefix(text, most), text.substr(0, expected[most])) << most;
+  }
+  EXPECT_EQ(utf8Prefix("", 5), "");
 }
 
 TEST(Base64, EncodesAndDecodesEveryRemainder) {

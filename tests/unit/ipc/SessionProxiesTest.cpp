@@ -30,10 +30,11 @@ class RecordingSession final : public ClientSessionInterface {
   void sendMessageWithDictionary(PropertyDictionary dictionary, TextReply reply) override {
     hadReply = static_cast<bool>(reply);
     asked.append(PropertyArray{"sendMessage", std::move(dictionary)});
-    reply("sent");
+    reply(text.value_or("sent"));
   }
   void flushMessagesWithCompletion(FlushReply reply) override {
     asked.append("flush");
+    if (text) return reply(text, std::nullopt);
     reply(std::nullopt, Error{"domain", -1, "none"});
   }
   void finishSessionGracefully() override { asked.append("finish"); }
@@ -67,6 +68,8 @@ class RecordingSession final : public ClientSessionInterface {
 
   PropertyArray asked;
   bool hadReply = false;
+  /// The answer to messages and flushes.
+  std::optional<std::string> text;
 };
 
 class SessionProxiesTest : public testing::Test {
@@ -257,6 +260,59 @@ TEST_F(SessionProxiesTest, CarriesEventsToTheClient) {
   queue->runUntil([&] { return receiver->events.size() == 2; });
   EXPECT_EQ(receiver->events[0], (PropertyArray{PropertyDictionary{{"a", 1}}, 1.5, 2, 65535, PropertyDictionary{}}));
   EXPECT_EQ(receiver->events[1], (PropertyArray{nullptr, 0.0, 0, 0, nullptr}));
+}
+
+// Only the end of aggregation may use the room that is kept for replies, and no more than that.
+TEST_F(SessionProxiesTest, TheEndOfAggregationFitsIntoAFullOutbox) {
+  const auto receiver = std::make_shared<RecordingClient>();
+  client->setExportedDispatcher(std::make_shared<ReplyInterfaceDispatcher>(receiver));
+  ReplyInterfaceProxy toClient(daemon);
+  const PropertyDictionary info{{"SessionID", 1}};
+  const auto fill = [&](std::size_t bytes) {
+    std::size_t sent = 0;
+    while (toClient.sendMessageToClient(info, 0, 1, 1, PropertyDictionary{{"text", std::string(bytes, 'x')}})) ++sent;
+    return sent;
+  };
+  // The client does not read yet.
+  std::size_t events = fill(100'000) + fill(1'000) + fill(1);
+  ASSERT_FALSE(toClient.sendMessageToClient(info, 0, 0, 0, std::nullopt));
+  ASSERT_TRUE(toClient.sendMessageToClient(std::nullopt, 0, 0, 0, std::nullopt));
+  resume();
+  queue->runUntil([&] { return receiver->events.size() == events + 1; });
+  EXPECT_EQ(receiver->events.back(), (PropertyArray{nullptr, 0.0, 0, 0, nullptr})) << "behind everything";
+}
+
+TEST_F(SessionProxiesTest, EndsOfAggregationThatNobodyReadsAreBounded) {
+  ReplyInterfaceProxy toClient(daemon);
+  Result<void> sent;
+  std::size_t count = 0;
+  while (count < ipc::kMaximumOutboxBytes && (sent = toClient.sendMessageToClient(std::nullopt, 0, 0, 0, std::nullopt)))
+    ++count;
+  ASSERT_FALSE(sent);
+  EXPECT_EQ(sent.error().code, static_cast<int>(ConnectionError::outboxFull));
+}
+
+TEST_F(SessionProxiesTest, CutsATextThatIsLargerThanAFrame) {
+  std::string large;
+  while (large.size() < ipc::kMaximumReplyTextBytes) large += "\xC3\xA9";
+  large.insert(0, "x");  // so that the bound lies within a character
+  large += "the end";
+  session->text = large;
+  resume();
+  std::optional<std::string> flushed;
+  std::optional<std::string> sent;
+  SessionInterfaceProxy proxy(client);
+  proxy.flushMessagesWithCompletion([&](std::optional<std::string> text, std::optional<Error> error) {
+    EXPECT_FALSE(error) << error->description;
+    flushed = std::move(text);
+  });
+  proxy.sendMessageWithDictionary({}, [&](std::optional<std::string> text) { sent = std::move(text); });
+  queue->runUntil([&] { return sent.has_value(); });
+  const std::size_t kept = ipc::kMaximumReplyTextBytes - 1;
+  const std::string expected =
+      large.substr(0, kept) + "\n(" + std::to_string(large.size() - kept) + " more bytes are left out)";
+  EXPECT_TRUE(flushed == expected);
+  EXPECT_TRUE(sent == expected);
 }
 
 TEST_F(SessionProxiesTest, RefusesAnEventThatIsTooLargeAndLivesOn) {

@@ -6,65 +6,17 @@
 
 #include <atomic>
 #include <fstream>
+#include <memory>
 #include <thread>
+#include <vector>
 
-#include "tests/support/TlsTestServer.h"
-#include "tests/unit/platform/HttpRecorder.h"
+#include "tests/unit/platform/HttpFixture.h"
 
 namespace velk {
 namespace {
 
 using test::TlsTestServer;
 using namespace std::chrono_literals;
-
-class HttpSessionTest : public testing::Test {
- protected:
-  HttpSessionTest() { trust(_server.caFile()); }
-  ~HttpSessionTest() override {
-    _session.reset();
-    _service.reset();
-    _queue->runPending();
-  }
-
-  void trust(std::string caFile, HttpSessionConfiguration configuration = {}) {
-    _session.reset();
-    HttpTrust trusted;
-    trusted.caFile = std::move(caFile);
-    _service = makeHttpSessionService(std::move(trusted));
-    makeSession(std::move(configuration));
-  }
-  void makeSession(HttpSessionConfiguration configuration) {
-    _session = _service->makeSession(std::move(configuration), _delegate, _queue);
-  }
-
-  [[nodiscard]] HttpRequest request(std::string_view path = "/") const {
-    HttpRequest request;
-    request.url = _server.url(path);
-    request.timeout = 20s;
-    return request;
-  }
-  void start(HttpRequest request, const std::string& description = "task") {
-    auto task = _session->makeDataTask(std::move(request));
-    ASSERT_TRUE(task) << task.error().description;
-    (*task)->setTaskDescription(description);
-    (*task)->resume();
-  }
-  [[nodiscard]] bool waitForCompletions(int count) {
-    return _queue->runUntil([&] { return _delegate->completed >= count; });
-  }
-  const Recorder::Outcome& fetch(HttpRequest request) {
-    const int expected = _delegate->completed + 1;
-    start(std::move(request));
-    EXPECT_TRUE(waitForCompletions(expected));
-    return _delegate->outcomes["task"];
-  }
-
-  TlsTestServer _server;
-  std::shared_ptr<PumpedQueue> _queue = std::make_shared<PumpedQueue>();
-  std::shared_ptr<Recorder> _delegate = std::make_shared<Recorder>();
-  std::unique_ptr<HttpSessionService> _service;
-  std::shared_ptr<HttpSession> _session;
-};
 
 TEST_F(HttpSessionTest, TellsResponseThenDataThenCompletion) {
   _server.setResponse({.status = 200, .body = "hello", .headers = {{"X-One", "1"}}});
@@ -162,47 +114,6 @@ TEST_F(HttpSessionTest, DoesNotFollowRedirects) {
   EXPECT_EQ(_server.requests().size(), 1u);
 }
 
-TEST_F(HttpSessionTest, ASilentServerEndsTheTaskAtItsTimeout) {
-  _server.setResponse({.silent = true});
-  auto get = request();
-  get.timeout = 200ms;
-  const auto& outcome = fetch(std::move(get));
-  ASSERT_TRUE(outcome.error);
-  EXPECT_EQ(outcome.error->code, 28);
-  EXPECT_EQ(outcome.response, nullptr);
-}
-
-TEST_F(HttpSessionTest, ARefusedConnectionIsAnErrorAtOnce) {
-  HttpSessionConfiguration configuration;
-  configuration.waitsForConnectivity = true;
-  makeSession(configuration);
-  auto get = request();
-  {
-    TlsTestServer gone;
-    get.url = gone.url();
-  }
-  const auto& outcome = fetch(std::move(get));
-  ASSERT_TRUE(outcome.error);
-  EXPECT_EQ(outcome.error->code, 7);
-}
-
-TEST_F(HttpSessionTest, ALongAnswerEndsTheTask) {
-  HttpSessionConfiguration configuration;
-  configuration.maximumResponseBytes = 1000;
-  makeSession(configuration);
-  _server.setResponse({.body = std::string(1000, 'x')});
-  EXPECT_FALSE(fetch(request()).error);
-  _server.setResponse({.body = std::string(1001, 'x')});
-  auto outcome = fetch(request());
-  ASSERT_TRUE(outcome.error);
-  EXPECT_EQ(outcome.error->code, 63);
-  // A length that is not announced is noticed as it comes.
-  _server.setResponse({.raw = "HTTP/1.1 200 OK\r\n\r\n" + std::string(5000, 'x')});
-  outcome = fetch(request());
-  ASSERT_TRUE(outcome.error);
-  EXPECT_EQ(outcome.error->code, 63);
-}
-
 TEST_F(HttpSessionTest, RequestsOfSeveralSessionsReuseOneConnection) {
   EXPECT_FALSE(fetch(request("/1")).error);
   EXPECT_FALSE(fetch(request("/2")).error);
@@ -280,65 +191,6 @@ TEST_F(HttpSessionTest, ManyTasksAtOnceAllEnd) {
   EXPECT_LE(_server.connectionCount(), 8);
 }
 
-TEST_F(HttpSessionTest, AServerGetsEightRequestsAtOnceAndTheRestInOrder) {
-  std::atomic<int> underWay{0};
-  std::atomic<int> most{0};
-  _server.setHandler([&](const TlsTestServer::Request&) {
-    const int now = ++underWay;
-    int seen = most;
-    while (now > seen && !most.compare_exchange_weak(seen, now)) {
-    }
-    // The first eight answer only when all of them are there.
-    for (; most < 8; std::this_thread::yield()) {
-    }
-    --underWay;
-    return TlsTestServer::Response{};
-  });
-  for (int number = 0; number < 100; ++number) start(request(), std::to_string(number));
-  ASSERT_TRUE(waitForCompletions(100));
-  for (const auto& [name, outcome] : _delegate->outcomes) EXPECT_FALSE(outcome.error) << name;
-  EXPECT_EQ(most, 8);
-  EXPECT_LE(_server.connectionCount(), 8);
-}
-
-TEST_F(HttpSessionTest, ATaskInLineEndsAtItsTimeout) {
-  _server.setResponse({.silent = true});
-  for (int number = 0; number < 8; ++number) start(request(), std::to_string(number));
-  ASSERT_TRUE(_server.waitForRequests(8));
-  auto late = request();
-  late.timeout = 100ms;
-  start(std::move(late), "late");
-  ASSERT_TRUE(waitForCompletions(1));
-  const auto& outcome = _delegate->outcomes["late"];
-  ASSERT_TRUE(outcome.error);
-  EXPECT_EQ(outcome.error->code, 28);
-  EXPECT_EQ(outcome.error->description, "127.0.0.1: too many requests before it within the request's time");
-  EXPECT_EQ(_server.requests().size(), 8U);
-}
-
-TEST_F(HttpSessionTest, BulkStandsInALineOfItsOwn) {
-  _server.setHandler([](const TlsTestServer::Request& request) {
-    return TlsTestServer::Response{.silent = request.target == "/bulk"};
-  });
-  auto bulk = request("/bulk");
-  bulk.isBulk = true;
-  for (int number = 0; number < 20; ++number) start(bulk, std::to_string(number));
-  ASSERT_TRUE(_server.waitForRequests(8));
-  EXPECT_FALSE(fetch(request("/small")).error);
-  EXPECT_EQ(_delegate->completed, 1);
-  EXPECT_EQ(_server.requests().size(), 9U) << "no more of the bulk either";
-}
-
-TEST_F(HttpSessionTest, TheEndOfTheServiceEndsTasksInLine) {
-  _server.setResponse({.silent = true});
-  for (int number = 0; number < 20; ++number) start(request(), std::to_string(number));
-  ASSERT_TRUE(_server.waitForRequests(8));
-  _session.reset();
-  _service.reset();
-  ASSERT_TRUE(waitForCompletions(20));
-  for (const auto& [name, outcome] : _delegate->outcomes) EXPECT_TRUE(outcome.error) << name;
-}
-
 TEST_F(HttpSessionTest, ASlowDelegateHoldsTheTransferUp) {
   const std::string body(8 * 1024 * 1024, 'x');
   _server.setResponse({.body = body});
@@ -384,29 +236,6 @@ TEST_F(HttpSessionTest, RefusesNamesOfHeadersAndMethodsThatAreNone) {
   get.headers.clear();
   get.method = "GET / HTTP/1.1\r\n";
   EXPECT_FALSE(_session->makeDataTask(get));
-}
-
-TEST_F(HttpSessionTest, SurvivesHostileServers) {
-  std::string manyHeaders = "HTTP/1.1 200 OK\r\n";
-  for (int i = 0; i < 20'000; ++i) manyHeaders += "X-" + std::to_string(i) + ": value\r\n";
-  const std::vector<std::string> answers = {
-      "\x01\x02garbage that is no HTTP\r\n\r\n",
-      "HTTP/1.1 200 OK\r\nContent-Length: 100\r\n\r\nonly this",
-      "HTTP/1.1 200 OK\r\nX: " + std::string(600'000, 'x') + "\r\n\r\n",
-      manyHeaders + "\r\n",
-      "HTTP/1.1 200 OK\r\nTransfer-Encoding: chunked\r\n\r\nzz\r\nbroken",
-      "HTTP/1.1 200 OK\r\nTransfer-Encoding: chunked\r\n\r\n5\r\nhe",
-      "HTTP/1.1 200 OK\r\nContent-Length: -1\r\n\r\n",
-      "HTTP/9.9 abc\r\n\r\n",
-      "HTTP/1.1",
-  };
-  for (const auto& answer : answers) {
-    _server.setResponse({.raw = answer});
-    EXPECT_TRUE(fetch(request()).error) << answer.substr(0, 60);
-  }
-  _server.setResponse({.body = "fine"});
-  _delegate->outcomes.clear();
-  EXPECT_EQ(fetch(request()).body, "fine");
 }
 
 TEST_F(HttpSessionTest, UploadsAFileThatIsRemovedAtOnce) {

@@ -1,8 +1,14 @@
 #include "platform/ThreadPool.h"
 
 #include <gtest/gtest.h>
+#include <signal.h>
+#include <sys/wait.h>
+#include <unistd.h>
 
 #include <atomic>
+#include <cerrno>
+#include <cstdlib>
+#include <functional>
 #include <memory>
 #include <string>
 #include <thread>
@@ -362,6 +368,93 @@ TEST(ThreadPool, HandingOverWhileItStopsRunsOrDropsButNeverLosesATask) {
     producer.join();
     for (auto& queue : queues) queue->sync([] {});
     EXPECT_EQ(ended, 200);
+  }
+}
+
+/// Threads that have a pool's lock, or want it, all the time.
+class BusyPool {
+ public:
+  BusyPool() {
+    for (int number = 0; number < 3; ++number) {
+      _threads.emplace_back([this] {
+        const auto queue = _pool->makeSerialQueue("busy");
+        while (!_isOver) {
+          for (int task = 0; task < 100; ++task) queue->async([] {});
+          queue->sync([] {});
+        }
+      });
+    }
+  }
+  ~BusyPool() {
+    _isOver = true;
+    for (auto& thread : _threads) thread.join();
+  }
+  /// Forks in a task, runs `inChild` there, and returns the child's status.
+  int fork(const std::function<void()>& inChild) {
+    int status = -1;
+    Semaphore forked;
+    _pool->makeSerialQueue("forking")->async([&] {
+      const pid_t child = ::fork();
+      if (child == 0) {
+        // A task's thread has its signals blocked: a child that hangs is to end all the same.
+        sigset_t alarm;
+        sigemptyset(&alarm);
+        sigaddset(&alarm, SIGALRM);
+        pthread_sigmask(SIG_UNBLOCK, &alarm, nullptr);
+        ::alarm(60);
+        return inChild();
+      }
+      while (::waitpid(child, &status, 0) < 0 && errno == EINTR) {
+      }
+      forked.signal();
+    });
+    forked.wait();
+    return status;
+  }
+  [[nodiscard]] ThreadPool& pool() { return *_pool; }
+
+ private:
+  const std::unique_ptr<ThreadPool> _pool = makeThreadPool(options(4));
+  std::atomic<bool> _isOver{false};
+  std::vector<std::thread> _threads;
+};
+
+constexpr int kForks = 100;
+// A fork beside allocating threads may leave the child with the address sanitizer's own allocator locked for ever:
+// gcc's gives its locks no handlers at fork, which the C library's allocator and the thread sanitizer have.
+#ifdef __SANITIZE_ADDRESS__
+constexpr bool kChildrenMayAllocate = false;
+#else
+constexpr bool kChildrenMayAllocate = true;
+#endif
+
+TEST(ThreadPool, AChildThatATaskForkedMayWaitAndHandOver) {
+  if (!kChildrenMayAllocate) GTEST_SKIP() << "the sanitizer's allocator does not outlive forks";
+  BusyPool busy;
+  const auto queue = busy.pool().makeSerialQueue("queue");
+  for (int number = 0; number < kForks; ++number) {
+    const int status = busy.fork([&] {
+      static_cast<void>(Semaphore().waitFor(1ms));
+      bool ran = false;
+      busy.pool().makeSerialQueue("new")->async([&ran] { ran = true; });
+      queue->async([&ran] { ran = true; });
+      queue->asyncAfter(1ms, [&ran] { ran = true; });
+      const bool isInert = !ran && busy.pool().threadCount() == 0 && queue->sync([] { return true; });
+      ::_exit(isInert ? 0 : 1);
+    });
+    ASSERT_TRUE(WIFEXITED(status)) << "fork " << number << ", signal " << WTERMSIG(status);
+    ASSERT_EQ(WEXITSTATUS(status), 0);
+  }
+}
+
+TEST(ThreadPool, AChildThatReturnsFromTheTaskThatForkedItEnds) {
+  if (!kChildrenMayAllocate) GTEST_SKIP() << "the sanitizer's allocator does not outlive forks";
+  constexpr int kEndedByItself = 7;
+  BusyPool busy;
+  for (int number = 0; number < kForks; ++number) {
+    const int status = busy.fork([] { static_cast<void>(std::atexit([] { ::_exit(kEndedByItself); })); });
+    ASSERT_TRUE(WIFEXITED(status)) << "fork " << number << ", signal " << WTERMSIG(status);
+    ASSERT_EQ(WEXITSTATUS(status), kEndedByItself) << "with its only thread";
   }
 }
 

@@ -1,6 +1,9 @@
 #include "platform/UserDefaults.h"
 
+#include <fcntl.h>
 #include <gtest/gtest.h>
+#include <signal.h>
+#include <sys/file.h>
 #include <sys/stat.h>
 #include <sys/wait.h>
 #include <unistd.h>
@@ -196,6 +199,28 @@ TEST_F(UserDefaultsTest, LosesNoKeyOfProcessesThatWriteAtOnce) {
     EXPECT_EQ(status, 0);
   }
   EXPECT_EQ(open()->allValues().size(), static_cast<std::size_t>(kProcesses * kKeys));
+}
+
+TEST_F(UserDefaultsTest, ChildrenForkedDuringAWriteKeepNobodyOut) {
+  const auto suite = open();
+  pid_t child = -1;
+  const auto stored = suite->valueOrStore("key", [&child]() -> PropertyValue {
+    child = ::fork();  // as another thread of this process might just now
+    if (child == 0) {
+      ::alarm(60);
+      for (;;) ::pause();
+    }
+    return 1;
+  });
+  EXPECT_TRUE(stored);
+  const int lock = ::open((directory / "state/suite.lock").c_str(), O_RDWR | O_CLOEXEC);
+  ASSERT_GE(lock, 0);
+  EXPECT_EQ(::flock(lock, LOCK_EX | LOCK_NB), 0) << "the child's copy of the descriptor holds the lock";
+  ::close(lock);
+  ASSERT_GT(child, 0);
+  ::kill(child, SIGKILL);
+  int status = 0;
+  EXPECT_EQ(::waitpid(child, &status, 0), child);
 }
 
 TEST_F(UserDefaultsTest, LosesNoKeyOfThreadsThatWriteAtOnce) {

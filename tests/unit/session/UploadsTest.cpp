@@ -1,4 +1,3 @@
-#include "session/FileUrl.h"
 #include "session/UploadQueue.h"
 #include "tests/unit/session/SessionFixture.h"
 
@@ -139,14 +138,43 @@ TEST_F(UploadsTest, WhatEndedSessionsLeftBehindCountsForAll) {
   start({"splunk"});
   leaveTwoUploadsBehind();
   session->teardown();
-  EXPECT_EQ(*services.uploadsOfAll, 2U);
+  auto& ofAll = *services.backends.uploads;
+  EXPECT_EQ(ofAll.count(), 2U);
   fakes.scheduler.runUntilIdle();
-  EXPECT_EQ(*services.uploadsOfAll, 0U);
-  *services.uploadsOfAll = UploadQueue::kMaximumUploadsOfAll;
+  EXPECT_EQ(ofAll.count(), 0U);
+  while (!ofAll.isFull()) ofAll.enter();
   start({"splunk"});
   EXPECT_EQ(uploadFile("file:///tmp/b"), false);
-  *services.uploadsOfAll = 0;
+  ofAll.leave();
   EXPECT_EQ(uploadFile("file:///tmp/b"), true);
+}
+
+TEST_F(UploadsTest, WhatWaitsAtTheEndOfTheProcessIsNotBegunAndStaysWithItsClient) {
+  prepareBackend = [](FakeBackend& each) { each.takesUploads = each.deliversUploads = true; };
+  start({"splunk"});
+  std::vector<bool> taken;
+  session->uploadFileAtPath("file:///tmp/a", "token", FileDescriptor(),
+                            [&](bool isTaken, bool isDelivered) { taken.push_back(isTaken || isDelivered); });
+  session->uploadLogData(numbers({1}), [&](bool isTaken, std::optional<Error>) { taken.push_back(isTaken); });
+  services.backends.uploads->stop();
+  fakes.scheduler.runUntilIdle();
+  EXPECT_EQ(taken, (std::vector<bool>{false, false}));
+  EXPECT_EQ(journal.entries(), std::vector<std::string>{});
+  EXPECT_EQ(services.backends.uploads->leftBehind(), 2U);
+  EXPECT_EQ(uploadFile("file:///tmp/b"), false) << "nor what comes afterwards";
+  EXPECT_EQ(services.backends.uploads->leftBehind(), 3U);
+}
+
+TEST_F(UploadsTest, WhatIsDeliveredWhileTheProcessEndsIsNotLeftBehind) {
+  prepareBackend = [](FakeBackend& each) { each.takesUploads = each.deliversUploads = true; };
+  start({"splunk"});
+  UploadQueue queue(fakes.scheduler, services.backends.uploads);
+  queue.run([this](bool mayBegin) {
+    services.backends.uploads->stop();
+    return mayBegin;
+  });
+  fakes.scheduler.runUntilIdle();
+  EXPECT_EQ(services.backends.uploads->leftBehind(), 0U);
 }
 
 TEST_F(UploadsTest, SessionThatEndsKeepsItsTransportForWhatItLeavesBehind) {
@@ -200,21 +228,6 @@ TEST_F(UploadsTest, LogDataThatNobodyTakesFails) {
   start({"splunk"});
   EXPECT_EQ(uploadLog(numbers({1})), false);
   EXPECT_EQ(recordedLog.count(log::Level::error, kLogDataFailed), 1);
-}
-
-TEST(FileUrl, GivesThePath) {
-  EXPECT_EQ(fileSystemPath("file:///tmp/a%20b"), "/tmp/a b");
-  EXPECT_EQ(fileSystemPath("file://localhost/tmp/a"), "/tmp/a");
-  EXPECT_EQ(fileSystemPath("FILE:/tmp/a"), "/tmp/a");
-  EXPECT_EQ(fileSystemPath("/tmp/a%20b"), "/tmp/a%20b");
-  EXPECT_EQ(fileSystemPath("file://host"), "");
-  EXPECT_EQ(fileSystemPath(""), "");
-}
-
-TEST(FileUrl, LeavesWhatIsNoEscape) {
-  EXPECT_EQ(fileSystemPath("file:///a%2"), "/a%2");
-  EXPECT_EQ(fileSystemPath("file:///a%zz%C3%A9"), "/a%zz\xC3\xA9");
-  EXPECT_EQ(fileSystemPath("file:///a%00b"), "/a%00b");
 }
 
 }  // namespace

@@ -34,6 +34,12 @@ TEST_F(CtlProgram, WantsACommandThatItKnows) {
   EXPECT_EQ(run({"--help"}), ExitCode::ok);
 }
 
+TEST_F(CtlProgram, TellsProgramsWhatIsWrongWithACommandLine) {
+  EXPECT_EQ(run({"status", "--no-such-option", "--json"}), ExitCode::usage);
+  EXPECT_EQ(error.str(), "{\"error\":\"The following argument was not expected: --no-such-option\",\"status\":64}\n");
+  EXPECT_EQ(out.str(), "");
+}
+
 TEST_F(CtlProgram, SignsAndVerifiesAStorebag) {
   const std::string bag = directory.write("bag.json", R"({"version":"7","release":{}})");
   ASSERT_EQ(run({"storebag", "keygen", "--out", path("keys")}), ExitCode::ok) << error.str();

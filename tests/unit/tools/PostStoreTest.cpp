@@ -43,6 +43,16 @@ TEST(PostStore, KeepsItsFilesFromOthers) {
   }
 }
 
+TEST(PostStore, SaysWhichFileIsNoDatabaseAndWhatToDo) {
+  const test::TemporaryDirectory directory;
+  const auto path = directory.write("posts.sqlite", std::string(5000, 'x'));
+  const auto opened = PostStore::open(path);
+  ASSERT_FALSE(opened);
+  EXPECT_EQ(opened.error().description,
+            "cannot use the database " + path + ": file is not a database. Put it aside, and a new one is begun");
+  EXPECT_EQ(directory.read("posts.sqlite"), std::string(5000, 'x')) << "what may be mended is left alone";
+}
+
 TEST(PostStore, RefusesAFileThatIsNoDatabase) {
   const test::TemporaryDirectory directory;
   EXPECT_FALSE(PostStore::open(directory.write("posts.sqlite", std::string(5000, 'x'))));
