@@ -38,7 +38,9 @@ class EventLoop::State final : public TimerService, public std::enable_shared_fr
 
   // On the loop's thread only.
   [[nodiscard]] asio::io_context& io() noexcept { return _io->context; }
-  void enlist(LoopWatchState* watch) { _watches.push_back(watch); }
+  void enlist(LoopWatchState* watch);
+
+  // Any thread.
   void forget(LoopWatchState* watch);
 
  private:
@@ -53,6 +55,7 @@ class EventLoop::State final : public TimerService, public std::enable_shared_fr
   void run();
   void drain();
   void dropEverything();
+  [[nodiscard]] std::shared_ptr<LoopWatchState> takeLastWatch();
   void armTimer();
   void fireTimer();
 
@@ -65,7 +68,6 @@ class EventLoop::State final : public TimerService, public std::enable_shared_fr
   // Used on the loop's thread only.
   std::optional<SteadyTime> _armedFor;
   std::vector<Task> _running;
-  std::vector<LoopWatchState*> _watches;
 
   // Guarded by _lock.
   Lock _lock;
@@ -74,6 +76,7 @@ class EventLoop::State final : public TimerService, public std::enable_shared_fr
   bool _started VELK_GUARDED_BY(_lock) = false;
   bool _stopped VELK_GUARDED_BY(_lock) = false;
   std::thread _thread VELK_GUARDED_BY(_lock);
+  std::vector<LoopWatchState*> _watches VELK_GUARDED_BY(_lock);
   TimerSchedule _schedule VELK_GUARDED_BY(_lock);
 };
 

@@ -2,15 +2,19 @@
 #include <algorithm>
 #include <asio/posix/stream_descriptor.hpp>
 #include <cerrno>
+#include <utility>
 
 #include "platform/EventLoopState.h"
 
 namespace velk {
 
 /// What a watch shares with the operations that it has under way. Those hold neither it nor the handlers: an operation
-/// that a stopped loop never completes keeps nothing alive.
+/// that a stopped loop never completes keeps nothing alive. Waits on the loop's thread; closes on any, since the owner
+/// of a watch may be let go of anywhere once the loop stops.
 class LoopWatchState : public std::enable_shared_from_this<LoopWatchState> {
  public:
+  using Kind = asio::posix::stream_descriptor::wait_type;
+
   explicit LoopWatchState(std::shared_ptr<EventLoop::State> loop) : _loop(std::move(loop)), _descriptor(_loop->io()) {}
 
   bool open(int descriptor) {
@@ -24,12 +28,12 @@ class LoopWatchState : public std::enable_shared_from_this<LoopWatchState> {
     return true;
   }
 
-  void wait(asio::posix::stream_descriptor::wait_type kind, Task& slot, Task handler) {
-    slot = std::move(handler);
-    _descriptor.async_wait(kind, [weak = weak_from_this(), &slot](const std::error_code&) {
+  void wait(Kind kind, Task handler) {
+    const Task replaced = exchangeHandler(kind, std::move(handler));
+    _descriptor.async_wait(kind, [weak = weak_from_this(), kind](const std::error_code&) {
       const auto self = weak.lock();
       if (!self) return;
-      if (auto ready = std::move(slot)) ready();
+      if (auto ready = self->exchangeHandler(kind, nullptr)) ready();
     });
   }
 
@@ -39,19 +43,26 @@ class LoopWatchState : public std::enable_shared_from_this<LoopWatchState> {
     dropHandlers();
   }
 
+  /// They end outside the lock: what they hold may be the watch itself.
   void dropHandlers() {
-    const Task readable = std::move(_readable);
-    const Task writable = std::move(_writable);
+    const Task readable = exchangeHandler(Kind::wait_read, nullptr);
+    const Task writable = exchangeHandler(Kind::wait_write, nullptr);
   }
 
   [[nodiscard]] bool forked() const noexcept { return _loop->forked(); }
 
-  Task _readable;
-  Task _writable;
-
  private:
+  [[nodiscard]] Task exchangeHandler(Kind kind, Task handler) {
+    Guard guard(_lock);
+    return std::exchange(kind == Kind::wait_read ? _readable : _writable, std::move(handler));
+  }
+
   const std::shared_ptr<EventLoop::State> _loop;
   asio::posix::stream_descriptor _descriptor;
+
+  Lock _lock;
+  Task _readable VELK_GUARDED_BY(_lock);
+  Task _writable VELK_GUARDED_BY(_lock);
 };
 
 namespace {
@@ -68,12 +79,8 @@ class LoopWatch final : public DescriptorWatch {
     }
   }
 
-  void whenReadable(Task handler) override {
-    _state->wait(asio::posix::stream_descriptor::wait_read, _state->_readable, std::move(handler));
-  }
-  void whenWritable(Task handler) override {
-    _state->wait(asio::posix::stream_descriptor::wait_write, _state->_writable, std::move(handler));
-  }
+  void whenReadable(Task handler) override { _state->wait(LoopWatchState::Kind::wait_read, std::move(handler)); }
+  void whenWritable(Task handler) override { _state->wait(LoopWatchState::Kind::wait_write, std::move(handler)); }
 
  private:
   std::shared_ptr<LoopWatchState> _state;
@@ -81,11 +88,28 @@ class LoopWatch final : public DescriptorWatch {
 
 }  // namespace
 
+void EventLoop::State::enlist(LoopWatchState* watch) {
+  Guard guard(_lock);
+  _watches.push_back(watch);
+}
+
 void EventLoop::State::forget(LoopWatchState* watch) {
+  Guard guard(_lock);
   _watches.erase(std::remove(_watches.begin(), _watches.end(), watch), _watches.end());
 }
 
-/// The last thing on the loop's thread. Dropping a handler may destroy watches, which leave the list.
+/// The last watch that is still there, which leaves the list; none when no more are.
+std::shared_ptr<LoopWatchState> EventLoop::State::takeLastWatch() {
+  Guard guard(_lock);
+  if (_watches.empty()) return nullptr;
+  // A watch leaves the list before it ends, and that takes the lock: this one has not ended.
+  auto watch = _watches.back()->shared_from_this();
+  _watches.pop_back();
+  return watch;
+}
+
+/// The last thing on the loop's thread. Dropping a handler may destroy watches, here or, where another thread holds
+/// their owner, there.
 void EventLoop::State::dropEverything() {
   std::vector<TimerSchedule::Action> actions;
   {
@@ -93,11 +117,7 @@ void EventLoop::State::dropEverything() {
     actions = _schedule.takeAll();
   }
   actions.clear();
-  while (!_watches.empty()) {
-    const auto watch = _watches.back()->shared_from_this();
-    _watches.pop_back();
-    watch->dropHandlers();
-  }
+  while (const auto watch = takeLastWatch()) watch->dropHandlers();
 }
 
 std::unique_ptr<DescriptorWatch> makeLoopWatch(std::shared_ptr<EventLoop::State> state, int descriptor) {

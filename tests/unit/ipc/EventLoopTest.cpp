@@ -1,5 +1,6 @@
 #include "platform/EventLoop.h"
 
+#include <fcntl.h>
 #include <unistd.h>
 
 #include <array>
@@ -87,6 +88,33 @@ TEST(EventLoop, DropsTheHandlersOfWatchesWhenStopped) {
     watch->whenReadable([token, watch] {});
   });
   loop.stop();
+  EXPECT_EQ(token.use_count(), 1);
+}
+
+// A connection whose last frame is just being run may be let go of by that thread, not by the loop's.
+TEST(EventLoop, StopsWhileAnotherThreadGivesItsWatchesUp) {
+  constexpr int kWatches = 200;
+  EventLoop loop("test-loop");
+  std::array<int, 2> ends{};
+  ASSERT_EQ(::pipe2(ends.data(), O_CLOEXEC), 0);
+  const FileDescriptor reading(ends[0]);
+  const FileDescriptor writing(ends[1]);
+  std::vector<FileDescriptor> copies;
+  std::vector<std::unique_ptr<DescriptorWatch>> watches;
+  Event made;
+  auto token = std::make_shared<int>(1);
+  loop.post([&] {
+    for (int count = 0; count < kWatches; ++count) {
+      copies.emplace_back(::fcntl(reading.get(), F_DUPFD_CLOEXEC, 0));
+      watches.push_back(loop.watch(copies.back().get()));
+      watches.back()->whenReadable([token] {});
+    }
+    made.happen();
+  });
+  ASSERT_TRUE(made.wait());
+  std::thread other([&] { watches.clear(); });
+  loop.stop();
+  other.join();
   EXPECT_EQ(token.use_count(), 1);
 }
 
