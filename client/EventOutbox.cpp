@@ -4,9 +4,7 @@
 #include <cstring>
 #include <string_view>
 
-#include "ipc/CborWriter.h"
 #include "ipc/Limits.h"
-#include "ipc/MethodTable.h"
 
 namespace velk {
 
@@ -79,14 +77,6 @@ EventEstimate estimateEvent(const PropertyDictionary& message) {
   add(estimate, message, ipc::kMaximumDepth - 2);  // within the body's array and the message itself
   if (estimate.size >= kSurelySmall) estimate.isSurelySendable = false;
   return estimate;
-}
-
-const char* reasonNotToSend(const PropertyDictionary& message) {
-  CborWriter writer(ipc::kMaximumFrameBytes);
-  writer.beginArray(2);
-  writer.unsignedInteger(static_cast<std::uint32_t>(Method::sendMessageWithDictionary));
-  writer.value(message);
-  return writer.fault() == CborWriter::Fault::none ? nullptr : CborWriter::description(writer.fault());
 }
 
 bool EventRoom::reserve(std::size_t size) noexcept {

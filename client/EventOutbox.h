@@ -16,16 +16,13 @@ namespace velk {
 /// to what the outbox could not hold in any case.
 struct EventEstimate {
   std::size_t size = 0;
-  /// Plain and small enough to be sent for sure; else only `reasonNotToSend` knows.
+  /// Plain and small enough to be sent for sure; else only `SessionInterfaceProxy::reasonNotToSend` knows.
   bool isSurelySendable = true;
 };
 [[nodiscard]] EventEstimate estimateEvent(const PropertyDictionary& message);
 [[nodiscard]] inline std::size_t estimatedSize(const PropertyDictionary& message) {
   return estimateEvent(message).size;
 }
-
-/// Why this message can never be sent to a daemon (too large, too deep, no text), in words; null when it can.
-[[nodiscard]] const char* reasonNotToSend(const PropertyDictionary& message);
 
 /// Room for so many events and bytes, taken and given back by whoever hands events on. Any thread.
 class EventRoom {

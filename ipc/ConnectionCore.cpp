@@ -4,6 +4,7 @@
 #include <string>
 
 #include "foundation/Text.h"
+#include "ipc/CallBody.h"
 #include "ipc/Limits.h"
 #include "ipc/LogTexts.h"
 #include "platform/BlockingScope.h"
@@ -126,11 +127,7 @@ Result<void> ConnectionCore::sendCall(std::uint32_t method, std::size_t argument
   if (descriptors.size() > kMaximumDescriptorsPerFrame) {
     return Failure(connectionError(ConnectionError::notEncodable, "too many descriptors"));
   }
-  const auto body = [&](CborWriter& writer) {
-    writer.beginArray(argumentCount + 1);
-    writer.unsignedInteger(method);
-    encode(writer);
-  };
+  const auto body = [&](CborWriter& writer) { writeCallBody(writer, method, argumentCount, encode); };
   bool wake = false;
   {
     Guard guard(_lock);

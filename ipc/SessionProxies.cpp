@@ -1,6 +1,7 @@
 #include "ipc/SessionProxies.h"
 
 #include "ipc/ArgumentReader.h"
+#include "ipc/CallBody.h"
 #include "ipc/ConnectionCore.h"
 #include "ipc/LogTexts.h"
 #include "ipc/MethodTable.h"
@@ -49,6 +50,24 @@ void sendWithReply(Connection& connection, const ProxyErrorHandler& handler, Met
 }
 
 void nothing(CborWriter&) {}
+
+auto argumentsOfMessage(const PropertyDictionary& dictionary) {
+  return [&dictionary](CborWriter& writer) { writer.value(dictionary); };
+}
+
+constexpr std::size_t kSingleMessageArguments = 5;
+
+auto argumentsOfSingleMessage(const PropertyDictionary& sessionInfo, const std::optional<PropertyDictionary>& userInfo,
+                              std::uint16_t category, std::uint16_t type,
+                              const std::optional<PropertyDictionary>& payload) {
+  return [&sessionInfo, &userInfo, category, type, &payload](CborWriter& writer) {
+    writer.value(sessionInfo);
+    writer.optional(userInfo);
+    writer.unsignedInteger(category);
+    writer.unsignedInteger(type);
+    writer.optional(payload);
+  };
+}
 
 bool deliverConfiguration(ArgumentReader& values, ConfigurationReply& reply) {
   auto backends = values.optionalArray();
@@ -129,9 +148,8 @@ void SessionInterfaceProxy::fetchDisplayURL(TextReply reply) {
 }
 
 void SessionInterfaceProxy::sendMessageWithDictionary(PropertyDictionary dictionary, TextReply reply) {
-  sendWithReply(
-      *_connection, _errorHandler, Method::sendMessageWithDictionary, 1,
-      [&](CborWriter& writer) { writer.value(dictionary); }, std::move(reply), deliverText);
+  sendWithReply(*_connection, _errorHandler, Method::sendMessageWithDictionary, 1, argumentsOfMessage(dictionary),
+                std::move(reply), deliverText);
 }
 
 void SessionInterfaceProxy::flushMessagesWithCompletion(FlushReply reply) {
@@ -165,15 +183,21 @@ void SessionInterfaceProxy::sendMessageWithSessionInfo(PropertyDictionary sessio
                                                        std::optional<PropertyDictionary> userInfo,
                                                        std::uint16_t category, std::uint16_t type,
                                                        std::optional<PropertyDictionary> payload, TextReply reply) {
-  const auto encode = [&](CborWriter& writer) {
-    writer.value(sessionInfo);
-    writer.optional(userInfo);
-    writer.unsignedInteger(category);
-    writer.unsignedInteger(type);
-    writer.optional(payload);
-  };
-  sendWithReply(*_connection, _errorHandler, Method::sendMessageWithSessionInfo, 5, encode, std::move(reply),
+  sendWithReply(*_connection, _errorHandler, Method::sendMessageWithSessionInfo, kSingleMessageArguments,
+                argumentsOfSingleMessage(sessionInfo, userInfo, category, type, payload), std::move(reply),
                 deliverText);
+}
+
+const char* SessionInterfaceProxy::reasonNotToSend(const PropertyDictionary& dictionary) {
+  return ipc::reasonNotToCall(numberOf(Method::sendMessageWithDictionary), 1, argumentsOfMessage(dictionary));
+}
+
+const char* SessionInterfaceProxy::reasonNotToSend(const PropertyDictionary& sessionInfo,
+                                                   const std::optional<PropertyDictionary>& userInfo,
+                                                   std::uint16_t category, std::uint16_t type,
+                                                   const std::optional<PropertyDictionary>& payload) {
+  return ipc::reasonNotToCall(numberOf(Method::sendMessageWithSessionInfo), kSingleMessageArguments,
+                              argumentsOfSingleMessage(sessionInfo, userInfo, category, type, payload));
 }
 
 void SessionInterfaceProxy::updateSharedDataWithDictionary(PropertyDictionary dictionary) {

@@ -39,6 +39,14 @@ class SessionInterfaceProxy final : public ClientSessionInterface {
   void updateSharedDataForKey(std::string key, std::optional<PropertyValue> value) override;
   void setDigestKey(ByteData key, std::int32_t algorithm) override;
 
+  /// Why `sendMessageWithDictionary`, or `sendMessageWithSessionInfo`, could never be sent with these arguments,
+  /// whatever the connection: too large, too deep, text that is not UTF-8. In words; null when it could. Any thread.
+  [[nodiscard]] static const char* reasonNotToSend(const PropertyDictionary& dictionary);
+  [[nodiscard]] static const char* reasonNotToSend(const PropertyDictionary& sessionInfo,
+                                                   const std::optional<PropertyDictionary>& userInfo,
+                                                   std::uint16_t category, std::uint16_t type,
+                                                   const std::optional<PropertyDictionary>& payload);
+
   /// The daemon's status; refused unless this process may read it.
   void copyStatus(StatusReply reply);
 

@@ -2,6 +2,7 @@
 
 #include <gtest/gtest.h>
 
+#include "ipc/SessionProxies.h"
 #include "tests/unit/client/ClientFixture.h"
 
 namespace velk::test {
@@ -30,13 +31,13 @@ TEST(EventEstimate, CallsNothingSurelySendableThatIsNot) {
   for (int depth = 0; depth < 40; ++depth) {
     const PropertyDictionary event = eventWith(nestedArrays(depth));
     EXPECT_EQ(estimateEvent(event).isSurelySendable, depth <= 30) << depth;
-    EXPECT_EQ(reasonNotToSend(event) == nullptr, depth <= 30) << depth;
+    EXPECT_EQ(SessionInterfaceProxy::reasonNotToSend(event) == nullptr, depth <= 30) << depth;
   }
   for (int number : {4000, 4090, 4096, 4097, 5000}) {
     PropertyDictionary keys;
     for (int key = 0; key < number; ++key) keys.set(std::to_string(key), nullptr);
     const PropertyDictionary event = eventWith(keys);
-    EXPECT_EQ(reasonNotToSend(event) == nullptr, number <= 4096) << number;
+    EXPECT_EQ(SessionInterfaceProxy::reasonNotToSend(event) == nullptr, number <= 4096) << number;
     EXPECT_FALSE(estimateEvent(event).isSurelySendable && number > 4096) << number;
   }
   for (std::size_t length = 0; length < 20; ++length) {
@@ -46,13 +47,15 @@ TEST(EventEstimate, CallsNothingSurelySendableThatIsNot) {
       std::string broken = text;
       broken[at] = '\xff';
       EXPECT_FALSE(estimateEvent(eventWith(broken)).isSurelySendable) << length << ", " << at;
-      EXPECT_STREQ(reasonNotToSend(eventWith(broken)), "text that is not UTF-8");
+      EXPECT_STREQ(SessionInterfaceProxy::reasonNotToSend(eventWith(broken)), "text that is not UTF-8");
       EXPECT_FALSE(estimateEvent(eventWith(PropertyDictionary{{broken, 1}})).isSurelySendable) << "a key";
     }
   }
-  EXPECT_EQ(reasonNotToSend(eventWith("gr\u00fc\u00df")), nullptr) << "asked, since it is not plain";
-  EXPECT_EQ(reasonNotToSend(eventWith(std::string(100'000, 'x'))), nullptr) << "asked, since it is large";
-  EXPECT_STREQ(reasonNotToSend(eventWith(ByteData(1024 * 1024))), "too large for a frame");
+  EXPECT_EQ(SessionInterfaceProxy::reasonNotToSend(eventWith("gr\u00fc\u00df")), nullptr)
+      << "asked, since it is not plain";
+  EXPECT_EQ(SessionInterfaceProxy::reasonNotToSend(eventWith(std::string(100'000, 'x'))), nullptr)
+      << "asked, since it is large";
+  EXPECT_STREQ(SessionInterfaceProxy::reasonNotToSend(eventWith(ByteData(1024 * 1024))), "too large for a frame");
 }
 
 TEST(EventEstimate, WalksNoFurtherThanTheOutboxIsLarge) {
@@ -61,7 +64,7 @@ TEST(EventEstimate, WalksNoFurtherThanTheOutboxIsLarge) {
   EXPECT_GT(estimate.size, EventRoom::kMaximumBytes);
   EXPECT_LT(estimate.size, 2 * EventRoom::kMaximumBytes);
   EXPECT_FALSE(estimate.isSurelySendable);
-  EXPECT_STREQ(reasonNotToSend(event), "too many values");
+  EXPECT_STREQ(SessionInterfaceProxy::reasonNotToSend(event), "too many values");
 }
 
 class EventsThatContainThemselves : public VelkReportingTest {};
