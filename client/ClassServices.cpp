@@ -8,9 +8,6 @@
 #include "client/VelkReporting.h"
 #include "client/VelkReportingImplementation.h"
 #include "foundation/Uuid.h"
-#include "ipc/CborWriter.h"
-#include "ipc/Limits.h"
-#include "ipc/MethodTable.h"
 #include "ipc/SessionProxies.h"
 #include "ipc/Vocabulary.h"
 #include "platform/Log.h"
@@ -73,23 +70,14 @@ struct OneMessage {
   std::optional<PropertyDictionary> payload;
 };
 
-const char* reasonNotToSend(const OneMessage& message) {
-  CborWriter writer(ipc::kMaximumFrameBytes);
-  writer.beginArray(6);
-  writer.unsignedInteger(static_cast<std::uint32_t>(Method::sendMessageWithSessionInfo));
-  writer.value(message.sessionInfo);
-  writer.optional(message.userInfo);
-  writer.unsignedInteger(message.category);
-  writer.unsignedInteger(message.type);
-  writer.optional(message.payload);
-  return writer.fault() == CborWriter::Fault::none ? nullptr : CborWriter::description(writer.fault());
-}
-
 void sendOneMessage(ClientRuntime& runtime, const OneMessage& message, std::shared_ptr<OneShotSlot> slot) {
   log::standard(texts::kClientStartsLogging);
   auto made = connectToDaemon(runtime, runtime.oneMessageQueue());
-  if (!made && isDistrust(made.error())) return log::error("sendOneMessageWithSessionInfo: %s", made.error());
-  if (!made) return log::standard(texts::kOneMessageFailedToConnect);
+  if (!made) {
+    log::standard(texts::kOneMessageFailedToConnect);
+    if (isLasting(made.error())) return log::error("sendOneMessageWithSessionInfo: %s", made.error());
+    return log::standard("sendOneMessageWithSessionInfo: %s", made.error());
+  }
   const std::shared_ptr<Connection> connection = std::move(*made);
   connection->setInvalidationHandler([slot] { log::standard(texts::kOneMessageInvalidated); });
   connection->setInterruptionHandler([] { log::standard(texts::kOneMessageInterrupted); });
@@ -124,7 +112,8 @@ bool VelkReporting::sendOneMessageWithSessionInfo(const std::optional<PropertyDi
     if (category == 0) return refuse({domain, 4, "the category is 0"});
     OneMessage message{*sessionInfo, userInfo, category, type, payload};
     message.sessionInfo.set(kVelkReportingSessionInfoBatchEvent, false);  // the event must go out at once
-    if (const char* reason = reasonNotToSend(message)) {
+    if (const char* reason =
+            SessionInterfaceProxy::reasonNotToSend(message.sessionInfo, userInfo, category, type, payload)) {
       log::error(texts::kOneMessageIsNotSendable, category, reason);
       return refuse(
           {domain, VelkReportingImplementation::kNotSendable, std::string("the event cannot be sent: ") + reason});

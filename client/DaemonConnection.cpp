@@ -17,7 +17,10 @@ Result<std::shared_ptr<Connection>> connectToDaemon(ClientRuntime& runtime, std:
   return failure(std::string(kTrustErrorDomain), kDistrustedService, *distrust);
 }
 
-bool isDistrust(const Error& error) { return error.domain == kTrustErrorDomain && error.code == kDistrustedService; }
+bool isLasting(const Error& error) {
+  if (error.domain == kTrustErrorDomain) return error.code == kDistrustedService;
+  return error.domain == kConnectionErrorDomain && error.code == static_cast<int>(ConnectionError::notAllowed);
+}
 
 ProxyErrorHandler loggingHandler(std::string_view text) {
   return [text](const Error& error) {

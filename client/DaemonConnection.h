@@ -19,7 +19,9 @@ inline constexpr std::string_view kTrustErrorDomain = "VelkReportingTrust";
 /// connection has been ended again. Logs nothing.
 [[nodiscard]] Result<std::shared_ptr<Connection>> connectToDaemon(ClientRuntime& runtime,
                                                                   std::shared_ptr<Queue> deliveryQueue);
-[[nodiscard]] bool isDistrust(const Error& error);
+/// Whether somebody has to put it right (a daemon that is not to be trusted, a socket that this process may not use):
+/// no time that passes will.
+[[nodiscard]] bool isLasting(const Error& error);
 
 /// An error handler that fills `text`, which outlives it, with the error and logs it: as an error if the call can never
 /// be sent, whatever the daemon does, since its owner hears of that in no other way.

@@ -32,6 +32,12 @@ class IncomingEvents {
     return std::exchange(_takerIsExpected, true) ? 0 : _ticket;
   }
 
+  /// For whoever could not queue the taker with that ticket: the next event needs another one.
+  void takerIsNotComing(Ticket ticket) {
+    Guard guard(_lock);
+    if (ticket == _ticket) _takerIsExpected = false;
+  }
+
   /// For other work that is about to be queued: everything that was handed over before it.
   [[nodiscard]] std::vector<Event> takeForWork() {
     Guard guard(_lock);

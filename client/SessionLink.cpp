@@ -111,15 +111,11 @@ bool SessionLink::mayComeBack() const { return _lostAt && now() - *_lostAt < kRe
 
 std::shared_ptr<Connection> SessionLink::makeConnection() {
   auto made = connectToDaemon(_runtime, _queue);
-  if (!made && isDistrust(made.error())) {
-    log::error("initWithSessionInfo: %s", made.error());
-    return nullptr;
-  }
   if (!made) {
-    log::standard(texts::kFailedToConnect);
-    log::debug("initWithSessionInfo: %s", made.error());
+    reportNoConnection(made.error());
     return nullptr;
   }
+  _reportedProblem.clear();
   const std::shared_ptr<Connection> connection = std::move(*made);
   connection->setExportedDispatcher(std::make_shared<ReplyInterfaceDispatcher>(_exported));
   connection->setInvalidationHandler([self = weak_from_this(), invalidated = std::weak_ptr(connection)] {
@@ -131,6 +127,15 @@ std::shared_ptr<Connection> SessionLink::makeConnection() {
     if (const auto link = self.lock()) link->wasInterrupted(interrupted);
   });
   return connection;
+}
+
+/// A daemon that is not there is no error; what somebody has to put right is one, told once and not at each attempt.
+void SessionLink::reportNoConnection(const Error& error) {
+  log::standard(texts::kFailedToConnect);
+  if (!isLasting(error)) return log::standard("initWithSessionInfo: %s", error);
+  if (error.description == _reportedProblem) return;
+  _reportedProblem = error.description;
+  log::error("initWithSessionInfo: %s", error);
 }
 
 void SessionLink::describeSession(const std::shared_ptr<Connection>& connection) {

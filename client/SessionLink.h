@@ -75,6 +75,7 @@ class SessionLink : public std::enable_shared_from_this<SessionLink> {
  private:
   [[nodiscard]] std::shared_ptr<Connection> tryToConnect();
   [[nodiscard]] std::shared_ptr<Connection> makeConnection();
+  void reportNoConnection(const Error& error);
   void describeSession(const std::shared_ptr<Connection>& connection);
   void wasInterrupted(const std::weak_ptr<Connection>& connection);
   void wasInvalidated(const std::weak_ptr<Connection>& connection);
@@ -103,6 +104,8 @@ class SessionLink : public std::enable_shared_from_this<SessionLink> {
   Duration _longestPause = std::chrono::seconds(10);  ///< of somebody who has something to say
   Duration _quietPause{};
   bool _reconnects = false;
+  /// Why there was no connection last time, where somebody had to be told.
+  std::string _reportedProblem;
 };
 
 }  // namespace velk

@@ -9,6 +9,7 @@
 #include "client/VelkReportingImplementation.h"
 #include "foundation/FileUrl.h"
 #include "foundation/Text.h"
+#include "ipc/SessionProxies.h"
 #include "ipc/Vocabulary.h"
 #include "platform/Log.h"
 
@@ -31,6 +32,39 @@ int reasonToRefuseAddress(const std::string& url) {
   constexpr std::size_t kMaximumBytes = 16 * 1024;  // the longest path with every byte escaped, and a host
   if (url.size() > kMaximumBytes) return ENAMETOOLONG;
   return isUtf8(url) ? 0 : EILSEQ;
+}
+
+/// Throws only for want of memory: then the event has not been taken.
+bool sendMessage(Implementation& implementation, const PropertyDictionary& dictionary, Error* error) {
+  const PropertyValue* categoryValue = dictionary.find(kVelkReportingMessageParametersCategory);
+  if (categoryValue == nullptr) {
+    assign(error, {std::string(texts::kMissingCategory), 7, {}});  // the text stands in the domain
+    return false;
+  }
+  if (!dictionary.contains(kVelkReportingMessageParametersType)) {
+    assign(error, {std::string(texts::kMissingType), 7, {}});
+    return false;
+  }
+  const std::uint16_t category = uint16Value(categoryValue);
+  if (category == 0) {
+    assign(error, invalidCategory());
+    return false;
+  }
+  assign(error, {});
+  using Sent = Implementation::Sent;
+  const Sent sent = implementation.sendMessage(category, dictionary);
+  if (sent == Sent::notFromForkedChild) {
+    assign(error,
+           {errorDomain(), Implementation::kForkedChild, "this process was forked from the one that made the client"});
+  } else if (sent == Sent::outboxFull) {
+    assign(error, {errorDomain(), Implementation::kOutboxFull,
+                   "the outbox is full: the daemon is away or too slow, and the event was not taken"});
+  } else if (sent == Sent::notSendable) {
+    const char* reason = SessionInterfaceProxy::reasonNotToSend(dictionary);
+    assign(error, {errorDomain(), Implementation::kNotSendable,
+                   std::string("the event cannot be sent: ") + (reason != nullptr ? reason : "")});
+  }
+  return sent == Sent::taken;
 }
 
 }  // namespace
@@ -107,43 +141,14 @@ bool VelkReporting::sendMessageWithCategory(std::uint16_t category, std::uint16_
     message.appendUnique(std::string(kVelkReportingMessageParametersType), type);
     if (payload) message.appendUnique(std::string(kVelkReportingMessageParametersPayload), *payload);
     message.appendUnique(std::string(kVelkReportingMessageParametersFlag), 0);
-    static_cast<void>(sendMessageWithDictionary(message, error));  // a filtered event is no failure of this form
+    // A filtered event is no failure of this form; one for which there is no memory is.
+    static_cast<void>(sendMessage(*_implementation, message, error));
     return true;
   });
 }
 
 bool VelkReporting::sendMessageWithDictionary(const PropertyDictionary& dictionary, Error* error) {
-  return guarded("sendMessageWithDictionary", false, [&] {
-    const PropertyValue* categoryValue = dictionary.find(kVelkReportingMessageParametersCategory);
-    if (categoryValue == nullptr) {
-      assign(error, {std::string(texts::kMissingCategory), 7, {}});  // the text stands in the domain
-      return false;
-    }
-    if (!dictionary.contains(kVelkReportingMessageParametersType)) {
-      assign(error, {std::string(texts::kMissingType), 7, {}});
-      return false;
-    }
-    const std::uint16_t category = uint16Value(categoryValue);
-    if (category == 0) {
-      assign(error, invalidCategory());
-      return false;
-    }
-    assign(error, {});
-    using Sent = Implementation::Sent;
-    const Sent sent = _implementation->sendMessage(category, dictionary);
-    if (sent == Sent::notFromForkedChild) {
-      assign(error, {errorDomain(), Implementation::kForkedChild,
-                     "this process was forked from the one that made the client"});
-    } else if (sent == Sent::outboxFull) {
-      assign(error, {errorDomain(), Implementation::kOutboxFull,
-                     "the outbox is full: the daemon is away or too slow, and the event was not taken"});
-    } else if (sent == Sent::notSendable) {
-      const char* reason = reasonNotToSend(dictionary);
-      assign(error, {errorDomain(), VelkReportingImplementation::kNotSendable,
-                     std::string("the event cannot be sent: ") + (reason != nullptr ? reason : "")});
-    }
-    return sent == Sent::taken;
-  });
+  return guarded("sendMessageWithDictionary", false, [&] { return sendMessage(*_implementation, dictionary, error); });
 }
 
 bool VelkReporting::flushMessages() {

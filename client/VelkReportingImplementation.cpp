@@ -3,6 +3,7 @@
 #include "client/DaemonConnection.h"
 #include "client/LogTexts.h"
 #include "ipc/MethodTable.h"
+#include "ipc/SessionProxies.h"
 #include "ipc/Vocabulary.h"
 #include "platform/Log.h"
 
@@ -58,7 +59,7 @@ VelkReportingImplementation::Sent VelkReportingImplementation::sendMessage(std::
     return Sent::filtered;
   }
   const EventEstimate estimate = estimateEvent(message);
-  if (const char* reason = estimate.isSurelySendable ? nullptr : reasonNotToSend(message)) {
+  if (const char* reason = estimate.isSurelySendable ? nullptr : SessionInterfaceProxy::reasonNotToSend(message)) {
     log::error(texts::kEventIsNotSendable, category, reason);
     return Sent::notSendable;
   }
@@ -67,8 +68,18 @@ VelkReportingImplementation::Sent VelkReportingImplementation::sendMessage(std::
 
 bool VelkReportingImplementation::enqueueEvent(const PropertyDictionary& message, std::size_t size) {
   if (!_outbox.reserve(size)) return false;
-  const IncomingEvents::Ticket ticket = _incoming.add(message, size);
-  if (ticket != 0) _reporting->async([self = shared_from_this(), ticket] { self->takeIncoming(ticket); });
+  IncomingEvents::Ticket ticket = 0;
+  try {
+    ticket = _incoming.add(message, size);
+  } catch (...) {
+    _outbox.release(size);
+    throw;
+  }
+  try {
+    if (ticket != 0) _reporting->async([self = shared_from_this(), ticket] { self->takeIncoming(ticket); });
+  } catch (...) {
+    _incoming.takerIsNotComing(ticket);  // the event is taken all the same: the next one's taker will find it
+  }
   return true;
 }
 

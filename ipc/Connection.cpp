@@ -1,5 +1,7 @@
 #include "ipc/Connection.h"
 
+#include <cerrno>
+
 #include "ipc/ConnectionCore.h"
 #include "ipc/Limits.h"
 #include "platform/LocalSocket.h"
@@ -35,7 +37,11 @@ void Reply::fail(const Error& error) {
 Result<std::shared_ptr<Connection>> Connection::connect(const std::string& path, EventLoop& loop,
                                                         std::shared_ptr<Queue> deliveryQueue) {
   auto socket = connectLocalSocket(path, ipc::kConnectTime);
-  if (!socket) return Failure(connectionError(ConnectionError::notConnected, socket.error().description));
+  if (!socket) {
+    const bool refused = socket.error().code == EACCES || socket.error().code == EPERM;
+    return Failure(connectionError(refused ? ConnectionError::notAllowed : ConnectionError::notConnected,
+                                   socket.error().description));
+  }
   auto peer = credentialsOfPeer(socket->get());
   if (!peer) return Failure(connectionError(ConnectionError::notConnected, path + ": nobody knows who answers there"));
   return adopt(std::move(*socket), std::move(*peer), false, loop, std::move(deliveryQueue));

@@ -49,6 +49,7 @@ enum class ConnectionError : int {
   badReply = 7,      ///< the reply's values have the wrong types
   forked = 8,        ///< this process is a fork of the one that made the connection
   notConnected = 9,  ///< nobody answers at the path
+  notAllowed = 10,   ///< the system does not let this process use the socket at the path
 };
 [[nodiscard]] Error connectionError(ConnectionError code, std::string description);
 
@@ -122,7 +123,7 @@ class Connection {
   enum class End : std::uint8_t { none, here, goodbye, endOfFile, badFrame };
 
   /// Connects to the socket at `path`. Handlers are set on the result before `resume`. Waits at most a second when the
-  /// daemon's queue is full; fails with `notConnected`. `deliveryQueue` may be a queue of `loop`.
+  /// daemon's queue is full; fails with `notConnected` or `notAllowed`. `deliveryQueue` may be a queue of `loop`.
   [[nodiscard]] static Result<std::shared_ptr<Connection>> connect(const std::string& path, EventLoop& loop,
                                                                    std::shared_ptr<Queue> deliveryQueue);
   /// Over a connected, non-blocking stream socket. `accepted`: this is the daemon's end, where a bare end of file ends

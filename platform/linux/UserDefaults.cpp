@@ -121,10 +121,14 @@ class SuiteLock {
     // Failing is usual: the file is there already.
     (void)files::createEmpty(path);
     _file = FileDescriptor(::open(path.c_str(), O_RDWR | O_CLOEXEC | O_NOFOLLOW));
-    if (!_file) return;
+    if (!_file) {
+      _whyNot = errno;
+      return;
+    }
     const BlockingScope blocking;
     while (::flock(_file.get(), LOCK_EX) != 0) {
       if (errno == EINTR) continue;
+      _whyNot = errno;
       _file = FileDescriptor();
       return;
     }
@@ -136,9 +140,11 @@ class SuiteLock {
   SuiteLock(const SuiteLock&) = delete;
   SuiteLock& operator=(const SuiteLock&) = delete;
   [[nodiscard]] bool held() const noexcept { return static_cast<bool>(_file); }
+  [[nodiscard]] std::string whyNot() const { return std::generic_category().message(_whyNot); }
 
  private:
   FileDescriptor _file;
+  int _whyNot = 0;
 };
 
 class FileUserDefaults : public UserDefaults {
@@ -238,7 +244,7 @@ class FileUserDefaults : public UserDefaults {
   Result<void> change(const std::function<bool(PropertyDictionary&)>& edit) {
     if (auto made = files::createDirectories(_stateDirectory, 0700); !made) return made;
     const SuiteLock suite(_lockPath);
-    if (!suite.held()) return failure("UserDefaults", 1, "cannot lock " + _lockPath);
+    if (!suite.held()) return failure("UserDefaults", 1, "cannot lock " + _lockPath + ": " + suite.whyNot());
     const auto version = setAsideLocked(false);
     if (version->usability == Usability::unreadable) {
       return failure("UserDefaults", 2, "cannot read " + _user.path() + ": " + version->problem);

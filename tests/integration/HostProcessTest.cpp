@@ -29,6 +29,20 @@ TEST_F(HostProcessTest, NeedsNoDaemonToStartAndOutlivesIt) {
   EXPECT_EQ(host.end("return"), 0);
 }
 
+TEST_F(HostProcessTest, SaysOnceThatItMayNotUseTheSocket) {
+  if (geteuid() != 0) GTEST_SKIP() << "only root may be somebody else";
+  daemon->start();
+  ASSERT_EQ(chmod(daemon->directory().c_str(), 0755), 0);
+  ASSERT_EQ(chmod(daemon->socketPath().c_str(), 0600), 0);
+  TemporaryDirectory home;
+  ASSERT_EQ(chmod(home.path().c_str(), 0777), 0);
+  HostProcess host(*daemon, {{{"HOME", home.path()}}, kNobody, "default"});
+  EXPECT_EQ(host.call("create 1"), "");
+  EXPECT_EQ(host.call("send 1 1"), "");
+  EXPECT_GE(host.log().countOnceThereAre(3, "Failed to connect to daemon"), 3U) << "it tries again and again";
+  EXPECT_EQ(host.log().count(daemon->socketPath() + ": Permission denied"), 1U);
+}
+
 TEST_F(HostProcessTest, CountsWhatTheOutboxRefusedAndSaysSoOnceADaemonIsThere) {
   constexpr std::size_t kTaken = 16'384;
   HostProcess host(*daemon);

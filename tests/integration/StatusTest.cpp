@@ -80,6 +80,18 @@ TEST_F(Status, OfAnEmptyDaemonIsEmpty) {
   EXPECT_NE(words().find("Sessions: 0\n"), std::string::npos);
 }
 
+TEST_F(Status, IsNoMatterOfAStartForAUserWhoMayNotUseTheSocket) {
+  if (geteuid() != 0) GTEST_SKIP() << "only root may be somebody else";
+  start();
+  ASSERT_EQ(chmod(daemon->directory().c_str(), 0755), 0);
+  ASSERT_EQ(chmod(daemon->socketPath().c_str(), 0600), 0);
+  const auto told = runControl(*daemon, {"status"}, kNobody);
+  EXPECT_EQ(told.status, 77);
+  EXPECT_NE(told.errors.find("this user may not use the daemon's socket (" + daemon->socketPath()), std::string::npos)
+      << told.errors;
+  EXPECT_EQ(told.errors.find("systemctl start"), std::string::npos) << told.errors;
+}
+
 TEST_F(Status, TellsSessionsTransportsAndStorebags) {
   start();
   auto& session = newSession();

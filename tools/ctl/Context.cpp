@@ -29,10 +29,17 @@ void Context::report(const PropertyDictionary& object, const std::string& words)
 
 void Context::fail(ExitCode code, const std::string& sentence) {
   exitCode = code;
+  writeProblem({{"error", sentence}, {"status", tools::status(code)}}, sentence);
+}
+
+void Context::warn(const std::string& sentence) { writeProblem({{"warning", sentence}}, sentence); }
+
+void Context::writeProblem(const PropertyDictionary& object, const std::string& sentence) {
+  Guard guard(_lock);
   if (json) {
-    error << velk::json::line({{"error", sentence}, {"status", tools::status(code)}}) << std::endl;
+    _error << velk::json::line(object) << std::endl;
   } else {
-    error << "velkreportingctl: " << withoutControlCharacters(sentence) << std::endl;
+    _error << "velkreportingctl: " << withoutControlCharacters(sentence) << std::endl;
   }
 }
 

@@ -19,15 +19,21 @@ DaemonLink::DaemonLink(const std::string& socketPath) : _loop("velk.ctl") {
   if (connection) {
     _connection = std::move(*connection);
   } else {
-    _whyNot = connection.error().description;
+    _whyNot = std::move(connection.error());
   }
 }
 
 Result<std::unique_ptr<DaemonLink>> DaemonLink::open(const std::string& socketPath) {
   auto link = std::make_unique<DaemonLink>(socketPath);
   if (link->_connection != nullptr) return link;
+  const auto code = static_cast<ConnectionError>(link->_whyNot.code);
+  if (code == ConnectionError::notAllowed) {
+    return Failure(connectionError(code, "this user may not use the daemon's socket (" + link->_whyNot.description +
+                                             "): it and the directories above it are to be open to everybody who "
+                                             "reports"));
+  }
   return Failure(connectionError(ConnectionError::notConnected,
-                                 "no daemon answers at " + socketPath + " (" + link->_whyNot +
+                                 "no daemon answers at " + socketPath + " (" + link->_whyNot.description +
                                      "). Start velkreportingd, with `systemctl start velkreportingd.socket` where it "
                                      "is installed as a service; a socket elsewhere is named with --socket or "
                                      "VELKREPORTING_SOCKET"));
@@ -126,8 +132,9 @@ void DaemonLink::close() {
 std::string socketPathOr(const std::string& given) { return given.empty() ? daemonSocketPath() : given; }
 
 tools::ExitCode exitCodeForDaemon(const Error& error) {
-  const bool refused =
-      error.domain == kConnectionErrorDomain && error.code == static_cast<int>(ConnectionError::refused);
+  const auto code = static_cast<ConnectionError>(error.code);
+  const bool refused = error.domain == kConnectionErrorDomain &&
+                       (code == ConnectionError::refused || code == ConnectionError::notAllowed);
   return refused ? tools::ExitCode::noPermission : tools::ExitCode::unavailable;
 }
 

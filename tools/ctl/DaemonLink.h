@@ -56,7 +56,7 @@ class DaemonLink final : public SessionWire {
   std::shared_ptr<Connection> _connection;
   EndHandler _endHandler;
   /// Why there is no connection.
-  std::string _whyNot;
+  Error _whyNot;
 
   Lock _lock;
   Condition _changed;

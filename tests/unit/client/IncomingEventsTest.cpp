@@ -59,5 +59,21 @@ TEST_F(ClientOrder, HoldsBetweenEventsAndCallsHoweverDense) {
   }
 }
 
+TEST(IncomingEvents, ATakerThatIsNotComingIsReplacedByTheNextEvents) {
+  IncomingEvents incoming;
+  const auto first = incoming.add({{"n", 1}}, 1);
+  ASSERT_NE(first, 0U);
+  incoming.takerIsNotComing(first);
+  const auto second = incoming.add({{"n", 2}}, 1);
+  ASSERT_NE(second, 0U);
+  EXPECT_EQ(incoming.take(second, false).size(), 2U);
+  const auto third = incoming.add({{"n", 3}}, 1);
+  EXPECT_EQ(incoming.takeForWork().size(), 1U);
+  const auto fourth = incoming.add({{"n", 4}}, 1);
+  ASSERT_NE(fourth, 0U);
+  incoming.takerIsNotComing(third);
+  EXPECT_EQ(incoming.add({{"n", 5}}, 1), 0U) << "the fourth one's taker is still on its way";
+}
+
 }  // namespace
 }  // namespace velk::test

@@ -4,6 +4,7 @@
 
 #include <sstream>
 
+#include "platform/UserDefaults.h"
 #include "tests/support/TemporaryDirectory.h"
 
 namespace velk::ctl {
@@ -102,6 +103,20 @@ TEST_F(CtlProgram, ReadsBackTheSettingThatItWrote) {
   EXPECT_EQ(with({"defaults", "read", "list"}), ExitCode::noInput);
   EXPECT_EQ(with({"defaults", "read", "--json"}), ExitCode::ok);
   EXPECT_EQ(out.str(), "{\"environmentType\":2,\"httpsPostURL\":\"https://localhost/post\"}\n");
+}
+
+TEST_F(CtlProgram, SaysWhatItSetAside) {
+  const std::string suite = std::string(kVelkReportingDefaultsSuite) + ".json";
+  directory.write(suite, "{\"cut");
+  EXPECT_EQ(run({"consent", "show", "--suite-directory", directory.path()}), ExitCode::ok);
+  EXPECT_EQ(out.str(), "Diagnostics and usage data may not be reported.\n");
+  EXPECT_EQ(error.str().rfind("velkreportingctl: UserDefaults: Set aside unusable " + path(suite) + " as ", 0), 0U)
+      << error.str();
+  directory.write(suite, "[1]");
+  EXPECT_EQ(run({"consent", "show", "--suite-directory", directory.path(), "--json"}), ExitCode::ok);
+  EXPECT_EQ(error.str().rfind("{\"warning\":\"UserDefaults: Set aside ", 0), 0U) << error.str();
+  EXPECT_EQ(run({"consent", "show", "--suite-directory", directory.path()}), ExitCode::ok);
+  EXPECT_EQ(error.str(), "") << "told once";
 }
 
 TEST_F(CtlProgram, TurnsConsentOnAndOff) {
