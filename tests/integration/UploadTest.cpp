@@ -1,7 +1,10 @@
 // Files on their way from a client through the daemon to an upload server, and what becomes of them afterwards.
 
+#include <fcntl.h>
 #include <gtest/gtest.h>
+#include <poll.h>
 #include <signal.h>
+#include <sys/fanotify.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
@@ -23,6 +26,25 @@ TlsTestServer::Response answering(std::string text, int status = 200) {
   response.body = std::move(text);
   return response;
 }
+
+/// Holds up whoever reads a file, as a server of files that has gone does.
+class StuckFile {
+ public:
+  explicit StuckFile(const std::string& path)
+      : _events(::fanotify_init(FAN_CLASS_CONTENT | FAN_CLOEXEC, O_RDONLY | O_CLOEXEC)) {
+    _isStuck = _events && ::fanotify_mark(_events.get(), FAN_MARK_ADD, FAN_ACCESS_PERM, AT_FDCWD, path.c_str()) == 0;
+  }
+  /// False where the system does not let us.
+  [[nodiscard]] bool isStuck() const { return _isStuck; }
+  [[nodiscard]] bool waitForReader() const {
+    pollfd waiting{_events.get(), POLLIN, 0};
+    return ::poll(&waiting, 1, static_cast<int>(std::chrono::milliseconds(kPatience).count())) == 1;
+  }
+
+ private:
+  const FileDescriptor _events;
+  bool _isStuck = false;
+};
 
 class Upload : public ::testing::Test {
  protected:
@@ -98,6 +120,21 @@ TEST_F(Upload, WhatIsNoFileOrHoldsNothingStays) {
   EXPECT_EQ(daemon.log().countOnceThereAre(3, "UploadBackend(uploadFileAtPath): Only upload a regular file."), 3U);
   EXPECT_TRUE(server.posts().empty());
   EXPECT_EQ(daemon.stop(), 0);
+}
+
+TEST_F(Upload, AStopDoesNotWaitForAFileThatCannotBeRead) {
+  Daemon daemon(server, daemonOptions);
+  ControlledSession session(daemon);
+  ASSERT_EQ(session.open(9, 1).size(), 3U);
+  const auto path = directory.write("log", "text");
+  const StuckFile stuck(path);
+  if (!stuck.isStuck()) GTEST_SKIP() << "only root may hold readers up";
+  session.send(call(path));
+  ASSERT_TRUE(stuck.waitForReader());
+  EXPECT_EQ(daemon.stop(), 70);
+  EXPECT_EQ(daemon.log().countOnceThereAre(1, "stop: files of clients that are being uploaded cannot be read"), 1U);
+  EXPECT_EQ(daemon.log().countOnceThereAre(1, "stop: uploads left behind: 1;"), 1U);
+  EXPECT_TRUE(std::filesystem::exists(path));
 }
 
 TEST_F(Upload, LargeFilesTakeLittleMemory) {
