@@ -68,7 +68,7 @@ std::size_t VelkReportingImplementation::sendHeldEventsWithin(SteadyTime deadlin
     };
     auto look = std::make_shared<Look>();
     const auto work = [self = shared_from_this(), look] {
-      self->sendEvents(self->_incoming.takeForWork());
+      self->sendEvents(self->_incoming.takeAll());
       self->sendHeldEvents();
       look->events = self->heldEvents();
       look->held = self->_outbox.held.size();
@@ -90,7 +90,7 @@ std::size_t VelkReportingImplementation::sendHeldEventsWithin(SteadyTime deadlin
 void VelkReportingImplementation::finishAndClose(const void* client, SteadyTime deadline) {
   if (std::exchange(_isFinished, true)) return;
   _periodicTasks->end();
-  sendEvents(_incoming.takeForWork());  // what a tick reported that was not over yet when the last reference went
+  sendEvents(_incoming.takeAll());  // what a tick reported that was not over yet when the last reference went
   sendWhatFits();
   const std::size_t lost = heldEvents();
   for (auto& waiting : _outbox.held) {

@@ -38,12 +38,18 @@ class IncomingEvents {
     if (ticket == _ticket) _takerIsExpected = false;
   }
 
-  /// For other work that is about to be queued: everything that was handed over before it.
-  [[nodiscard]] std::vector<Event> takeForWork() {
+  /// For other work: `queue(events)` queues it with everything that was handed over before it. In one step, under the
+  /// lock: an event that comes later finds the work queued and goes behind it.
+  template <class QueueWork>
+  void takeForWork(QueueWork queue) {
     Guard guard(_lock);
-    ++_ticket;
-    _takerIsExpected = false;
-    return std::exchange(_events, {});
+    queue(takeAllLocked());
+  }
+
+  /// For work that has its turn already.
+  [[nodiscard]] std::vector<Event> takeAll() {
+    Guard guard(_lock);
+    return takeAllLocked();
   }
 
   /// For the taker with that ticket. With `lingers` it is expected to come again; else, and when it found nothing,
@@ -56,6 +62,13 @@ class IncomingEvents {
   }
 
  private:
+  [[nodiscard]] std::vector<Event> takeAllLocked() VELK_REQUIRES(_lock) {
+    ++_ticket;
+    _takerIsExpected = false;
+    return std::exchange(_events, {});
+  }
+
+  /// Comes before the locks of queues.
   Lock _lock;
   std::vector<Event> _events VELK_GUARDED_BY(_lock);
   /// Grows whenever other work is queued.

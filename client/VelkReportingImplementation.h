@@ -58,10 +58,11 @@ class VelkReportingImplementation final : public LeavingClient,
   /// Queues work on the reporting queue, behind the events handed over so far; it owns this object until it has run.
   template <class Work>
   void onQueue(Work work) {
-    auto before = _incoming.takeForWork();
-    _reporting->async([self = shared_from_this(), before = std::move(before), work = std::move(work)]() mutable {
-      self->sendEvents(std::move(before));
-      work(*self);
+    _incoming.takeForWork([&](std::vector<IncomingEvents::Event> before) {
+      _reporting->async([self = shared_from_this(), before = std::move(before), work = std::move(work)]() mutable {
+        self->sendEvents(std::move(before));
+        work(*self);
+      });
     });
   }
   /// The same for a call to the daemon: it stays behind the events that were handed over before it.

@@ -2,6 +2,10 @@
 
 #include <gtest/gtest.h>
 
+#include <atomic>
+#include <thread>
+#include <vector>
+
 #include "tests/unit/client/ClientFixture.h"
 
 namespace velk::test {
@@ -31,7 +35,7 @@ TEST(IncomingEvents, LingeringTakerIsExpectedUntilItFindsNothing) {
 TEST(IncomingEvents, WorkTakesAlongWhatCameBeforeIt) {
   IncomingEvents incoming;
   const auto stale = incoming.add(event(1), 1);
-  EXPECT_EQ(incoming.takeForWork().size(), 1U);
+  EXPECT_EQ(incoming.takeAll().size(), 1U);
   const auto fresh = incoming.add(event(2), 1);
   EXPECT_NE(fresh, 0U) << "the taker that was queued before the work must not overtake it";
   EXPECT_TRUE(incoming.take(stale, true).empty());
@@ -68,11 +72,38 @@ TEST(IncomingEvents, ATakerThatIsNotComingIsReplacedByTheNextEvents) {
   ASSERT_NE(second, 0U);
   EXPECT_EQ(incoming.take(second, false).size(), 2U);
   const auto third = incoming.add({{"n", 3}}, 1);
-  EXPECT_EQ(incoming.takeForWork().size(), 1U);
+  EXPECT_EQ(incoming.takeAll().size(), 1U);
   const auto fourth = incoming.add({{"n", 4}}, 1);
   ASSERT_NE(fourth, 0U);
   incoming.takerIsNotComing(third);
   EXPECT_EQ(incoming.add({{"n", 5}}, 1), 0U) << "the fourth one's taker is still on its way";
+}
+
+TEST_F(ClientOrder, HoldsForOneThreadWhileOthersCall) {
+  constexpr int kEvents = 4000;
+  _daemon.start();
+  const auto client = VelkReporting::initWithSessionInfo(
+      PropertyDictionary{{"ComponentType", 9}, {"SessionID", 7}, {"BatchEvents", true}}, std::nullopt, {});
+  std::atomic<bool> isOver{false};
+  std::vector<std::thread> others;
+  for (int number = 0; number < 3; ++number) {
+    others.emplace_back([&] {
+      while (!isOver) client->setMessageSentDelegate({});
+    });
+  }
+  for (int number = 0; number < kEvents; ++number) {
+    while (!client->sendMessageWithDictionary({{"ParametersCategory", 1}, {"ParametersType", number}})) {
+      std::this_thread::yield();
+    }
+  }
+  isOver = true;
+  for (auto& other : others) other.join();
+  ASSERT_TRUE(_daemon.waitForCalls("sendMessageWithDictionary", kEvents));
+  int next = 0;
+  for (const auto& call : _daemon.calls()) {
+    if (call.method != "sendMessageWithDictionary") continue;
+    ASSERT_EQ(integerValue(call.arguments[0].dictionary()->find("ParametersType")), next++);
+  }
 }
 
 }  // namespace
