@@ -1,4 +1,8 @@
-// Events that no daemon could be sent: too large, too many values, too deep. Whoever sends one is told at once.
+// Events that no daemon could be sent: too large, too many values, too deep; and more of them than may wait. Whoever
+// sends one is told at once.
+
+#include <chrono>
+#include <thread>
 
 #include "client/LogTexts.h"
 #include "tests/unit/client/CInterfaceFixture.h"
@@ -61,25 +65,46 @@ class CInterfaceLimitsTest : public CInterfaceTest {
 
   void expectRefusal(VelkReportingClient* client, VelkReportingValue* payload, const std::string& reason) {
     const Value owned(payload);
-    const Value message(messageWith(owned));
+    expectRefusalOfMessage(client, owned, reason);
     VelkReportingError* error = nullptr;
-    const auto checkError = [&] {
-      ASSERT_NE(error, nullptr);
-      EXPECT_EQ(VelkReportingErrorGetCode(error), kVelkReportingErrorNotSendable);
-      EXPECT_STREQ(VelkReportingErrorGetDomain(error), ::kVelkReportingErrorDomain);
-      EXPECT_EQ(VelkReportingErrorGetDescription(error), "the event cannot be sent: " + reason);
-      VelkReportingErrorRelease(error);
-      error = nullptr;
-    };
+    EXPECT_FALSE(sendOne(owned, &error));
+    expectError(error, reason);
+  }
+
+  /// By the functions that put the payload into a message.
+  void expectRefusalOfMessage(VelkReportingClient* client, const VelkReportingValue* payload,
+                              const std::string& reason) {
+    const Value message(messageWith(payload));
     const std::string line = "sendMessageWithDictionary: Event 9 cannot be sent: " + reason;
     const int before = _log.count(log::Level::error, line);
+    VelkReportingError* error = nullptr;
     EXPECT_FALSE(VelkReportingSendMessageWithDictionary(client, message, &error));
-    checkError();
-    EXPECT_TRUE(VelkReportingSendMessageWithError(client, 9, 1, owned, &error)) << "as when it is filtered";
-    checkError();
+    expectError(error, reason);
+    EXPECT_TRUE(VelkReportingSendMessageWithError(client, 9, 1, payload, &error)) << "as when it is filtered";
+    expectError(error, reason);
     EXPECT_EQ(_log.count(log::Level::error, line), before + 2);
-    EXPECT_FALSE(VelkReportingSendOneMessage(_session, _user, 9, 1, owned, &error));
-    checkError();
+  }
+
+  [[nodiscard]] bool sendOne(const VelkReportingValue* payload, VelkReportingError** error) {
+    return VelkReportingSendOneMessage(_session, _user, 9, 1, payload, error);
+  }
+  /// The end of earlier ones may still be on its way. False when none comes.
+  [[nodiscard]] bool sendOneWhenThereIsRoom() {
+    const auto deadline = std::chrono::steady_clock::now() + kPatience;
+    while (!sendOne(nullptr, nullptr)) {
+      if (std::chrono::steady_clock::now() > deadline) return false;
+      std::this_thread::yield();
+    }
+    return true;
+  }
+
+ private:
+  static void expectError(VelkReportingError* error, const std::string& reason) {
+    ASSERT_NE(error, nullptr);
+    EXPECT_EQ(VelkReportingErrorGetCode(error), kVelkReportingErrorNotSendable);
+    EXPECT_STREQ(VelkReportingErrorGetDomain(error), ::kVelkReportingErrorDomain);
+    EXPECT_EQ(VelkReportingErrorGetDescription(error), "the event cannot be sent: " + reason);
+    VelkReportingErrorRelease(error);
   }
 };
 
@@ -87,6 +112,10 @@ TEST_F(CInterfaceLimitsTest, EventsNestThirtyOneDeep) {
   _daemon.start();
   const Client client(create());
   expectTaken(client, nested(30));  // the message itself is the first
+  const Value thirtyOne(nested(31));
+  expectRefusalOfMessage(client, thirtyOne, "values nested too deep");
+  EXPECT_TRUE(sendOne(thirtyOne, nullptr)) << "no message stands around it";
+  EXPECT_TRUE(_daemon.waitForCalls("sendMessageWithSessionInfo", 1));
   expectRefusal(client, nested(32), "values nested too deep");
   expectRefusal(client, nested(63), "values nested too deep");
 }
@@ -105,6 +134,23 @@ TEST_F(CInterfaceLimitsTest, EventsHoldSoManyValues) {
   expectRefusal(client, keys(4097), "too many values");
   expectTaken(client, elements(65'000));
   expectRefusal(client, elements(65'536), "too many values");
+}
+
+TEST_F(CInterfaceLimitsTest, SoManySingleMessagesMayWait) {
+  constexpr std::size_t kMost = 256;
+  _daemon.start();
+  _daemon.holdCalls(true);
+  for (std::size_t taken = 0; taken < kMost; ++taken) ASSERT_TRUE(sendOneWhenThereIsRoom()) << taken;
+  VelkReportingError* error = nullptr;
+  EXPECT_FALSE(sendOne(nullptr, &error));
+  ASSERT_NE(error, nullptr);
+  EXPECT_EQ(VelkReportingErrorGetCode(error), kVelkReportingErrorOutboxFull);
+  EXPECT_STREQ(VelkReportingErrorGetDomain(error), ::kVelkReportingErrorDomain);
+  EXPECT_STREQ(VelkReportingErrorGetDescription(error), "too many single messages are under way");
+  VelkReportingErrorRelease(error);
+  _daemon.holdCalls(false);
+  EXPECT_TRUE(_daemon.waitForCalls("sendMessageWithSessionInfo", kMost)) << "what is taken arrives";
+  EXPECT_TRUE(sendOneWhenThereIsRoom()) << "each gives its place back";
 }
 
 TEST_F(CInterfaceLimitsTest, WhatIsRefusedTakesNoRoomInTheOutbox) {

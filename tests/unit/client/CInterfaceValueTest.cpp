@@ -7,7 +7,6 @@
 #include <string>
 
 #include "client/VelkReportingC.h"
-#include "ipc/Vocabulary.h"
 
 namespace velk::test {
 namespace {
@@ -20,9 +19,40 @@ std::string jsonOf(const VelkReportingValue* value) {
 }
 
 TEST(CInterfaceValue, KeysAreThoseOfTheWire) {
-  EXPECT_EQ(::kVelkReportingSessionInfoClientType, velk::kVelkReportingSessionInfoClientType);
-  EXPECT_STREQ(::kVelkReportingMessageParametersCategory, "ParametersCategory");
-  EXPECT_STREQ(::kVelkReportingErrorDomain, "VelkReportingErrorDomain");
+  const struct {
+    const char* constant;
+    const char* text;
+  } constants[] = {
+      {::kVelkReportingSessionInfoClientType, "ComponentType"},
+      {::kVelkReportingSessionInfoClientVersion, "ClientVersion"},
+      {::kVelkReportingSessionInfoSessionID, "SessionID"},
+      {::kVelkReportingSessionInfoBatchEvent, "BatchEvents"},
+      {::kVelkReportingSessionInfoRequireUserInfo, "RequireUserDict"},
+      {::kVelkReportingSessionInfoHierarchyToken, "HierarchyToken"},
+      {::kVelkReportingSessionInfoEnableFlag, "EnableFlag"},
+      {::kVelkReportingUserInfoClientName, "_clientName"},
+      {::kVelkReportingUserInfoServiceName, "_serviceName"},
+      {::kVelkReportingMessageParametersCategory, "ParametersCategory"},
+      {::kVelkReportingMessageParametersType, "ParametersType"},
+      {::kVelkReportingMessageParametersPayload, "ParametersPayload"},
+      {::kVelkReportingMessageParametersFlag, "ParametersFlag"},
+      {::kVelkReportingHierarchyTokenTokenID, "token"},
+      {::kVelkReportingHierarchyTokenLevel, "level"},
+      {::kVelkReportingLogDataData, "LogData"},
+      {::kVelkReportingLogDataStartTime, "StartTime"},
+      {::kVelkReportingLogDataEndTime, "EndTime"},
+      {::kVelkReportingBackendDashboard, "dashboard"},
+      {::kVelkReportingBackendUploadServer, "upload_server"},
+      {::kVelkReportingBackendHTTPPost, "splunk"},
+      {::kVelkReportingBackendHTTPPost2, "korrin"},
+      {::kVelkReportingBackendPowerlog, "power"},
+      {::kVelkReportingBackendQRS, "qrs"},
+      {::kVelkReportingBackendQuill, "quill"},
+      {::kVelkReportingMessageBlobClientData, "ClientData"},
+      {::kVelkReportingMessageBlobSharedData, "SharedData"},
+      {::kVelkReportingErrorDomain, "VelkReportingErrorDomain"},
+  };
+  for (const auto& each : constants) EXPECT_STREQ(each.constant, each.text);
 }
 
 TEST(CInterfaceValue, DictionaryIsBuiltReadAndChanged) {
@@ -100,6 +130,17 @@ TEST(CInterfaceValue, ReadingsAreLenientWhereTheySaySo) {
   VelkReportingValue* negative = VelkReportingValueCreateInteger(-1);
   EXPECT_EQ(VelkReportingValueGetUnsignedInteger(negative), 0U);
   VelkReportingValueRelease(negative);
+}
+
+TEST(CInterfaceValue, TextIsTrueByHowItBegins) {
+  const auto isTrue = [](const char* text) {
+    VelkReportingValue* value = VelkReportingValueCreateString(text);
+    const bool read = VelkReportingValueGetBoolean(value);
+    VelkReportingValueRelease(value);
+    return read;
+  };
+  for (const char* text : {"Y", "yes", "True", "t", "1", " \t+007", "-2", "0yes"}) EXPECT_TRUE(isTrue(text)) << text;
+  for (const char* text : {"", "0", "0.5", "no", "on", "++1", "- 1"}) EXPECT_FALSE(isTrue(text)) << text;
 }
 
 TEST(CInterfaceValue, NumbersBeyondABoundStayAtIt) {
