@@ -35,13 +35,20 @@ int main(int argumentCount, char** arguments) {
   VelkReportingClient* client = VelkReportingClientCreate(session, user, NULL);
   VelkReportingValueRelease(user);
   VelkReportingValueRelease(session);
-  if (client == NULL) return EXIT_FAILURE;
+  if (client == NULL) {
+    fprintf(stderr, "periodic_modules: the session info was refused\n");
+    return EXIT_FAILURE;
+  }
   VelkReportingClientStartConfiguration(client, NULL, NULL, NULL);
 
   static struct Module reader = {.name = "reader"};
   static struct Module writer = {.name = "writer"};
-  VelkReportingClientRegisterPeriodicTask(client, 1, true, true, serve, &reader, NULL);
-  VelkReportingClientRegisterPeriodicTask(client, 2, true, true, serve, &writer, NULL);
+  if (!VelkReportingClientRegisterPeriodicTask(client, 1, true, true, serve, &reader, NULL) ||
+      !VelkReportingClientRegisterPeriodicTask(client, 2, true, true, serve, &writer, NULL)) {
+    fprintf(stderr, "periodic_modules: a module was refused\n");
+    VelkReportingClientRelease(client);
+    return EXIT_FAILURE;
+  }
   VelkReportingClientStartLogTimer(client, 1, 2, 102, 1);
   const int wanted = argumentCount > 2 ? atoi(arguments[2]) : 1;
   while (reader.reports < wanted || writer.reports < wanted) thrd_sleep(&(struct timespec){.tv_nsec = 20000000}, NULL);

@@ -47,7 +47,10 @@ int main(int argumentCount, char** arguments) {
       PropertyDictionary{
           {"ComponentType", argumentCount > 1 ? std::atoi(arguments[1]) : 9}, {"ClientVersion", 1}, {"SessionID", 4}},
       PropertyDictionary{{"_clientName", "Example"}, {"_serviceName", "modules"}}, {});
-  if (!client) return EXIT_FAILURE;
+  if (!client) {
+    std::fprintf(stderr, "periodic_modules: the session info was refused\n");
+    return EXIT_FAILURE;
+  }
   client->startConfigurationWithCompletionHandler(nullptr);
 
   const auto reports = std::make_shared<std::latch>(2 * wanted);
@@ -55,8 +58,11 @@ int main(int argumentCount, char** arguments) {
   for (const char* name : {"reader", "writer"}) {
     const auto module = std::make_shared<Module>(name, reports);
     module->expectReports(wanted);
-    client->registerPeriodicTaskForModule(++number, true, true,
-                                          [module](PropertyDictionary* statistics) { module->serve(statistics); });
+    const auto serve = [module](PropertyDictionary* statistics) { module->serve(statistics); };
+    if (!client->registerPeriodicTaskForModule(++number, true, true, serve)) {
+      std::fprintf(stderr, "periodic_modules: module %s was refused\n", name);
+      return EXIT_FAILURE;
+    }
   }
   client->startLogTimerWithInterval(1, 2, 103, 1);
   reports->wait();

@@ -37,7 +37,10 @@ int main(int argumentCount, char** arguments) {
 
   const auto flushed = std::make_shared<std::promise<bool>>();
   auto posted = flushed->get_future();
-  client->flushMessagesWithCompletion([flushed](const auto& reason) { flushed->set_value(!reason); });
+  client->flushMessagesWithCompletion([flushed](const auto& reason) {
+    if (reason) std::fprintf(stderr, "report_event: %s\n", reason->description.c_str());
+    flushed->set_value(!reason);
+  });
   succeeded = posted.wait_for(std::chrono::seconds(30)) == std::future_status::ready && posted.get() && succeeded;
   return succeeded && error.code == 0 ? EXIT_SUCCESS : EXIT_FAILURE;
 }

@@ -16,6 +16,9 @@
 extern char** environ;
 
 static sem_t configured, aggregated;
+static bool isConfigured; /* written before `configured` is posted */
+
+static void complain(const char* text) { fprintf(stderr, "shared_hierarchy: %s\n", text); }
 
 static bool wait_for(sem_t* semaphore) {
   struct timespec until;
@@ -25,7 +28,7 @@ static bool wait_for(sem_t* semaphore) {
 }
 
 static void heard_states(const VelkReportingValue* enabledBackends, void* context) {
-  (void)enabledBackends;
+  isConfigured = enabledBackends != NULL;
   sem_post(context);
 }
 
@@ -40,6 +43,7 @@ static void heard_event(const VelkReportingValue* from, double timestamp, uint16
   sem_post(context);
 }
 
+/* A session that the daemon has configured, or NULL. */
 static VelkReportingClient* open_session(const char* type, int number, const VelkReportingValue* token,
                                          VelkReportingAggregationCallback callback) {
   VelkReportingValue* session = VelkReportingDictionaryCreate();
@@ -51,24 +55,54 @@ static VelkReportingClient* open_session(const char* type, int number, const Vel
       VelkReportingClientCreateWithAggregation(session, user, NULL, callback, &aggregated, NULL);
   VelkReportingValueRelease(user);
   VelkReportingValueRelease(session);
+  if (client == NULL) {
+    complain("the session info was refused");
+    return NULL;
+  }
   VelkReportingClientStartConfiguration(client, heard_states, &configured, NULL);
-  return client;
+  if (wait_for(&configured) && isConfigured) return client;
+  complain("the session is not configured; is velkreportingd running?");
+  VelkReportingClientRelease(client);
+  return NULL;
+}
+
+static int failed(VelkReportingError* error) {
+  complain(error != NULL ? VelkReportingErrorGetDescription(error) : "memory is short");
+  VelkReportingErrorRelease(error);
+  return EXIT_FAILURE;
 }
 
 /* The child: its token stands one level below the one that it was given. */
 static int run_child(const char* type, const char* parentToken) {
-  VelkReportingValue* parent = VelkReportingDictionaryCreateFromJSON(parentToken, NULL);
+  VelkReportingError* error = NULL;
+  VelkReportingValue* parent = VelkReportingDictionaryCreateFromJSON(parentToken, &error);
+  if (parent == NULL) return failed(error); /* a token of no parent would be a new root */
   VelkReportingValue* token = VelkReportingNewHierarchyTokenFromParentToken(parent);
   VelkReportingValueRelease(parent);
   VelkReportingClient* client = open_session(type, 6, token, NULL);
   VelkReportingValueRelease(token);
-  if (client == NULL || !wait_for(&configured)) return EXIT_FAILURE;
+  if (client == NULL) return EXIT_FAILURE;
   VelkReportingValue* payload = VelkReportingDictionaryCreate();
   VelkReportingDictionarySetString(payload, "from", "the child");
-  VelkReportingSendMessageWithError(client, 104, 1, payload, NULL);
+  const bool sent = VelkReportingSendMessageWithError(client, 104, 1, payload, &error);
   VelkReportingValueRelease(payload);
   VelkReportingClientRelease(client); /* sends what is queued */
-  return EXIT_SUCCESS;
+  return sent && error == NULL ? EXIT_SUCCESS : failed(error);
+}
+
+/* A new program: a process that was merely forked cannot report through what its parent made. */
+static bool spawn_child(const char* program, const char* type, char* tokenText) {
+  pid_t child = 0;
+  int status = 0;
+  char* const arguments[] = {(char*)program, (char*)type, tokenText, NULL};
+  if (tokenText == NULL || posix_spawn(&child, program, NULL, NULL, arguments, environ) != 0 ||
+      waitpid(child, &status, 0) != child || status != 0) {
+    complain("the child failed");
+    return false;
+  }
+  if (wait_for(&aggregated)) return true;
+  complain("the child's event did not come");
+  return false;
 }
 
 static int run_parent(const char* program, const char* type) {
@@ -76,14 +110,7 @@ static int run_parent(const char* program, const char* type) {
   char* tokenText = VelkReportingValueCopyJSON(token, NULL);
   VelkReportingClient* client = open_session(type, 5, token, heard_event);
   VelkReportingValueRelease(token);
-  bool succeeded = client != NULL && wait_for(&configured);
-
-  /* A new program: a process that was merely forked cannot report through what its parent made. */
-  pid_t child = 0;
-  char* const arguments[] = {(char*)program, (char*)type, tokenText, NULL};
-  succeeded = succeeded && posix_spawn(&child, program, NULL, NULL, arguments, environ) == 0;
-  int status = 0;
-  succeeded = succeeded && waitpid(child, &status, 0) == child && status == 0 && wait_for(&aggregated);
+  const bool succeeded = client != NULL && spawn_child(program, type, tokenText);
   VelkReportingTextFree(tokenText);
   VelkReportingClientRelease(client);
   return succeeded ? EXIT_SUCCESS : EXIT_FAILURE;

@@ -12,6 +12,7 @@
 #include <chrono>
 #include <cstdio>
 #include <cstdlib>
+#include <future>
 #include <memory>
 #include <semaphore>
 #include <string>
@@ -23,15 +24,25 @@ namespace {
 
 constexpr auto kPatience = std::chrono::seconds(30);
 
+void complain(const char* text) { std::fprintf(stderr, "shared_hierarchy: %s\n", text); }
+
+/// A session that the daemon has configured, or none.
 std::shared_ptr<VelkReporting> openSession(int type, int number, const PropertyDictionary& token,
                                            velk::VelkReportingAggregationBlock block) {
   auto client = VelkReporting::initWithSessionInfo(
       PropertyDictionary{{"ComponentType", type}, {"SessionID", number}, {"HierarchyToken", token}},
       PropertyDictionary{{"_clientName", "Example"}}, {}, std::move(block));
-  if (!client) return nullptr;
-  const auto configured = std::make_shared<std::binary_semaphore>(0);
-  client->startConfigurationWithCompletionHandler([configured](const auto&) { configured->release(); });
-  return configured->try_acquire_for(kPatience) ? client : nullptr;
+  if (!client) {
+    complain("the session info was refused");
+    return nullptr;
+  }
+  const auto configured = std::make_shared<std::promise<bool>>();
+  auto answer = configured->get_future();
+  client->startConfigurationWithCompletionHandler(
+      [configured](const auto& backends) { configured->set_value(backends.has_value()); });
+  if (answer.wait_for(kPatience) == std::future_status::ready && answer.get()) return client;
+  complain("the session is not configured; is velkreportingd running?");
+  return nullptr;
 }
 
 /// Its token stands one level below the one that it was given.
@@ -40,8 +51,10 @@ int runChild(int type, const char* parentToken) {
       VelkReporting::newHierarchyTokenFromParentToken(PropertyDictionary{{"token", parentToken}, {"level", 0}});
   const auto client = openSession(type, 8, *token, nullptr);
   if (!client) return EXIT_FAILURE;
-  client->sendMessageWithCategory(105, 1, PropertyDictionary{{"from", "the child"}});
-  return EXIT_SUCCESS;  // the last reference sends what is queued
+  velk::Error error;
+  client->sendMessageWithCategory(105, 1, PropertyDictionary{{"from", "the child"}}, &error);
+  if (error.code != 0) complain(error.description.c_str());
+  return error.code == 0 ? EXIT_SUCCESS : EXIT_FAILURE;  // the last reference sends what is queued
 }
 
 int runParent(int type) {
@@ -66,9 +79,14 @@ int runParent(int type) {
   char* arguments[] = {program.data(), typeText.data(), tokenText.data(), nullptr};
   pid_t child = 0;
   int status = 0;
-  const bool succeeded = posix_spawn(&child, program.c_str(), nullptr, nullptr, arguments, environ) == 0 &&
-                         waitpid(child, &status, 0) == child && status == 0;
-  return succeeded && aggregated->try_acquire_for(kPatience) ? EXIT_SUCCESS : EXIT_FAILURE;
+  if (posix_spawn(&child, program.c_str(), nullptr, nullptr, arguments, environ) != 0 ||
+      waitpid(child, &status, 0) != child || status != 0) {
+    complain("the child failed");
+    return EXIT_FAILURE;
+  }
+  if (aggregated->try_acquire_for(kPatience)) return EXIT_SUCCESS;
+  complain("the child's event did not come");
+  return EXIT_FAILURE;
 }
 
 }  // namespace
