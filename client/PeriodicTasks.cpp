@@ -150,6 +150,11 @@ bool PeriodicTasks::isInCallback() const noexcept { return CurrentQueueScope::co
 
 void PeriodicTasks::withdrawAll(bool mayWait) {
   _isEnding = true;
+  // Past the tick that may hold the reporting queue for ever. The timer is only cancelled: a stop that waits for that
+  // tick still finds it.
+  _queue->beneath()->async([self = shared_from_this()] {
+    if (self->_timer) self->_timer->cancel();
+  });
   auto modules = _modules.takeAll();
   if (!mayWait) dispose(std::move(modules));
 }

@@ -48,6 +48,7 @@ class PeriodicTasks : public std::enable_shared_from_this<PeriodicTasks> {
   /// True in a callback of one of the modules, on its thread, and while what it owned ends there.
   [[nodiscard]] bool isInCallback() const noexcept;
   /// The client is going: no tick begins any more, and no callback is called any more, but for calls that have begun.
+  /// The timer stops at once, also while a tick lasts that never ends.
   /// What callbacks own ends here if the caller may wait, else where callbacks run.
   void withdrawAll(bool mayWait);
 
