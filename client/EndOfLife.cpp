@@ -97,10 +97,10 @@ void VelkReportingImplementation::finishAndClose(const void* client, SteadyTime 
     if (waiting.call) waiting.call();  // its callback learns that it failed
   }
   _outbox.held.clear();
-  if (lost != 0) log::error("aboutToDealloc: %u events are lost: no daemon takes them", lost);
+  if (lost != 0) log::error(texts::kEventsAreLost, lost);
   reportOverflow();
   log::standard(texts::kAboutToDealloc, client);
-  finishSession();
+  if (!finishSessionNow()) log::standard(texts::kFinishSessionProxyFailure, "no daemon answers");
   _aggregation->releaseAggregationBlock();
   _loggingBlock = nullptr;
   _link->close(deadline - _runtime.loop().clock().steadyTime());

@@ -11,6 +11,7 @@ inline constexpr std::string_view kClientTypeIsInvalid = "validateSessionInfo: c
 inline constexpr std::string_view kClientStartsLogging = "startLogging: Client starts logging...";
 inline constexpr std::string_view kSessionDisabled = "initWithSessionInfo: the session is disabled";
 inline constexpr std::string_view kNotEntitled = "initWithSessionInfo: IPC not entitled, %d";
+inline constexpr std::string_view kEventsAreLost = "aboutToDealloc: %u events are lost: no daemon takes them";
 inline constexpr std::string_view kFailedToConnect = "initWithSessionInfo: Failed to connect to daemon";
 inline constexpr std::string_view kFailedToCreateQueue = "initWithSessionInfo: Failed to create reporting queue";
 inline constexpr std::string_view kNoThread =

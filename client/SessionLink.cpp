@@ -7,6 +7,7 @@
 #include "client/DaemonConnection.h"
 #include "client/EventLists.h"
 #include "client/LogTexts.h"
+#include "ipc/MethodTable.h"
 #include "ipc/Vocabulary.h"
 #include "platform/Log.h"
 
@@ -23,6 +24,22 @@ constexpr Duration kLongestQuietPause = std::chrono::minutes(5);
 constexpr Duration kFairLife = std::chrono::seconds(1);
 /// What a service manager, or somebody who installs another version, may take to bring a daemon back.
 constexpr Duration kRestartTime = std::chrono::seconds(30);
+
+SessionLink::UnsentEvents unsentEvents(Connection& connection) {
+  SessionLink::UnsentEvents events;
+  for (auto& arguments : connection.takeUnsentCalls(static_cast<std::uint32_t>(Method::sendMessageWithDictionary))) {
+    if (auto* const message = arguments.empty() ? nullptr : arguments.mutableAt(0).dictionary()) {
+      events.push_back(std::move(*message));
+    }
+  }
+  return events;
+}
+
+/// For a connection that nothing comes after.
+void reportLoss(Connection& connection) {
+  const std::size_t lost = unsentEvents(connection).size();
+  if (lost != 0) log::error(texts::kEventsAreLost, lost);
+}
 
 }  // namespace
 
@@ -41,9 +58,11 @@ SessionLink::SessionLink(ClientRuntime& runtime, std::shared_ptr<Queue> queue, S
       _lists(std::move(lists)),
       _description(std::move(description)) {}
 
-void SessionLink::open(std::function<void()> whenInterrupted) {
-  _whenInterrupted = std::move(whenInterrupted);
-  if (!tryToConnect() && _description.hasAggregationBlock) reconnectLater();
+void SessionLink::open(std::function<void(UnsentEvents)> whenLost) {
+  _whenLost = std::move(whenLost);
+  _queue->async([self = shared_from_this()] {
+    if (!self->_isClosed && !self->tryToConnect() && self->_description.hasAggregationBlock) self->reconnectLater();
+  });
 }
 
 std::shared_ptr<Connection> SessionLink::connect() {
@@ -118,13 +137,14 @@ std::shared_ptr<Connection> SessionLink::makeConnection() {
   _reportedProblem.clear();
   const std::shared_ptr<Connection> connection = std::move(*made);
   connection->setExportedDispatcher(std::make_shared<ReplyInterfaceDispatcher>(_exported));
-  connection->setInvalidationHandler([self = weak_from_this(), invalidated = std::weak_ptr(connection)] {
+  connection->keepUnsent();
+  connection->setInvalidationHandler([self = weak_from_this(), weak = std::weak_ptr(connection)] {
     log::standard(texts::kConnectionInvalidated);
-    if (const auto link = self.lock()) link->wasInvalidated(invalidated);
+    tell(self.lock(), weak.lock(), &SessionLink::wasInvalidated);
   });
-  connection->setInterruptionHandler([self = weak_from_this(), interrupted = std::weak_ptr(connection)] {
+  connection->setInterruptionHandler([self = weak_from_this(), weak = std::weak_ptr(connection)] {
     log::standard(texts::kConnectionInterrupted);
-    if (const auto link = self.lock()) link->wasInterrupted(interrupted);
+    tell(self.lock(), weak.lock(), &SessionLink::wasInterrupted);
   });
   return connection;
 }
@@ -154,23 +174,28 @@ void SessionLink::describeSession(const std::shared_ptr<Connection>& connection)
   if (_description.digestKey) proxy.setDigestKey(*_description.digestKey, _description.digestAlgorithm);
 }
 
-void SessionLink::wasInterrupted(const std::weak_ptr<Connection>& connection) {
-  const auto interrupted = connection.lock();
-  if (!interrupted) return;
-  interrupted->invalidate();  // drops its handlers
-  if (current() == interrupted) forgetConnection();
-  _whenInterrupted();
-  reconnectLater();
+void SessionLink::tell(const std::shared_ptr<SessionLink>& link, const std::shared_ptr<Connection>& connection,
+                       void (SessionLink::*ended)(Connection&)) {
+  if (!connection) return;
+  if (link) return (*link.*ended)(*connection);
+  reportLoss(*connection);  // its client has gone before it
 }
 
-// Ends that were asked for here, and interruptions, need nothing more.
-void SessionLink::wasInvalidated(const std::weak_ptr<Connection>& connection) {
-  const auto invalidated = connection.lock();
-  if (!invalidated) return;
-  const auto end = invalidated->end();
-  if (end != Connection::End::goodbye && end != Connection::End::badFrame) return;
-  if (current() == invalidated) forgetConnection();
-  _whenInterrupted();
+void SessionLink::wasInterrupted(Connection& connection) {
+  connection.invalidate();  // drops its handlers
+  wasLost(connection);
+}
+
+// An interruption was dealt with already.
+void SessionLink::wasInvalidated(Connection& connection) {
+  if (connection.end() == Connection::End::here) return reportLoss(connection);
+  if (connection.end() != Connection::End::endOfFile) wasLost(connection);
+}
+
+void SessionLink::wasLost(Connection& connection) {
+  auto unsent = unsentEvents(connection);
+  if (current().get() == &connection) forgetConnection();
+  _whenLost(std::move(unsent));
   reconnectLater();
 }
 

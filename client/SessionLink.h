@@ -11,6 +11,7 @@
 #include <memory>
 #include <optional>
 #include <string>
+#include <vector>
 
 #include "foundation/PropertyValue.h"
 #include "ipc/Connection.h"
@@ -44,9 +45,12 @@ class SessionLink : public std::enable_shared_from_this<SessionLink> {
   SessionLink(ClientRuntime& runtime, std::shared_ptr<Queue> queue, SessionDescription description,
               std::shared_ptr<ClientSessionReplyInterface> exported, std::shared_ptr<CurrentEventLists> lists);
 
-  /// The first connection, made on the creator's thread before anything is on the queue. Fine when nobody answers.
-  /// `whenInterrupted` runs on the queue, each time that a connection was lost.
-  void open(std::function<void()> whenInterrupted);
+  using UnsentEvents = std::vector<PropertyDictionary>;
+
+  /// Queues the first attempt to connect: whoever creates a client does not wait for a daemon whose own queue is full.
+  /// Any thread, before anything else is on the queue. Fine when nobody answers. `whenLost` runs on the queue, each
+  /// time that a connection was lost, with the events that had not left it, oldest first.
+  void open(std::function<void(UnsentEvents)> whenLost);
 
   /// A connection that works, made now if need be; null when nobody answers. After an attempt that failed, or a
   /// connection that ended within a second, the next one is made at the earliest after a pause that grows from 100 ms
@@ -77,8 +81,11 @@ class SessionLink : public std::enable_shared_from_this<SessionLink> {
   [[nodiscard]] std::shared_ptr<Connection> makeConnection();
   void reportNoConnection(const Error& error);
   void describeSession(const std::shared_ptr<Connection>& connection);
-  void wasInterrupted(const std::weak_ptr<Connection>& connection);
-  void wasInvalidated(const std::weak_ptr<Connection>& connection);
+  static void tell(const std::shared_ptr<SessionLink>& link, const std::shared_ptr<Connection>& connection,
+                   void (SessionLink::*ended)(Connection&));
+  void wasInterrupted(Connection& connection);
+  void wasInvalidated(Connection& connection);
+  void wasLost(Connection& connection);
   void forgetConnection();
   void growPause();
   void reconnectLater();
@@ -95,7 +102,7 @@ class SessionLink : public std::enable_shared_from_this<SessionLink> {
 
   // On the reporting queue (and in `open`, before it has work).
   SessionDescription _description;
-  std::function<void()> _whenInterrupted;
+  std::function<void(UnsentEvents)> _whenLost;
   bool _isClosed = false;
   SteadyTime _connectedAt{};
   SteadyTime _nextAttempt{};

@@ -43,8 +43,8 @@ void VelkReportingImplementation::open(std::weak_ptr<VelkReporting> client) {
         const std::uint16_t category = uint16Value(message.find(kVelkReportingMessageParametersCategory));
         if (self && category != 0) self->sendMessage(category, message);
       });
-  _link->open([self = weak_from_this()] {
-    if (const auto strong = self.lock()) strong->wasInterrupted();
+  _link->open([self = weak_from_this()](SessionLink::UnsentEvents unsent) {
+    if (const auto strong = self.lock()) strong->connectionWasLost(std::move(unsent));
   });
   _runtime.addClient(weak_from_this());
 }
@@ -135,6 +135,8 @@ void VelkReportingImplementation::sendWhatFits() {
   while (!held.empty()) {
     auto& first = held.front();
     if (first.call) {
+      const auto connection = _link->connect();
+      if (connection && !connection->hasRoomForAnyCall()) return;
       first.call();
     } else if (trySending(first.message)) {
       _outbox.release(first.size);
@@ -146,11 +148,14 @@ void VelkReportingImplementation::sendWhatFits() {
 }
 
 void VelkReportingImplementation::runBehindHeldEvents(Task call) {
-  if (!_outbox.held.empty()) sendHeldEvents();
+  auto& held = _outbox.held;
+  if (!held.empty()) sendHeldEvents();
   // With nobody there it fails at once, as it would without events; and what waits is bounded.
-  const auto& held = _outbox.held;
-  if (held.empty() || held.size() >= EventOutbox::kMaximumEvents || !_link->connect()) return call();
-  _outbox.held.push_back({{}, 0, std::move(call)});
+  const auto connection = _link->connect();
+  if (!connection || held.size() >= EventOutbox::kMaximumEvents) return call();
+  if (held.empty() && connection->hasRoomForAnyCall()) return call();
+  held.push_back({{}, 0, std::move(call)});
+  retryLater(kFullConnectionPause);
 }
 
 void VelkReportingImplementation::sendHeldEvents() {
@@ -175,16 +180,32 @@ void VelkReportingImplementation::reportOverflow() {
     log::error("sendMessageWithDictionary: %u events were refused while the daemon was away or slow", lost);
 }
 
-void VelkReportingImplementation::wasInterrupted() {
+/// What had not left goes to the front again, the oldest first.
+void VelkReportingImplementation::connectionWasLost(SessionLink::UnsentEvents unsent) {
+  if (_isFinished) {
+    if (!unsent.empty()) log::error(texts::kEventsAreLost, unsent.size());
+    return;
+  }
+  for (auto event = unsent.rbegin(); event != unsent.rend(); ++event) {
+    const std::size_t size = estimatedSize(*event);
+    if (_outbox.reserve(size)) _outbox.held.push_front({std::move(*event), size, nullptr});
+  }
   if (!_outbox.held.empty()) retryLater(kFullConnectionPause);
 }
 
 void VelkReportingImplementation::finishSession() {
-  if (const auto connection = _link->current()) {
-    SessionInterfaceProxy(connection, loggingHandler(texts::kFinishSessionProxyFailure)).finishSessionGracefully();
-  } else {
-    log::standard(texts::kFinishSessionProxyFailure, "no daemon answers");
-  }
+  if (finishSessionNow()) return;
+  // The first connection may be about to be made.
+  _queue->async([self = shared_from_this()] {
+    if (!self->finishSessionNow()) log::standard(texts::kFinishSessionProxyFailure, "no daemon answers");
+  });
+}
+
+bool VelkReportingImplementation::finishSessionNow() {
+  const auto connection = _link->current();
+  if (!connection) return false;
+  SessionInterfaceProxy(connection, loggingHandler(texts::kFinishSessionProxyFailure)).finishSessionGracefully();
+  return true;
 }
 
 void VelkReportingImplementation::setMessageSentDelegate(std::weak_ptr<VelkReportingMessageSentDelegate> delegate,

@@ -127,9 +127,11 @@ class VelkReportingImplementation final : public LeavingClient,
   void retryLater(Duration delay);
   void retryAtOnce();
   void reportOverflow();
-  void wasInterrupted();
+  void connectionWasLost(SessionLink::UnsentEvents unsent);
   void leave(const void* client, SteadyTime deadline);
   void finishAndClose(const void* client, SteadyTime deadline);
+  /// False when there is no connection.
+  [[nodiscard]] bool finishSessionNow();
   [[nodiscard]] std::size_t heldEvents() const;
   void fetchDisplayURL(const std::shared_ptr<Connection>& connection);
   void logText(const std::string& text);

@@ -79,6 +79,12 @@ Result<void> Connection::callMethod(std::uint32_t method, const PropertyArray& a
 
 bool Connection::waitUntilSent(Duration timeout) { return _core->waitUntilSent(timeout); }
 
+void Connection::keepUnsent() { _core->keepsUnsent = true; }
+
+bool Connection::hasRoomForAnyCall() const noexcept { return _core->hasRoomForAnyCall(); }
+
+std::vector<PropertyArray> Connection::takeUnsentCalls(std::uint32_t method) { return _core->takeUnsentCalls(method); }
+
 bool Connection::hasEnded() const noexcept { return _core->hasEnded(); }
 
 Connection::End Connection::end() const noexcept { return _core->end(); }

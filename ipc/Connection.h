@@ -148,6 +148,9 @@ class Connection {
   /// The last that is heard of the connection: it was ended here, or the peer said goodbye. Runs once.
   void setInvalidationHandler(Task handler);
 
+  /// Keeps what could not be sent for `takeUnsentCalls`. For a connection whose delivery queue is one of its loop's.
+  void keepUnsent();
+
   /// Begins to read. Until then nothing is received; sending works.
   void resume();
 
@@ -195,6 +198,14 @@ class Connection {
   /// Blocks until everything queued has been handed to the system, the connection has ended, or `timeout` passed
   /// (false). For a process about to exit; not on the loop's thread.
   [[nodiscard]] bool waitUntilSent(Duration timeout);
+
+  /// Whether a call of the largest size would be taken now.
+  [[nodiscard]] bool hasRoomForAnyCall() const noexcept;
+
+  /// Of a connection that keeps what is unsent and whose peer went away: the arguments of the calls of this method that
+  /// never left this process whole, oldest first. What the system had taken is not among them, read or not. On the
+  /// loop's thread; sends nothing any more, and knows no calls the second time.
+  [[nodiscard]] std::vector<PropertyArray> takeUnsentCalls(std::uint32_t method);
 
   /// True once it has ended or is about to: calls fail.
   [[nodiscard]] bool hasEnded() const noexcept;

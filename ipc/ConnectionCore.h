@@ -37,11 +37,17 @@ class ConnectionCore : public std::enable_shared_from_this<ConnectionCore> {
   void sendReply(std::uint64_t serial, std::size_t count, BodyEncoder encode, bool prompt);
   void sendErrorReply(std::uint64_t serial, const Error& error, bool prompt);
   [[nodiscard]] bool waitUntilSent(Duration timeout);
+  [[nodiscard]] bool hasRoomForAnyCall() const noexcept {
+    return _outboxBytes.load() + kFrameHeaderBytes + kMaximumFrameBytes <= kMaximumOutboxBytes;
+  }
+  [[nodiscard]] std::vector<PropertyArray> takeUnsentCalls(std::uint32_t method);
 
   // Handlers are set before `resume`, then used on the delivery queue.
   std::shared_ptr<CallDispatcher> dispatcher;
   Task interruptionHandler;
   Task invalidationHandler;
+  /// Set before `resume`: what did not leave is kept for `takeUnsentCalls`.
+  bool keepsUnsent = false;
 
   [[nodiscard]] bool hasEnded() const noexcept { return _ended.load(std::memory_order_acquire); }
   [[nodiscard]] End end() const noexcept { return _end.load(std::memory_order_acquire); }
@@ -100,6 +106,7 @@ class ConnectionCore : public std::enable_shared_from_this<ConnectionCore> {
   void pump(Sender self);
   [[nodiscard]] bool refillSending(Sender self);
   void sendingFailed();
+  void keepUnsentLocked(Outbox& waiting) VELK_REQUIRES(_lock);
   void bytesLeft(std::size_t count);
   void resumeDelivery();
 
@@ -175,6 +182,7 @@ class ConnectionCore : public std::enable_shared_from_this<ConnectionCore> {
   Sender _sender VELK_GUARDED_BY(_lock) = Sender::nobody;
   bool _accepting VELK_GUARDED_BY(_lock) = true;    ///< frames may be appended
   bool _sendFailed VELK_GUARDED_BY(_lock) = false;  ///< the peer no longer reads, or the socket is closed
+  std::vector<std::uint8_t> _unsent VELK_GUARDED_BY(_lock);
 
   // Guarded by _inboxLock, which is never held together with _lock.
   Lock _inboxLock;

@@ -267,6 +267,32 @@ void ConnectionCore::endHere() {
   resumeDelivery();
 }
 
+/// Stops sending: what is still here never leaves. On the loop's thread, where the sender of such a connection works.
+std::vector<PropertyArray> ConnectionCore::takeUnsentCalls(std::uint32_t method) {
+  std::vector<std::uint8_t> frames;
+  Outbox waiting;
+  {
+    Guard guard(_lock);
+    _sendFailed = true;
+    std::swap(waiting, _outbox);
+    keepUnsentLocked(waiting);
+    frames.swap(_unsent);
+    _outboxBytes = 0;
+  }
+  _allSent.notifyAll();
+  std::vector<PropertyArray> calls;
+  for (std::span<const std::uint8_t> rest(frames); !rest.empty();) {
+    const FrameHeader header = readFrameHeader(rest.data());
+    CborReader reader(rest.subspan(kFrameHeaderBytes, header.length));
+    rest = rest.subspan(kFrameHeaderBytes + header.length);
+    PropertyArray values;
+    if (header.kind != FrameKind::call || !readArray(reader, values) || integerValue(&values[0]) != method) continue;
+    values.removeAt(0);
+    calls.push_back(std::move(values));
+  }
+  return calls;
+}
+
 void ConnectionCore::failPendingReplies(const char* reason) {
   std::vector<ReplyHandler> handlers;
   {

@@ -166,14 +166,23 @@ bool ConnectionCore::refillSending(Sender self) {
   return false;
 }
 
+/// What the sender was at, then what waited behind it. By the sender, or where there is none.
+void ConnectionCore::keepUnsentLocked(Outbox& waiting) {
+  for (Outbox* const outbox : {&_sending, &waiting}) {
+    const auto frames = outbox->unsentFrames();
+    if (keepsUnsent) _unsent.insert(_unsent.end(), frames.begin(), frames.end());
+    outbox->clear();
+  }
+}
+
 /// The peer reads no more. What it had sent before may still wait in the socket, so reading goes on.
 void ConnectionCore::sendingFailed() {
-  _sending.clear();
   Outbox dropped;
   {
     Guard guard(_lock);
     _sendFailed = true;
     std::swap(dropped, _outbox);
+    keepUnsentLocked(dropped);
     _sender = Sender::nobody;
     _outboxBytes = 0;
   }
@@ -225,9 +234,9 @@ void ConnectionCore::closeNow() {
     _accepting = false;
     _sender = Sender::nobody;
     std::swap(dropped, _outbox);
+    keepUnsentLocked(dropped);
     _outboxBytes = 0;
   }
-  _sending.clear();
   _watch.reset();
   _socket = FileDescriptor();
   _allSent.notifyAll();

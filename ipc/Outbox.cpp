@@ -55,6 +55,15 @@ void Outbox::sent(std::size_t count) {
   _sent += count;
 }
 
+std::span<const std::uint8_t> Outbox::unsentFrames() const noexcept {
+  std::size_t start = 0;
+  for (std::size_t end = 0; start < _bytes.size(); start = end) {
+    end = start + kFrameHeaderBytes + readFrameHeader(_bytes.data() + start).length;
+    if (end > _sent) break;
+  }
+  return std::span(_bytes).subspan(start);
+}
+
 void Outbox::clear() {
   if (_bytes.capacity() > kBytesToKeep) _bytes = {};
   _bytes.clear();

@@ -39,6 +39,8 @@ class Outbox {
   void sent(std::size_t count);
   [[nodiscard]] bool allSent() const noexcept { return _sent == _bytes.size(); }
   [[nodiscard]] std::size_t unsent() const noexcept { return _bytes.size() - _sent; }
+  /// The frames that did not leave whole.
+  [[nodiscard]] std::span<const std::uint8_t> unsentFrames() const noexcept;
   /// Forgets everything; keeps ordinary amounts of memory.
   void clear();
 

@@ -175,6 +175,7 @@ TEST_F(ClientScarcity, OfDescriptorsLetsEventsWait) {
       {
         begin();
         const auto client = makeClient();
+        EXPECT_TRUE(flush(*client)) << "it has tried to connect";
         _daemon.start();
         {
           const NoDescriptors none;
