@@ -18,9 +18,12 @@ namespace velk::log {
 
 /// For processes that link the library. Says nothing unless its owner asked for it: VELKREPORTING_LOG (read with
 /// secure_getenv) as "debug", "default" or "error" sends lines of that level and above to the standard error stream,
-/// as "velkreporting: LINE"; "none" sends none (the sink is null). Without it errors alone go to the system's log
-/// (syslog), at most kLibraryErrorsPerMinute of them.
+/// as "velkreporting: LINE"; "none" sends none (the sink is null). Without it errors alone go to the system's log, at
+/// most kLibraryErrorsPerMinute of them, as "PROGRAM[PROCESS]: velkreporting: LINE". That never blocks: a line that the
+/// log daemon does not take at once is lost.
 [[nodiscard]] std::shared_ptr<Sink> makeLibrarySink();
+/// The same with a log daemon that listens elsewhere.
+[[nodiscard]] std::shared_ptr<Sink> makeLibrarySink(std::string_view logDaemonPath);
 /// The lowest level that sink has a use for, for `setSink`.
 [[nodiscard]] Level librarySinkLevel();
 inline constexpr unsigned kLibraryErrorsPerMinute = 60;
