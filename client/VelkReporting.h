@@ -12,11 +12,12 @@
 // last use or where it turns out that there is none; like the callback itself, never on the library's permanent thread.
 // A callback may make any call, and may let go of the last reference. An empty one is none.
 //
-// No operation throws. What the system refuses (memory, a thread, descriptors) is an error line in the log, and the
-// answer is null, false, nothing or empty.
+// No operation throws (property values do, as the standard containers do). What the system refuses (memory, a thread,
+// descriptors) is an error line in the log, and the answer is null, false, nothing or empty.
 //
 // When the last reference goes, what was handed over is sent, the session is finished, and the connection is closed. A
-// process that exits with a reference left sends what was handed over too. Both wait for it within a bound.
+// process that exits with a reference left sends what was handed over too. Both wait for it within a bound, and for the
+// callbacks of modules whose tick has begun: do not hold a lock that one of these wants.
 #pragma once
 
 #include <chrono>
@@ -38,13 +39,15 @@ class VelkReportingImplementation;
 
 /// Session info of the client that an event came from (absent in the call that ends the aggregation), time in seconds
 /// since 1970, category, type, payload with the sender's user info merged in. One that throws is never called again.
+/// While it is slow, 16,384 events (or 8 MiB of them) wait for it; the log hears of those that are dropped beyond that.
 using VelkReportingAggregationBlock =
     std::function<void(const std::optional<PropertyDictionary>& client, double timestamp, std::uint16_t category,
                        std::uint16_t type, const std::optional<PropertyDictionary>& payload)>;
 
 class VELK_EXPORT VelkReporting : public std::enable_shared_from_this<VelkReporting> {
  public:
-  /// The names of the backends that are enabled, or nothing when the daemon could not be asked.
+  /// The names of the backends that are enabled, or nothing when the session is not configured: the daemon could not be
+  /// asked, or has no storebag for it.
   using StatesCallback = std::function<void(const std::optional<PropertyArray>& enabledBackends)>;
   using LoggingBlock = std::function<void(const std::string& text)>;
   using FlushCallback = std::function<void(const std::optional<Error>& error)>;
@@ -72,7 +75,8 @@ class VELK_EXPORT VelkReporting : public std::enable_shared_from_this<VelkReport
   /// Has the daemon build the session's backends; once, before events are sent. The handler is called once: with
   /// nothing, and a line in the log, when no daemon answers; the session is then configured as soon as one does.
   void startConfigurationWithCompletionHandler(StatesCallback completionHandler);
-  /// Gives the session a new user info and asks which backends are enabled now. The callback is called once: with
+  /// Gives the session a new user info and asks which backends are enabled now. Nothing leaves the user info as it is
+  /// or, in a session that requires none ("RequireUserDict" false), takes it away. The callback is called once: with
   /// nothing, and a line in the log, when no daemon answers; one that comes later is told the user info all the same.
   void fetchReportingStatesWithUserInfo(const std::optional<PropertyDictionary>& userInfo,
                                         StatesCallback fetchComplete);
@@ -93,8 +97,8 @@ class VELK_EXPORT VelkReporting : public std::enable_shared_from_this<VelkReport
   /// The same. The callback is called once, with what became of it: no error, the session's, or, with a line in the
   /// log, the connection's when no daemon answers.
   void flushMessagesWithCompletion(FlushCallback completion);
-  /// Marks the session as finished gracefully. Overtakes what is still queued, and awaits nothing. The last release
-  /// does the same behind what is queued.
+  /// Marks the session as finished gracefully. Overtakes what is still queued, and awaits nothing. Lost, with a line in
+  /// the log, when no daemon answers. The last release does the same behind what is queued.
   void finishSession();
 
   // Data that the sessions of one hierarchy share: it travels with the events of all of them. Lost, with a line in the
@@ -103,7 +107,8 @@ class VELK_EXPORT VelkReporting : public std::enable_shared_from_this<VelkReport
   /// Without a value the key is removed.
   void updateSharedDataForKey(const std::string& key, const std::optional<PropertyValue>& value);
 
-  /// Takes effect with the next message that is sent. The delegate is never owned here, but for a call of it.
+  /// Takes effect with the next message that is sent. The delegate is never owned here, but for a call of it. While it
+  /// is slow, 16,384 messages (or 8 MiB of them) wait for it; the log hears of those that are dropped beyond that.
   void setMessageSentDelegate(std::weak_ptr<VelkReportingMessageSentDelegate> delegate);
   [[nodiscard]] std::shared_ptr<VelkReportingMessageSentDelegate> messageSentDelegate() const;
   /// Is given the text of each message that left, and the address at which reports can be viewed. While it is slow,
@@ -130,8 +135,9 @@ class VELK_EXPORT VelkReporting : public std::enable_shared_from_this<VelkReport
   /// Uploads log data: dictionaries. False for none, and (with an error line) when something else stands among them.
   /// The callback is called once with the daemon's answer; not at all, with a line in the log, when no daemon answers.
   bool uploadDataArray(const std::optional<PropertyArray>& logData, UploadCallback completionHandler);
-  /// The key of the digest that goes with each post of the "qrs" backend, by the algorithm of number 0; with any other
-  /// number there is no digest. False without a key.
+  /// The key of the digest that goes with each post of the "qrs" backend: an HMAC of its JSON with SHA-1, by algorithm
+  /// 0; by any other there is none. Call it after `startConfigurationWithCompletionHandler`: a key that comes before
+  /// reaches the backend with the next user info only. A later user info makes the algorithm 0. False without a key.
   bool setDigestKey(const std::optional<ByteData>& digestKey, std::uint32_t algorithm);
 
   // Periodic tasks: while the log timer runs, each tick asks the modules that want it to update their measurements;
@@ -170,9 +176,11 @@ class VELK_EXPORT VelkReporting : public std::enable_shared_from_this<VelkReport
   [[nodiscard]] static std::optional<PropertyDictionary> newHierarchyTokenFromParentToken(
       const std::optional<PropertyValue>& parentToken);
 
-  /// Reports a single event without a client object. True: it was taken; delivery is not reported. False, with an
-  /// error: 2 no session info, 3 client type outside 5 to 30, 4 category 0, 8 too many are waiting, 13 the system gives
-  /// the library no thread or no descriptors.
+  /// Reports a single event without a client object. True: it was taken; delivery is not reported, and without a daemon
+  /// it is lost. The end of the process, by `exit` or a return from `main`, waits for those under way, for at most a
+  /// second. False, with an error: 2 no session info, 3 client type outside 5 to 30, 4 category 0, 8 when 256 are
+  /// waiting, 12 what can never be sent (as above, but the payload is the first), 13 the system gives the library no
+  /// thread or no descriptors.
   static bool sendOneMessageWithSessionInfo(const std::optional<PropertyDictionary>& sessionInfo,
                                             const std::optional<PropertyDictionary>& userInfo, std::uint16_t category,
                                             std::uint16_t type, const std::optional<PropertyDictionary>& payload,

@@ -19,8 +19,10 @@
  * client alone it stays as it was: give it a value first. When memory is short, functions answer false or null without
  * an error, with a line in the log.
  *
- * The log. Errors go to the system's log; the lines of the default level, which tell why a client was not created or a
- * file not taken, are written when the environment says VELKREPORTING_LOG=default.
+ * The log. Errors go to the system's log, at most 60 of them a minute. When the environment says
+ * VELKREPORTING_LOG=default, they are written to the standard error stream instead, all of them, and with them the
+ * lines of the default level, which tell why a client was not created, a file not taken, or what was lost because no
+ * daemon answered.
  *
  * Callbacks. A callback comes with a `context`, handed back to it as it is, and a `destroy` function for that context;
  * callback, context and destroy may each be null. Callbacks run on threads of the library that are there only while
@@ -32,9 +34,10 @@
  *
  * Threads. Any thread may call any function on clients and errors. A value is used by one thread at a time while one
  * of them changes it. No function waits for the daemon but the last VelkReportingClientRelease, within a bound; and
- * none for a callback but VelkReportingClientUnregisterPeriodicTask. In a child made by fork(), clients of the parent
- * do nothing: contexts that are handed over end at once, events are answered with error 9. Values, errors and clients
- * that it makes itself work as anywhere. */
+ * none for a callback but VelkReportingClientUnregisterPeriodicTask and, within its bound, the last release: do not
+ * hold a lock that a module's callback wants. In a child made by fork(), clients of the parent do nothing: contexts
+ * that are handed over end at once, events are answered with error 9. Values, errors and clients that it makes itself
+ * work as anywhere. */
 #pragma once
 
 #include <stdbool.h>
@@ -70,7 +73,8 @@ enum {
   kVelkReportingErrorInvalidJSON = 11,      /* text that is no JSON, or a value that has no form in it */
   /* An event that no daemon would take: more than 1 MiB on its way (the readable JSON is longer, as a rule), 65,536
    * values, or 4,096 keys in one dictionary; dictionaries and arrays more than 31 within each other, the message being
-   * the first and its payload the second. A line in the log says so as well. */
+   * the first and its payload the second (in VelkReportingSendOneMessage the payload is the first). A line in the log
+   * says so as well. */
   kVelkReportingErrorNotSendable = 12,
   kVelkReportingErrorNoResources = 13 /* the system gave the library no thread or no descriptors */
 };
@@ -138,7 +142,8 @@ VELK_EXPORT bool VelkReportingValueIsEqual(const VelkReportingValue* left, const
 /* Null handles are of type null. */
 VELK_EXPORT VelkReportingValueType VelkReportingValueGetType(const VelkReportingValue* value);
 /* Lenient: numbers are converted (towards zero, to the nearest bound: an unsigned integer beyond 2^63-1 reads as that;
- * what is no number is 0), text is read as a number from its beginning, everything else is false or 0. */
+ * what is no number is 0), text is read as a number from its beginning; as a boolean it is true when it begins, after
+ * blanks, a sign and zeros, with Y, y, T, t or a digit from 1 to 9. Everything else is false or 0. */
 VELK_EXPORT bool VelkReportingValueGetBoolean(const VelkReportingValue* value);
 VELK_EXPORT int64_t VelkReportingValueGetInteger(const VelkReportingValue* value);
 VELK_EXPORT double VelkReportingValueGetReal(const VelkReportingValue* value);
@@ -184,11 +189,13 @@ VELK_EXPORT const char* VelkReportingDictionaryGetString(const VelkReportingValu
 
 /* ---- Creating a client ---- */
 
-/* The names of the backends that are enabled (an array of text), or null when the daemon could not be asked. */
+/* The names of the backends that are enabled (an array of text), or null when the session is not configured: the daemon
+ * could not be asked, or has no storebag for it. */
 typedef void (*VelkReportingStatesCallback)(const VelkReportingValue* enabledBackends, void* context);
 /* An event of this client or of a session below it: session info of its client (null, with everything else null or 0,
  * in the call that ends the aggregation), time in seconds since 1970, category, type, payload with the sender's user
- * info merged in. Called in order, one at a time. */
+ * info merged in. Called in order, one at a time. While the callback is slow, 16,384 events (or 8 MiB of them)
+ * wait; more are dropped, which the log hears of. */
 typedef void (*VelkReportingAggregationCallback)(const VelkReportingValue* client, double timestamp, uint16_t category,
                                                  uint16_t type, const VelkReportingValue* payload, void* context);
 
@@ -228,13 +235,14 @@ VELK_EXPORT void VelkReportingClientSetEndOfLifeBound(VelkReportingClient* clien
 
 /* ---- Reporting ---- */
 
-/* Gives the session a new user info (a dictionary, or null to leave it as it is) and asks which backends are enabled
- * now. */
+/* Gives the session a new user info (a dictionary) and asks which backends are enabled now. Null leaves the one that it
+ * has or, in a session that requires none ("RequireUserDict" false), takes it away. */
 VELK_EXPORT void VelkReportingFetchStatesWithUserInfo(VelkReportingClient* client, const VelkReportingValue* userInfo,
                                                       VelkReportingStatesCallback callback, void* context,
                                                       VelkReportingDestroyFunction destroy);
 
-/* The text of each message that left, and the address at which reports can be viewed; in order, one at a time. */
+/* The text of each message that left, and the address at which reports can be viewed; in order, one at a time. While
+ * the callback is slow, 16,384 texts (or 8 MiB of them) wait; more are dropped, which the log hears of. */
 typedef void (*VelkReportingMessageCallback)(const char* text, void* context);
 /* Replaces the callback of before, whose context is then destroyed; a null callback ends it. The context ends with the
  * client at the latest. */
@@ -259,19 +267,20 @@ typedef void (*VelkReportingFlushCallback)(const VelkReportingError* error, void
 VELK_EXPORT void VelkReportingFlushMessagesWithCompletion(VelkReportingClient* client,
                                                           VelkReportingFlushCallback callback, void* context,
                                                           VelkReportingDestroyFunction destroy);
-/* Marks the session as finished gracefully. Overtakes what is still queued, and awaits nothing. */
+/* Marks the session as finished gracefully. Overtakes what is still queued, and awaits nothing. Lost, with a line in
+ * the log, when no daemon answers. */
 VELK_EXPORT void VelkReportingClientFinishSession(VelkReportingClient* client);
 
 /* Data that the sessions of one hierarchy share: it travels with the events of all of them. Nothing happens without a
- * dictionary or key, and for a key that is no UTF-8. */
+ * dictionary or key, and for a key that is no UTF-8. Lost, with a line in the log, when no daemon answers. */
 VELK_EXPORT void VelkReportingUpdateSharedDataWithDictionary(VelkReportingClient* client,
                                                              const VelkReportingValue* dictionary);
 /* A null value removes the key. */
 VELK_EXPORT void VelkReportingUpdateSharedDataForKey(VelkReportingClient* client, const char* key,
                                                      const VelkReportingValue* value);
 
-/* Uploads log data, an array of dictionaries. True: handed over. False for an empty array, for no array, and (with a
- * line in the log) when something else stands in it. */
+/* Uploads log data, an array of dictionaries. True: handed over; lost, with a line in the log, when no daemon answers.
+ * False for an empty array, for no array, and (with a line in the log) when something else stands in it. */
 VELK_EXPORT bool VelkReportingUploadLogWithArray(VelkReportingClient* client, const VelkReportingValue* logData);
 typedef void (*VelkReportingUploadCallback)(bool uploaded, void* context);
 /* Uploads a file: a path, or a file address ("file:/PATH" or "file://HOST/PATH": percent escapes are resolved, the host
@@ -293,7 +302,9 @@ VELK_EXPORT bool VelkReportingClientUploadFile(VelkReportingClient* client, cons
                                                VelkReportingDestroyFunction destroy);
 /* Whether the daemon said that files may be uploaded. */
 VELK_EXPORT bool VelkReportingClientServerSupportsFileUpload(VelkReportingClient* client);
-/* The key of the digest that goes with each post of the "qrs" backend. False without a key. */
+/* The key of the digest that goes with each post of the "qrs" backend: an HMAC of its JSON with SHA-1, by algorithm
+ * 0; by any other there is none. Call it after VelkReportingClientStartConfiguration: a key that comes before
+ * reaches the backend with the next user info only. A later user info makes the algorithm 0. False without a key. */
 VELK_EXPORT bool VelkReportingClientSetDigestKey(VelkReportingClient* client, const void* key, size_t size,
                                                  uint32_t algorithm);
 
@@ -332,8 +343,9 @@ VELK_EXPORT void VelkReportingClientStopLogTimer(VelkReportingClient* client);
 VELK_EXPORT VelkReportingValue* VelkReportingNewHierarchyTokenFromParentToken(const VelkReportingValue* parentToken);
 VELK_EXPORT VelkReportingValue* VelkReportingCreateHierarchyTokenFromParentToken(const VelkReportingValue* parentToken);
 
-/* Reports a single event. True: it was taken; delivery is not reported. False, with an error: 2, 3, 4, 10 for a payload
- * or user info that is no dictionary, 12, 13, or 8 when 256 of them are waiting. */
+/* Reports a single event. True: it was taken; delivery is not reported, and without a daemon it is lost. The end of the
+ * process, by exit() or a return from main, waits for those under way, for at most a second. False, with an error: 2,
+ * 3, 4, 10 for a payload or user info that is no dictionary, 12, 13, or 8 when 256 of them are waiting. */
 VELK_EXPORT bool VelkReportingSendOneMessage(const VelkReportingValue* sessionInfo, const VelkReportingValue* userInfo,
                                              uint16_t category, uint16_t type, const VelkReportingValue* payload,
                                              VelkReportingError** error);

@@ -1,5 +1,5 @@
 /* The keys and names that clients share with the daemon, for C11 and C++. Each is a constant of the library that points
- * to its text; the texts travel over the wire and never change. See docs/protocol.md for what the values must be. */
+ * to its text; the texts travel over the wire and never change. */
 #pragma once
 
 #include "foundation/Export.h"

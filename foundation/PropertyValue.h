@@ -2,6 +2,7 @@
 // Session info, user info, messages, storebags, event dictionaries and shared data are property dictionaries.
 // Values are copied freely: arrays and dictionaries share their contents until one copy writes.
 // A value object is used by one thread at a time; copies on different threads may share contents safely.
+// When memory is short, what makes or changes contents throws std::bad_alloc, as the standard containers do.
 #pragma once
 
 #include <cstddef>
@@ -192,8 +193,9 @@ struct PropertyDictionary::Entry {
 inline const PropertyValue& PropertyArray::operator[](std::size_t index) const noexcept { return begin()[index]; }
 
 // Lenient readings, one rule for messages, storebags and suites. Doubles truncate toward zero, booleans are 0 and
-// 1, strings give their leading digits (after blanks, with a sign), everything else and nothing gives 0. Numbers
-// outside 64 bits stay at the nearest bound; callers cut the result to the width that they need.
+// 1, strings give their leading digits (after blanks, with a sign), everything else and nothing gives 0. Doubles and
+// digits outside 64 bits stay at the nearest bound; unsigned integers above 2^63-1 give their low bits, and so a number
+// below 0. Callers cut the result to the width that they need.
 [[nodiscard]] VELK_EXPORT std::int64_t integerValue(const PropertyValue* value) noexcept;
 [[nodiscard]] inline std::int64_t integerValue(const PropertyValue& value) noexcept { return integerValue(&value); }
 /// Numbers are true when they are not zero; strings when they begin with Y, y, T, t or a digit from 1 to 9 (after
