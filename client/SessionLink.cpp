@@ -138,13 +138,13 @@ std::shared_ptr<Connection> SessionLink::makeConnection() {
   const std::shared_ptr<Connection> connection = std::move(*made);
   connection->setExportedDispatcher(std::make_shared<ReplyInterfaceDispatcher>(_exported));
   connection->keepUnsent();
-  connection->setInvalidationHandler([self = weak_from_this(), weak = std::weak_ptr(connection)] {
+  connection->setInvalidationHandler([self = weak_from_this(), core = std::weak_ptr(connection->core())] {
     log::standard(texts::kConnectionInvalidated);
-    tell(self.lock(), weak.lock(), &SessionLink::wasInvalidated);
+    tell(self.lock(), core.lock(), &SessionLink::wasInvalidated);
   });
-  connection->setInterruptionHandler([self = weak_from_this(), weak = std::weak_ptr(connection)] {
+  connection->setInterruptionHandler([self = weak_from_this(), core = std::weak_ptr(connection->core())] {
     log::standard(texts::kConnectionInterrupted);
-    tell(self.lock(), weak.lock(), &SessionLink::wasInterrupted);
+    tell(self.lock(), core.lock(), &SessionLink::wasInterrupted);
   });
   return connection;
 }
@@ -174,11 +174,12 @@ void SessionLink::describeSession(const std::shared_ptr<Connection>& connection)
   if (_description.digestKey) proxy.setDigestKey(*_description.digestKey, _description.digestAlgorithm);
 }
 
-void SessionLink::tell(const std::shared_ptr<SessionLink>& link, const std::shared_ptr<Connection>& connection,
+void SessionLink::tell(const std::shared_ptr<SessionLink>& link, std::shared_ptr<ipc::ConnectionCore> core,
                        void (SessionLink::*ended)(Connection&)) {
-  if (!connection) return;
-  if (link) return (*link.*ended)(*connection);
-  reportLoss(*connection);  // its client has gone before it
+  if (!core) return;
+  Connection connection(std::move(core));
+  if (link) return (*link.*ended)(connection);
+  reportLoss(connection);  // its client has gone before it
 }
 
 void SessionLink::wasInterrupted(Connection& connection) {
@@ -194,7 +195,7 @@ void SessionLink::wasInvalidated(Connection& connection) {
 
 void SessionLink::wasLost(Connection& connection) {
   auto unsent = unsentEvents(connection);
-  if (current().get() == &connection) forgetConnection();
+  if (const auto latest = current(); latest && latest->core() == connection.core()) forgetConnection();
   _whenLost(std::move(unsent));
   reconnectLater();
 }

@@ -81,7 +81,7 @@ class SessionLink : public std::enable_shared_from_this<SessionLink> {
   [[nodiscard]] std::shared_ptr<Connection> makeConnection();
   void reportNoConnection(const Error& error);
   void describeSession(const std::shared_ptr<Connection>& connection);
-  static void tell(const std::shared_ptr<SessionLink>& link, const std::shared_ptr<Connection>& connection,
+  static void tell(const std::shared_ptr<SessionLink>& link, std::shared_ptr<ipc::ConnectionCore> core,
                    void (SessionLink::*ended)(Connection&));
   void wasInterrupted(Connection& connection);
   void wasInvalidated(Connection& connection);
