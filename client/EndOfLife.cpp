@@ -102,7 +102,7 @@ void VelkReportingImplementation::finishAndClose(const void* client, SteadyTime 
   log::standard(texts::kAboutToDealloc, client);
   if (!finishSessionNow()) log::standard(texts::kFinishSessionProxyFailure, "no daemon answers");
   _aggregation->releaseAggregationBlock();
-  _loggingBlock = nullptr;
+  setLoggingBlock(nullptr);
   _link->close(deadline - _runtime.loop().clock().steadyTime());
 }
 

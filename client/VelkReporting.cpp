@@ -216,6 +216,14 @@ void VelkReporting::setMessageLoggingBlock(LoggingBlock block) {
   });
 }
 
+VelkReporting::LoggingBlock VelkReporting::messageLoggingBlock() const {
+  return guarded("messageLoggingBlock", nullptr, [&]() -> LoggingBlock {
+    if (_implementation->isForeign()) return nullptr;
+    const auto block = _implementation->loggingBlock();
+    return block ? *block : LoggingBlock();
+  });
+}
+
 bool VelkReporting::isWhitelistedEvent(std::uint16_t category) const {
   return _implementation->isForeign() || _implementation->lists().get()->isWhitelisted(category);
 }

@@ -114,6 +114,8 @@ class VELK_EXPORT VelkReporting : public std::enable_shared_from_this<VelkReport
   /// Is given the text of each message that left, and the address at which reports can be viewed. While it is slow,
   /// 16,384 texts (or 8 MiB of them) wait for it; the log hears of those that are dropped beyond that.
   void setMessageLoggingBlock(LoggingBlock block);
+  /// A copy, or an empty one when none is set. One that was set a moment ago may not be there yet.
+  [[nodiscard]] LoggingBlock messageLoggingBlock() const;
 
   // The daemon's latest answer to a configuration or a fetch. Before the first one everything passes.
 

@@ -109,7 +109,7 @@ bool VelkReportingImplementation::trySending(const PropertyDictionary& message) 
   const auto connection = _link->connect();
   if (!connection) return false;
   // Nobody looks at the reply unless it is logged, and asking for none saves both ends most of its cost.
-  const bool wantsReply = _loggingBlock != nullptr || log::isEnabled(log::Level::standard);
+  const bool wantsReply = loggingBlock() != nullptr || log::isEnabled(log::Level::standard);
   ReplyHandler handler;
   if (wantsReply) {
     handler = [self = weak_from_this()](Result<PropertyArray> reply) {
@@ -233,23 +233,34 @@ void VelkReportingImplementation::notifyMessageWasSent(const PropertyDictionary&
     log::standard(texts::kNotifyCalled);
     self._orderedCallbacks->async([weakClient = self._client, message = std::move(message),
                                    weakDelegate = std::move(weakDelegate), place = std::move(place)] {
-      const auto delegate = weakDelegate.lock();
-      const auto client = weakClient.lock();
-      if (delegate && client) delegate->didSendMessageForReportingClient(client, message);
+      if (const auto delegate = weakDelegate.lock()) {
+        delegate->didSendMessageForReportingClient(weakClient.lock(), message);
+      }
     });
   });
 }
 
 void VelkReportingImplementation::logText(const std::string& text) {
-  if (!_loggingBlock) return;
+  auto block = loggingBlock();
+  if (!block) return;
   auto place = _roomForTexts->reserve(text.size());
   if (!place) return;
-  _orderedCallbacks->async([block = _loggingBlock, text, place = std::move(place)] { (*block)(text); });
+  _orderedCallbacks->async([block = std::move(block), text, place = std::move(place)] { (*block)(text); });
 }
 
 void VelkReportingImplementation::setMessageLoggingBlock(LoggingBlock block) {
   log::standard(texts::kLoggingBlockSet);
-  _loggingBlock = std::move(block);
+  setLoggingBlock(std::move(block));
+}
+
+void VelkReportingImplementation::setLoggingBlock(LoggingBlock block) {
+  Guard guard(_lock);
+  _loggingBlock.swap(block);
+}
+
+VelkReportingImplementation::LoggingBlock VelkReportingImplementation::loggingBlock() const {
+  Guard guard(_lock);
+  return _loggingBlock;
 }
 
 }  // namespace velk

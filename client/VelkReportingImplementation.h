@@ -90,6 +90,7 @@ class VelkReportingImplementation final : public LeavingClient,
   /// From here on messages are brought to the queue, which knows the delegate.
   void expectMessageSentDelegate() noexcept { _mayHaveDelegate.store(true, std::memory_order_relaxed); }
   [[nodiscard]] std::weak_ptr<VelkReportingMessageSentDelegate> weakMessageSentDelegate() const;
+  [[nodiscard]] LoggingBlock loggingBlock() const;
 
   [[nodiscard]] PeriodicTasks& periodicTasks() const { return *_periodicTasks; }
   void unregisterPeriodicTask(std::uint32_t module);
@@ -135,6 +136,7 @@ class VelkReportingImplementation final : public LeavingClient,
   [[nodiscard]] std::size_t heldEvents() const;
   void fetchDisplayURL(const std::shared_ptr<Connection>& connection);
   void logText(const std::string& text);
+  void setLoggingBlock(LoggingBlock block);
   [[nodiscard]] ConfigurationReply statesReply(const StatesCallback& callback);
 
   // Constant after construction.
@@ -163,9 +165,9 @@ class VelkReportingImplementation final : public LeavingClient,
 
   mutable Lock _lock;
   std::weak_ptr<VelkReportingMessageSentDelegate> _weakMessageSentDelegate VELK_GUARDED_BY(_lock);
+  LoggingBlock _loggingBlock VELK_GUARDED_BY(_lock);
 
   // On the reporting queue.
-  LoggingBlock _loggingBlock;
   bool _retryIsPending = false;
   SteadyTime _lastTaken{};
   bool _isFinished = false;

@@ -11,7 +11,7 @@ class VelkReporting;
 
 /// Hears of every valid message that a client hands over, filtered or not. Called in order, on the library's threads.
 /// While it is slow, 16,384 messages (or 8 MiB of them) wait for it; the log hears of those that are dropped beyond
-/// that. One that throws ends the process.
+/// that. `client` is null for a message whose client has been released meanwhile. One that throws ends the process.
 class VelkReportingMessageSentDelegate {
  public:
   virtual ~VelkReportingMessageSentDelegate() = default;
