@@ -46,10 +46,16 @@ ConnectionCore::ConnectionCore(FileDescriptor socket, PeerCredentials credential
       _loop(loop),
       _accepted(accepted),
       _socket(std::move(socket)),
-      _whenClosed(std::move(whenClosed)) {}
+      _whenClosed(std::move(whenClosed)) {
+  if (!_accepted) _socketStays.emplace(_socket.get());
+}
 
 ConnectionCore::~ConnectionCore() {
-  if (_fork.forked()) return;
+  if (_fork.forked()) {
+    // The number may be somebody else's by now.
+    if (_socketStays && *_socketStays) static_cast<void>(_socket.release());
+    return;
+  }
   failPendingReplies("the connection was given up");
   if (_whenClosed) _whenClosed();
 }

@@ -152,6 +152,8 @@ class ConnectionCore : public std::enable_shared_from_this<ConnectionCore> {
 
   // Used on the loop's thread only.
   FileDescriptor _socket;  ///< the sender uses it too, and is waited for before it is closed
+  /// Of a client's end: a daemon hears of a host's end although a child of it lives on.
+  std::optional<NotForChildren> _socketStays;
   std::unique_ptr<DescriptorWatch> _watch;
   FrameReader _reader;
   Task _whenClosed;

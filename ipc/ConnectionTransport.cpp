@@ -238,6 +238,7 @@ void ConnectionCore::closeNow() {
     _outboxBytes = 0;
   }
   _watch.reset();
+  _socketStays.reset();
   _socket = FileDescriptor();
   _allSent.notifyAll();
   if (auto whenClosed = std::move(_whenClosed)) whenClosed();

@@ -3,6 +3,7 @@
 #pragma once
 
 #include <atomic>
+#include <cstddef>
 #include <cstdint>
 
 namespace velk {
@@ -19,6 +20,26 @@ class ForkGuard {
 
  private:
   const std::uint64_t _generation;
+};
+
+/// Keeps a descriptor to the process that made it: a forked child's copy is closed before `fork` returns there, so that
+/// whoever is at the other end of a socket hears of this process's end although a child lives on. So many descriptors
+/// of a process at most; of others the children keep their copies. Owns nothing: it ends before the descriptor is
+/// closed. Any thread; takes no lock.
+class NotForChildren {
+ public:
+  static constexpr std::size_t kMaximum = 1024;
+
+  explicit NotForChildren(int descriptor) noexcept;
+  ~NotForChildren();
+  NotForChildren(const NotForChildren&) = delete;
+  NotForChildren& operator=(const NotForChildren&) = delete;
+  /// Whether it found a place.
+  [[nodiscard]] explicit operator bool() const noexcept { return _place != nullptr; }
+
+ private:
+  const ForkGuard _fork;
+  std::atomic<int>* _place = nullptr;
 };
 
 /// What each process has one of, made at first use and never destroyed: threads may use it while the process ends. A

@@ -210,6 +210,20 @@ TEST_F(HostProcessTest, ABrokenErrorStreamRaisesNoSignal) {
   EXPECT_EQ(host.end("return"), 0);
 }
 
+TEST_F(HostProcessTest, ItsEndIsHeardOfAlthoughAChildLivesOn) {
+  daemon->start();
+  HostProcess host(*daemon);
+  host.open();
+  EXPECT_EQ(host.call("send 1 1"), "");
+  EXPECT_EQ(host.call("fork-and-leave"), "");
+  EXPECT_TRUE(host.flush()) << "the connection is whole";
+  EXPECT_EQ(daemon->log().count("listener: IPC connection to"), 0U);
+  kill(host.process().pid(), SIGKILL);
+  EXPECT_EQ(daemon->log().countOnceThereAre(1, "listener: IPC connection to"), 1U);
+  ASSERT_TRUE(server.waitForEvents(1, {7}));
+  host.process().closeInput();  // the child's end
+}
+
 TEST_F(HostProcessTest, ForeignServiceDirectoriesStayEmpty) {
   daemon->start();
   TemporaryDirectory directory;

@@ -225,6 +225,8 @@ class Host {
       result = nested();
     } else if (command == "identifier") {
       result = " " + VelkReporting::getPersistentIdentifierForDNU(true);
+    } else if (command == "regenerate") {
+      VelkReporting::regeneratePersistentIdentifierForDNU(true);
     } else if (command == "release") {
       _client.reset();
     } else if (command == "leave-it-to-a-static") {
@@ -252,6 +254,8 @@ class Host {
       result = " " + std::to_string(brokenPipes) + " " + std::to_string(endedChildren);
     } else if (command == "fork") {
       result = forked();
+    } else if (command == "fork-and-leave") {
+      result = forkedForItself();
     } else if (command == "fork-often") {
       int times = 0;
       words >> times;
@@ -322,10 +326,17 @@ class Host {
     }
   }
 
+  /// Behind the last flush of the senders comes one more event, so that the next flush has something to post.
   void stopSenders() {
     _stops = true;
     for (auto& sender : _senders) sender.join();
     _senders.clear();
+    const auto isRefused = [this] {
+      Error error;
+      _client->sendMessageWithCategory(8, 1, PropertyDictionary{{"round", -1}}, &error);
+      return error.code != 0;
+    };
+    while (isRefused()) std::this_thread::sleep_for(std::chrono::milliseconds(1));  // the daemon is behind
   }
 
   /// Calls `action` in the callback of a module. Waits until it is called, but not for its end.
@@ -403,6 +414,18 @@ class Host {
       std::exit(0);  // all exit handlers of the parent
     }
     return waitFor(child);
+  }
+
+  /// A child that does nothing and lives until nobody writes to its input any more.
+  static std::string forkedForItself() {
+    std::fflush(stdout);
+    const pid_t child = fork();
+    if (child < 0) return std::string(" fork: ") + std::strerror(errno);
+    if (child != 0) return "";
+    alarm(kPatienceSeconds);
+    for (char byte = 0; read(STDIN_FILENO, &byte, 1) == 1;) {
+    }
+    _exit(0);
   }
 
   /// Nothing, or how the child failed.
