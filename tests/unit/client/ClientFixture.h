@@ -9,6 +9,7 @@
 #include <string_view>
 #include <utility>
 
+#include "client/ClientRuntime.h"
 #include "client/VelkReporting.h"
 #include "platform/Semaphore.h"
 #include "tests/support/RecordingLog.h"
@@ -17,6 +18,8 @@
 namespace velk::test {
 
 inline constexpr Duration kPatience = std::chrono::seconds(30);
+/// More than it takes, for what a turn leaves to the next.
+inline constexpr int kTurnsOfAnEnd = 4;
 
 inline PropertyDictionary sessionInfo(int clientType = 9) { return {{"ComponentType", clientType}, {"SessionID", 7}}; }
 inline PropertyDictionary userInfo() { return {{"_clientName", "Test"}, {"_serviceName", "unit"}}; }
@@ -36,6 +39,17 @@ struct Trigger : log::Sink {
 
 class VelkReportingTest : public ::testing::Test {
  protected:
+  /// What the library still says of clients that have gone belongs to this test, not to the next one's log. A
+  /// connection closes in one turn of the library's thread and tells of it in the next.
+  ~VelkReportingTest() override {
+    EventLoop& loop = ClientRuntime::shared().loop();
+    for (int turn = 0; turn < kTurnsOfAnEnd && loop.start(); ++turn) {
+      Semaphore over;
+      loop.post([&over] { over.signal(); });
+      over.wait();
+    }
+  }
+
   std::shared_ptr<VelkReporting> makeClient(VelkReportingAggregationBlock block = nullptr) {
     return VelkReporting::initWithSessionInfo(sessionInfo(), userInfo(), {"framework"}, std::move(block));
   }
