@@ -11,8 +11,9 @@
 
 namespace velk {
 
-/// Tells when a descriptor can be read or written. Made, used and destroyed on its loop's thread only. Does not own
-/// the descriptor, which must stay open for as long as the watch lives. Destroying it drops handlers uncalled.
+/// Tells when a descriptor can be read or written. Made and used on its loop's thread only; destroyed there or, once
+/// the loop stops, on any thread: whoever has its owner last lets go of both. Does not own the descriptor, which must
+/// stay open for as long as the watch lives. Destroying it drops handlers uncalled.
 class DescriptorWatch {
  public:
   virtual ~DescriptorWatch() = default;

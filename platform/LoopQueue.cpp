@@ -38,6 +38,7 @@ class LoopQueue final : public Queue, public std::enable_shared_from_this<LoopQu
  protected:
   void runSync(void (*work)(void*), void* context) override {
     if (isCurrent() || _loop->forked()) return work(context);
+    const auto self = shared_from_this();  // `work` may drop the queue's last reference.
     if (beginInline()) {
       runInline(work, context);
     } else if (_loop->isCurrent()) {

@@ -136,6 +136,13 @@ TEST(LoopQueue, RunsSyncInlineWhenIdle) {
   EXPECT_EQ(queue->sync([] { return std::this_thread::get_id(); }), std::this_thread::get_id());
 }
 
+TEST(LoopQueue, LastReferenceMayGoInItsOwnSync) {
+  EventLoop loop("test-loop");
+  auto queue = loop.makeLoopQueue("queue");
+  auto* const raw = queue.get();
+  raw->sync([&] { queue.reset(); });
+}
+
 TEST(LoopQueue, SyncsOntoEachOtherOnTheLoopsThread) {
   EventLoop loop("test-loop");
   const auto first = loop.makeLoopQueue("first");
