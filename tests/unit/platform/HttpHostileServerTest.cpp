@@ -122,7 +122,7 @@ TEST_F(HttpHostileServerTest, AnswersThatTrickleEndAtTheTimeout) {
 
   PlainListener body([](PlainListener& self, int socket) {
     const std::string begin = "HTTP/1.1 200 OK\r\nContent-Length: 1000000\r\n\r\n";
-    EXPECT_GT(::send(socket, begin.data(), begin.size(), MSG_NOSIGNAL), 0);
+    static_cast<void>(!::send(socket, begin.data(), begin.size(), MSG_NOSIGNAL));  // the client may have gone by then
     self.repeat(socket, "x", 5ms);
   });
   const auto& outcome = fetch(plainRequest(body.url(), 200ms));

@@ -283,8 +283,9 @@ TEST(ThreadPool, TimersFireOnTheirQueue) {
   fired.wait();
   fired.wait();
   queue->sync([&] { timer->cancel(); });
-  queue->asyncAfter(1ms, [&] { fired.signal(); });
-  fired.wait();
+  Semaphore delayed;
+  queue->asyncAfter(1ms, [&] { delayed.signal(); });
+  delayed.wait();
 }
 
 TEST(ThreadPool, EarlierDeadlineDoesNotWaitForALaterOne) {
