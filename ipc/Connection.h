@@ -11,7 +11,7 @@
 //
 // Life. An open connection keeps itself alive until it has ended, so whoever made it must end it: a client calls
 // `closeAfterSending` or `invalidate`. Handlers may hold the connection: they are dropped when it has ended.
-// After `fork` the child's copy is inert: calls fail, nothing is sent or closed.
+// After `fork` the child's copy is inert: calls fail, nothing is sent; a client's socket is closed there.
 #pragma once
 
 #include <cstdint>
