@@ -30,6 +30,28 @@ constinit PerProcess<ClientRuntime> runtimes;
 /// Exit handlers are inherited by forked children: one is enough.
 std::atomic<bool> watchesExit{false};
 
+/// The suite of a user without a home: it keeps nothing.
+class NoUserDefaults final : public UserDefaults {
+ public:
+  [[nodiscard]] std::optional<PropertyValue> value(std::string_view) const override { return std::nullopt; }
+  [[nodiscard]] PropertyDictionary allValues() const override { return {}; }
+  [[nodiscard]] Result<void> set(std::string_view, PropertyValue) override { return noHome(); }
+  [[nodiscard]] Result<void> remove(std::string_view) override { return {}; }
+  [[nodiscard]] Result<PropertyValue> valueOrStore(std::string_view, const std::function<PropertyValue()>&) override {
+    return noHome();
+  }
+
+ private:
+  static Failure noHome() { return failure("UserDefaults", 5, "the user has no home directory"); }
+};
+
+/// Without the administrator's defaults: identifiers are each user's own.
+std::unique_ptr<UserDefaults> openDefaults() {
+  std::string directory = libraryStateDirectory();
+  if (directory.empty()) return std::make_unique<NoUserDefaults>();
+  return openUserDefaults(kVelkReportingDefaultsSuite, std::move(directory), {});
+}
+
 }  // namespace
 
 /// What is under way when the process exits has no other end: nobody releases it.
@@ -116,11 +138,13 @@ std::shared_ptr<Queue> ClientRuntime::makeCallbackQueue(std::string label) {
 }
 
 UserDefaults& ClientRuntime::defaults() {
-  Guard guard(_lock);
-  if (!_defaults) {
-    const Directories directories = clientDirectories();
-    _defaults = openUserDefaults(kVelkReportingDefaultsSuite, directories.state, directories.configuration);
+  {
+    Guard guard(_lock);
+    if (_defaults) return *_defaults;
   }
+  auto opened = openDefaults();  // not under the lock: it may ask the user database
+  Guard guard(_lock);
+  if (!_defaults) _defaults = std::move(opened);
   return *_defaults;
 }
 

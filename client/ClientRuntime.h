@@ -58,7 +58,8 @@ class ClientRuntime {
   /// the beginning of that.
   [[nodiscard]] SteadyTime deadlineFor(Duration bound) const;
 
-  /// The calling user's suite, in which the library keeps its identifiers.
+  /// The calling user's suite, in which the library keeps its identifiers, out of every daemon's sight: a client never
+  /// writes what a daemon reads. That of a user without a home keeps nothing.
   [[nodiscard]] UserDefaults& defaults();
 
  private:

@@ -21,9 +21,15 @@ struct Directories {
 /// the installed data directory.
 [[nodiscard]] Directories daemonDirectories();
 
-/// For a process that links the library: its own user's directories, whatever service variables its host has.
-/// The environment is read with secure_getenv.
+/// For a program that is no service: the same, whatever service variables it was started with. The environment is read
+/// with secure_getenv.
 [[nodiscard]] Directories clientDirectories();
+
+/// Where a process that links the library keeps what it remembers, in which no daemon looks, be it of the same user: a
+/// folder of its own, "velkreporting-client", in XDG_STATE_HOME, else in ".local/state" of the home (HOME, else what
+/// the user database knows). For root each of them counts only if it is a directory of root's. Empty when there is
+/// none: then nothing can be kept. Asks the user database, which may block, where HOME does not tell.
+[[nodiscard]] std::string libraryStateDirectory();
 
 /// The daemon's socket: `VELKREPORTING_SOCKET`, else "com.tavrin.velkreportingd" in the system's runtime directory
 /// (and, for a user who is not root, in the user's own if that one exists).

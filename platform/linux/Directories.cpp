@@ -16,6 +16,8 @@ namespace velk {
 namespace {
 
 constexpr const char* kName = "/velkreporting";
+constexpr const char* kLibraryName = "/velkreporting-client";
+constexpr const char* kStateBelowHome = "/.local/state";
 constexpr const char* kSocketName = "/com.tavrin.velkreportingd";
 constexpr const char* kSystemRuntimeDirectory = "/run/velkreporting";
 
@@ -30,8 +32,8 @@ std::string pathFromEnvironment(const char* name, bool mayBeList = false) {
   return path;
 }
 
-std::string homeDirectory() {
-  if (auto home = pathFromEnvironment("HOME"); !home.empty()) return home;
+/// Nothing for a user of whom the user database knows no home.
+std::string homeFromUserDatabase() {
   std::vector<char> buffer(16384);
   passwd entry{};
   passwd* found = nullptr;
@@ -39,7 +41,13 @@ std::string homeDirectory() {
       found->pw_dir != nullptr && found->pw_dir[0] == '/') {
     return found->pw_dir;
   }
-  return "/nonexistent";
+  return {};
+}
+
+std::string homeDirectory() {
+  if (auto home = pathFromEnvironment("HOME"); !home.empty()) return home;
+  auto home = homeFromUserDatabase();
+  return home.empty() ? "/nonexistent" : home;
 }
 
 std::string baseDirectory(const char* variable, const char* belowHome) {
@@ -63,7 +71,7 @@ Directories systemDirectories() {
 }
 
 Directories userDirectories() {
-  const std::string state = baseDirectory("XDG_STATE_HOME", "/.local/state") + kName;
+  const std::string state = baseDirectory("XDG_STATE_HOME", kStateBelowHome) + kName;
   return {userRuntimeDirectory(),
           state,
           baseDirectory("XDG_CACHE_HOME", "/.cache") + kName,
@@ -74,6 +82,14 @@ Directories userDirectories() {
 
 void replaceBy(std::string& directory, const char* variable) {
   if (auto path = pathFromEnvironment(variable, true); !path.empty()) directory = std::move(path);
+}
+
+/// Whether the caller may keep something below `directory`. For others than root the system decides that. Root is kept
+/// out of homes that others own, where it would follow anybody's links, and makes no home that is not there.
+bool isForCaller(const std::string& directory) {
+  if (directory.empty() || ::geteuid() != 0) return !directory.empty();
+  struct stat status {};
+  return ::stat(directory.c_str(), &status) == 0 && S_ISDIR(status.st_mode) && status.st_uid == 0;
 }
 
 bool isSocket(const std::string& path) {
@@ -94,6 +110,13 @@ Directories daemonDirectories() {
 }
 
 Directories clientDirectories() { return ::geteuid() == 0 ? systemDirectories() : userDirectories(); }
+
+std::string libraryStateDirectory() {
+  if (const auto state = pathFromEnvironment("XDG_STATE_HOME"); isForCaller(state)) return state + kLibraryName;
+  auto home = pathFromEnvironment("HOME");
+  if (!isForCaller(home)) home = homeFromUserDatabase();
+  return isForCaller(home) ? home + kStateBelowHome + kLibraryName : std::string();
+}
 
 std::string daemonSocketPath() {
   if (auto path = pathFromEnvironment("VELKREPORTING_SOCKET"); !path.empty()) return path;
