@@ -3,6 +3,7 @@
 #include <stdlib.h>
 
 #include <chrono>
+#include <deque>
 #include <stdexcept>
 
 namespace velk::test {
@@ -22,6 +23,9 @@ struct FakeDaemon::State {
   std::optional<PropertyArray> whitelist VELK_GUARDED_BY(lock);
   std::optional<PropertyArray> blacklist VELK_GUARDED_BY(lock);
   std::optional<std::string> messageReply VELK_GUARDED_BY(lock);
+  std::optional<std::string> displayUrl VELK_GUARDED_BY(lock) = "https://reports.example/";
+  SingleMessages singleMessages VELK_GUARDED_BY(lock) = SingleMessages::answered;
+  std::deque<TextReply> kept VELK_GUARDED_BY(lock);
   std::optional<Error> flushError VELK_GUARDED_BY(lock);
 
   template <class Holds>
@@ -59,7 +63,12 @@ class FakeDaemon::Session : public ClientSessionInterface {
   }
   void fetchDisplayURL(TextReply reply) override {
     record("fetchDisplayURL", {});
-    reply("https://reports.example/");
+    std::optional<std::string> url;
+    {
+      Guard guard(_state->lock);
+      url = _state->displayUrl;
+    }
+    reply(url);
   }
   void sendMessageWithDictionary(PropertyDictionary dictionary, TextReply reply) override {
     record("sendMessageWithDictionary", {dictionary});
@@ -96,8 +105,10 @@ class FakeDaemon::Session : public ClientSessionInterface {
   void sendMessageWithSessionInfo(PropertyDictionary sessionInfo, std::optional<PropertyDictionary> userInfo,
                                   std::uint16_t category, std::uint16_t type, std::optional<PropertyDictionary> payload,
                                   TextReply reply) override {
+    // Kept before it is told of: whoever has waited for it may answer it.
+    const bool answers = receive(reply);
     record("sendMessageWithSessionInfo", {sessionInfo, orNull(userInfo), category, type, orNull(payload)});
-    reply("finished");
+    if (answers) reply("finished");
   }
   void updateSharedDataWithDictionary(PropertyDictionary dictionary) override {
     record("updateSharedDataWithDictionary", {dictionary});
@@ -110,6 +121,13 @@ class FakeDaemon::Session : public ClientSessionInterface {
  private:
   static PropertyValue orNull(const std::optional<PropertyDictionary>& value) {
     return value ? PropertyValue(*value) : PropertyValue();
+  }
+
+  /// Whether a single message is to be answered at once.
+  bool receive(TextReply& reply) {
+    Guard guard(_state->lock);
+    if (_state->singleMessages == SingleMessages::kept) _state->kept.push_back(std::move(reply));
+    return _state->singleMessages == SingleMessages::answered;
   }
 
   void record(const char* method, PropertyArray arguments) {
@@ -180,11 +198,14 @@ void FakeDaemon::stop() {
   _listener.reset();
   // Without a goodbye: the loop and with it every socket goes as in a process that dies.
   _loop->stop();
+  std::deque<TextReply> kept;  // too late for them to be told of
   {
     Guard guard(_state->lock);
+    kept.swap(_state->kept);
     _state->connections.clear();
     _state->forgotten = _state->accepted;
   }
+  kept.clear();
   _loop.reset();
 }
 
@@ -218,6 +239,27 @@ void FakeDaemon::setDeliversUploads(bool delivers) {
 void FakeDaemon::setMessageReply(std::optional<std::string> text) {
   Guard guard(_state->lock);
   _state->messageReply = std::move(text);
+}
+
+void FakeDaemon::setDisplayUrl(std::optional<std::string> url) {
+  Guard guard(_state->lock);
+  _state->displayUrl = std::move(url);
+}
+
+void FakeDaemon::setSingleMessages(SingleMessages fate) {
+  Guard guard(_state->lock);
+  _state->singleMessages = fate;
+}
+
+void FakeDaemon::answerKeptMessage() {
+  TextReply reply;
+  {
+    Guard guard(_state->lock);
+    if (_state->kept.empty()) throw std::runtime_error("no single message is kept");
+    reply = std::move(_state->kept.front());
+    _state->kept.pop_front();
+  }
+  reply("finished");
 }
 
 void FakeDaemon::setFlushError(std::optional<Error> error) {

@@ -43,7 +43,14 @@ class FakeDaemon {
   /// Whether a server is said to have the files that are uploaded.
   void setDeliversUploads(bool delivers);
   void setMessageReply(std::optional<std::string> text);
+  /// Where reports are said to be seen.
+  void setDisplayUrl(std::optional<std::string> url);
   void setFlushError(std::optional<Error> error);
+  enum class SingleMessages { answered, dropped, kept };
+  /// What becomes of single messages from now on: answered at once, given up unanswered, or kept.
+  void setSingleMessages(SingleMessages fate);
+  /// Answers the single message that has been kept longest. Whatever is still kept in the end gets no answer.
+  void answerKeptMessage();
   /// Held back while true: no call is answered or even run.
   void holdCalls(bool hold);
 
