@@ -169,7 +169,8 @@ class VELK_EXPORT VelkReporting : public std::enable_shared_from_this<VelkReport
   // Services that need no client object.
 
   /// A random identifier of this user that lasts until it is regenerated: one for use while the user's consent to
-  /// diagnostics and usage data is respected, one for use regardless of it.
+  /// diagnostics and usage data is respected, one for use regardless of it. Kept where no daemon reads it; without a
+  /// home directory each call makes a new one.
   [[nodiscard]] static std::string getPersistentIdentifierForDNU(bool respectConsent);
   static void regeneratePersistentIdentifierForDNU(bool respectConsent);
 

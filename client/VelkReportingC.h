@@ -19,10 +19,10 @@
  * client alone it stays as it was: give it a value first. When memory is short, functions answer false or null without
  * an error, with a line in the log.
  *
- * The log. Errors go to the system's log, at most 60 of them a minute. When the environment says
- * VELKREPORTING_LOG=default, they are written to the standard error stream instead, all of them, and with them the
- * lines of the default level, which tell why a client was not created, a file not taken, or what was lost because no
- * daemon answered.
+ * The log. Errors go to the system's log, at most 60 of them a minute; one that the log daemon does not take at once
+ * is lost. When the environment says VELKREPORTING_LOG=default, they are written to the standard error stream instead,
+ * all of them, and with them the lines of the default level, which tell why a client was not created, a file not taken,
+ * or what was lost because no daemon answered.
  *
  * Callbacks. A callback comes with a `context`, handed back to it as it is, and a `destroy` function for that context;
  * callback, context and destroy may each be null. Callbacks run on threads of the library that are there only while
@@ -351,8 +351,9 @@ VELK_EXPORT bool VelkReportingSendOneMessage(const VelkReportingValue* sessionIn
                                              VelkReportingError** error);
 
 /* A random identifier of this user that lasts until it is regenerated: one for use while the user's consent to
- * diagnostics and usage data is respected, one for use regardless of it. Made at first use. The caller frees the text
- * with VelkReportingTextFree. */
+ * diagnostics and usage data is respected, one for use regardless of it. Made at first use, and kept where no daemon
+ * reads it; without a home directory each call makes a new one. The caller frees the text with VelkReportingTextFree.
+ */
 VELK_EXPORT char* VelkReportingCopyPersistentIdentifier(bool respectConsent);
 VELK_EXPORT void VelkReportingRegeneratePersistentIdentifier(bool respectConsent);
 
