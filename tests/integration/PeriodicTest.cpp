@@ -157,7 +157,7 @@ TEST_F(Periodic, TheLastReleaseInACallbackEndsTheSessionAndLosesNothing) {
   EXPECT_TRUE(client->waitForLine("ended 1"));
   EXPECT_TRUE(client->waitForLine("ended 2"));
   ASSERT_TRUE(daemon->log().waitForPart("invalidateReportingSession: ReportingdSession"));
-  EXPECT_EQ(client->process().errors().count("is about to dealloc"), 1U);
+  EXPECT_EQ(client->process().errors().countOnceThereAre(1, "is about to dealloc"), 1U);
   EXPECT_EQ(client->finish(), 0);
   EXPECT_EQ(daemon->stop(), 0);
   EXPECT_EQ(daemon->log().countOnceThereAre(1, "invalidateReportingSession: ReportingdSession"), 1U);

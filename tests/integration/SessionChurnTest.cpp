@@ -177,6 +177,7 @@ TEST(SessionChurn, LeavesNothingBehind) {
   bystander.reset();
   EXPECT_EQ(daemon.process().wait(), 0) << "nothing holds the process any more";
   const auto& log = daemon.log();
+  log.waitForEnd();
   const auto accepted = log.count("listener: Accepting new IPC connection");
   EXPECT_EQ(log.count("invalidateReportingSession: ReportingdSession"), accepted);
   EXPECT_EQ(log.count("dealloc: ReportingdSession dealloc: "), accepted) << "each is torn down, once";

@@ -137,7 +137,8 @@ TEST_F(Status, ForgetsWhatHasEnded) {
   EXPECT_EQ(sessions.back()->finish(), 0);
   const auto told = statusWhen([](const auto& last) {
     const auto* helpers = last.array("helpers");
-    return integerValue(last.find("sessionCount")) == 0 && helpers != nullptr && helpers->size() == 1 &&
+    return integerValue(last.find("sessionCount")) == 0 && integerValue(last.find("keepAliveCount")) == 1 &&
+           helpers != nullptr && helpers->size() == 1 &&
            !(*helpers)[0].dictionary()->find("releaseInSeconds")->isNull();
   });
   EXPECT_EQ(integerValue(told.find("sessionCount")), 0);
@@ -303,7 +304,8 @@ TEST_F(Status, IsThereWhileManyComeAndGo) {
   // Their transport keeps what they held until nobody has used it for a while.
   const auto told = statusWhen([](const auto& last) {
     const auto* helpers = last.array("helpers");
-    return integerValue(last.find("sessionCount")) == 0 && helpers != nullptr && helpers->size() == 1 &&
+    return integerValue(last.find("sessionCount")) == 0 && integerValue(last.find("keepAliveCount")) == 200 &&
+           helpers != nullptr && helpers->size() == 1 &&
            integerValue((*helpers)[0].dictionary()->find("totalSessionsServedCount")) == 200;
   });
   EXPECT_EQ(integerValue(told.find("sessionCount")), 0);
