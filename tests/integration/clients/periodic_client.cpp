@@ -7,7 +7,6 @@
 //   unregister MODULE / start INTERVAL MULTIPLIER CATEGORY TYPE / stop / send CATEGORY N / threads / release
 // Writes a line for each of them when it is done, flushed at once ("threads" and the names of all), "update MODULE" and
 // "report MODULE" when a callback is called, "ended MODULE" when what it owns has ended.
-#include <dirent.h>
 
 #include <condition_variable>
 #include <cstdio>
@@ -22,6 +21,7 @@
 #include <string>
 
 #include "client/VelkReporting.h"
+#include "tests/integration/clients/HostItself.h"
 
 namespace {
 
@@ -98,7 +98,7 @@ class Host {
       words >> category >> n;
       _client->sendMessageWithCategory(category, 1, PropertyDictionary{{"n", n}});
     } else if (command == "threads") {
-      return say("threads" + threadNames());
+      return say("threads" + host::threadNames());
     } else if (command == "release") {
       _client.reset();
     }
@@ -116,18 +116,6 @@ class Host {
           service(statistics);
         });
     if (!registered) say("false");
-  }
-
-  static std::string threadNames() {
-    std::string names;
-    DIR* const tasks = opendir("/proc/self/task");
-    while (const dirent* task = readdir(tasks)) {
-      std::string name;
-      std::ifstream file(std::string("/proc/self/task/") + task->d_name + "/comm");
-      if (task->d_name[0] != '.' && std::getline(file, name)) names += " " + name;
-    }
-    closedir(tasks);
-    return names;
   }
 
   std::shared_ptr<VelkReporting> _client;

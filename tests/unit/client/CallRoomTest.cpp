@@ -2,27 +2,13 @@
 #include "ipc/CallBody.h"
 #include "ipc/FrameHeader.h"
 #include "ipc/MethodTable.h"
-#include "tests/unit/client/ClientFixture.h"
+#include "tests/unit/client/HeldQueueFixture.h"
 
 namespace velk::test {
 namespace {
 
-class CallRoomTest : public VelkReportingTest {
+class CallRoomTest : public HeldQueueTest {
  protected:
-  void SetUp() override {
-    _daemon.start();
-    _client = makeClient();
-    ASSERT_TRUE(_daemon.waitForCalls("setSessionInfo", 1));
-    // What is queued during a tick has its turn at once, without a byte leaving in between.
-    _client->registerPeriodicTaskForModule(1, true, false, [entered = _entered, leave = _leave](auto*) {
-      entered->signal();
-      leave->wait();
-    });
-    _client->startLogTimerWithInterval(3600, 0, 3, 4);
-    ASSERT_TRUE(_entered->waitFor(kPatience));
-  }
-  void TearDown() override { _leave->signal(); }
-
   static PropertyDictionary event(std::size_t textSize) {
     PropertyDictionary made = message(1);
     made.set("ParametersPayload", PropertyDictionary{{"text", std::string(textSize, 'x')}});
@@ -45,10 +31,6 @@ class CallRoomTest : public VelkReportingTest {
       EXPECT_TRUE(_client->sendMessageWithDictionary(event(size), &error)) << error.description;
     }
   }
-
-  const std::shared_ptr<Semaphore> _entered = std::make_shared<Semaphore>();
-  const std::shared_ptr<Semaphore> _leave = std::make_shared<Semaphore>();
-  std::shared_ptr<VelkReporting> _client;
 };
 
 TEST_F(CallRoomTest, ConfigurationWaitsForRoomBehindEventsThatJustFitted) {
@@ -59,7 +41,7 @@ TEST_F(CallRoomTest, ConfigurationWaitsForRoomBehindEventsThatJustFitted) {
     *states = enabled;
     answered->signal();
   });
-  _leave->signal();
+  letGo();
   ASSERT_TRUE(answered->waitFor(kPatience));
   EXPECT_EQ(*states, (PropertyArray{"splunk"})) << "the daemon is there, and reads";
   EXPECT_FALSE(_log.contains("Failed to get remote object proxy"));
@@ -70,7 +52,7 @@ TEST_F(CallRoomTest, ConfigurationWaitsForRoomBehindEventsThatJustFitted) {
 TEST_F(CallRoomTest, SharedDataWaitsForRoomBehindOtherCalls) {
   const PropertyDictionary large{{"text", std::string(900'000, 'x')}};
   for (int call = 0; call < 3; ++call) _client->updateSharedDataWithDictionary(large);
-  _leave->signal();
+  letGo();
   EXPECT_FALSE(flush(*_client));
   EXPECT_EQ(_daemon.count("updateSharedDataWithDictionary"), 3U) << "the daemon is there, and reads";
   EXPECT_FALSE(_log.contains("Failed to get remote object proxy"));

@@ -1,32 +1,12 @@
 // The bound on events that wait: it counts those that have not had their turn on the reporting queue, too, although a
 // daemon is there to take them.
 #include "client/EventOutbox.h"
-#include "tests/unit/client/ClientFixture.h"
+#include "tests/unit/client/HeldQueueFixture.h"
 
 namespace velk::test {
 namespace {
 
-class OutboxBoundTest : public VelkReportingTest {
- protected:
-  void SetUp() override {
-    _daemon.start();
-    _client = makeClient();
-    ASSERT_TRUE(_daemon.waitForCalls("setSessionInfo", 1));
-    // A tick holds the queue until its callbacks have returned; updates send nothing of their own.
-    _client->registerPeriodicTaskForModule(1, true, false, [entered = _entered, leave = _leave](auto*) {
-      entered->signal();
-      leave->wait();
-    });
-    _client->startLogTimerWithInterval(3600, 0, 3, 4);
-    ASSERT_TRUE(_entered->waitFor(kPatience));
-  }
-  void TearDown() override { letGo(); }
-  void letGo() { _leave->signal(); }
-
-  const std::shared_ptr<Semaphore> _entered = std::make_shared<Semaphore>();
-  const std::shared_ptr<Semaphore> _leave = std::make_shared<Semaphore>();
-  std::shared_ptr<VelkReporting> _client;
-};
+using OutboxBoundTest = HeldQueueTest;
 
 TEST_F(OutboxBoundTest, CountsWhatWaitsForTheReportingQueue) {
   constexpr int kEvents = 16'384;
