@@ -338,6 +338,7 @@ TEST_F(LifecycleTest, OverflowIsToldOnceADaemonIsThereHoweverOftenItGoes) {
     ASSERT_TRUE(_daemon.waitForCalls("sendMessageWithDictionary", taken)) << "what had not left would come back";
     _daemon.stop();
     ASSERT_TRUE(log.waitFor(texts::kConnectionInterrupted, refusedBefore));
+    awaitTurn();  // what had not left the connection takes its room again, before new events do
   }
 }
 
