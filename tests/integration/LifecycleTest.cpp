@@ -5,6 +5,7 @@
 
 #include <algorithm>
 
+#include "tests/integration/RawConnection.h"
 #include "tests/integration/Scenario.h"
 
 namespace velk::test {
@@ -16,6 +17,17 @@ Daemon::Options idleExit() {
   Daemon::Options options;
   options.arguments = {"--idle-exit", "1"};
   return options;
+}
+/// It goes up to a second later than it might.
+constexpr std::chrono::milliseconds kLongerThanIdle{2500};
+
+/// Opens a session with a daemon that leaves when idle. It takes a program its time to start, so somebody who says
+/// nothing is there until then.
+PropertyArray openInTime(const Daemon& daemon, std::unique_ptr<ControlledSession>& session) {
+  RawConnection bystander(daemon);
+  EXPECT_TRUE(bystander.isConnected());
+  session = std::make_unique<ControlledSession>(daemon);
+  return session->open(9, 1);
 }
 
 PropertyDictionary quickBag(const ReportingServer& server, const PropertyDictionary& more = {}) {
@@ -43,11 +55,9 @@ TEST(Lifecycle, LeavesOnlyAfterTheLastHelperLetGo) {
   ReportingServer server;
   server.setStorebag("heather", quickBag(server));
   Daemon daemon(server, idleExit());
-  {
-    ControlledSession session(daemon);
-    ASSERT_EQ(session.open(9, 1)[0], kSplunk);
-    EXPECT_EQ(session.finish(), 0);
-  }
+  std::unique_ptr<ControlledSession> session;
+  ASSERT_EQ(openInTime(daemon, session)[0], kSplunk);
+  EXPECT_EQ(session->finish(), 0);
   EXPECT_EQ(daemon.process().wait(), 0);
   EXPECT_TRUE(server.waitForEvents(2, {0})) << "start and health message had arrived before";
   EXPECT_EQ(daemon.log().countOnceThereAre(1, "releaseIPCTransactions: IPC transaction ended"), 1U);
@@ -57,29 +67,29 @@ TEST(Lifecycle, StaysWhileAConnectionIsOpen) {
   ReportingServer server;
   server.setStorebag("heather", quickBag(server));
   Daemon daemon(server, idleExit());
-  ControlledSession session(daemon);
-  ASSERT_EQ(session.open(9, 1)[0], kSplunk);
+  std::unique_ptr<ControlledSession> session;
+  ASSERT_EQ(openInTime(daemon, session)[0], kSplunk);
 
-  EXPECT_EQ(daemon.process().wait(std::chrono::milliseconds(2500)), std::nullopt);
-  EXPECT_EQ(session.call({{"method", "startConfigWithCompletionHandler"}})[0], kSplunk);
-  EXPECT_EQ(session.finish(), 0);
+  EXPECT_EQ(daemon.process().wait(kLongerThanIdle), std::nullopt);
+  EXPECT_EQ(session->call({{"method", "startConfigWithCompletionHandler"}})[0], kSplunk);
+  EXPECT_EQ(session->finish(), 0);
   EXPECT_EQ(daemon.process().wait(), 0);
 }
 
 TEST(Lifecycle, StaysWhileAPostIsUnderWay) {
   ReportingServer server;
   server.setStorebag("heather", quickBag(server));
-  TlsTestServer::Response late;
-  late.delay = std::chrono::seconds(4);
-  server.setPostResponse(late);
+  TlsTestServer::Response never;
+  never.silent = true;
+  server.setPostResponse(never);
   Daemon daemon(server, idleExit());
-  {
-    ControlledSession session(daemon);
-    ASSERT_EQ(session.open(9, 1)[0], kSplunk);
-    EXPECT_EQ(session.finish(), 0);
-  }
+  std::unique_ptr<ControlledSession> session;
+  ASSERT_EQ(openInTime(daemon, session)[0], kSplunk);
+  EXPECT_EQ(session->finish(), 0);
   ASSERT_TRUE(server.waitForPosts(2));
-  EXPECT_EQ(daemon.process().wait(std::chrono::milliseconds(2000)), std::nullopt);
+  EXPECT_EQ(daemon.process().wait(kLongerThanIdle), std::nullopt);
+  server.setPostResponse({});
+  server.tls().closeConnections();
   EXPECT_EQ(daemon.process().wait(), 0);
 }
 

@@ -11,6 +11,7 @@
 #include <filesystem>
 
 #include "platform/Semaphore.h"
+#include "tests/integration/RawConnection.h"
 #include "tests/integration/Scenario.h"
 
 namespace velk::test {
@@ -261,6 +262,9 @@ TEST_F(Upload, KilledClientsFreeTheirSlotsAtOnceAndTheDaemonInTheEnd) {
   TlsTestServer::Response silence;
   silence.silent = true;
   server.setPostResponse(silence);
+  // Somebody who says nothing is there until the first of them has started.
+  RawConnection bystander(daemon);
+  ASSERT_TRUE(bystander.isConnected());
   std::vector<std::unique_ptr<ControlledSession>> sessions;
   for (int number = 0; number < 5; ++number) {
     sessions.push_back(std::make_unique<ControlledSession>(daemon));
@@ -268,6 +272,7 @@ TEST_F(Upload, KilledClientsFreeTheirSlotsAtOnceAndTheDaemonInTheEnd) {
     sessions.back()->send(call(directory.write("log" + std::to_string(number), "text")));
   }
   ASSERT_TRUE(server.waitForPosts(5));
+  bystander.close();
   for (auto& session : sessions) session->kill();
   for (int number = 0; number < 5; ++number) {
     EXPECT_TRUE(daemon.log().waitForPart("invalidateReportingSession: ReportingdSession <ReportingdSession " +
