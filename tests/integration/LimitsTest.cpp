@@ -151,7 +151,7 @@ TEST(Limits, HundredSessionsAtOnceAreServed) {
     }
   }
   for (std::size_t i = 0; i < sessions.size(); ++i) {
-    EXPECT_NE(sessions[i]->reply(lines[i], std::chrono::seconds(200)).array("reply"), nullptr) << i;
+    ASSERT_NE(sessions[i]->reply(lines[i], std::chrono::seconds(200)).array("reply"), nullptr) << i;
   }
   EXPECT_TRUE(server.waitForEvents(sessions.size(), {7}, std::chrono::seconds(200)));
   for (auto& session : sessions) EXPECT_EQ(session->finish(), 0);
