@@ -94,8 +94,9 @@ class VELK_EXPORT VelkReporting : public std::enable_shared_from_this<VelkReport
 
   /// Has the daemon post what it batched for this session. Always true.
   bool flushMessages();
-  /// The same. The callback is called once, with what became of it: no error, the session's, or, with a line in the
-  /// log, the connection's when no daemon answers.
+  /// The same. The callback is called once, with no error or with why it failed. The error is always in
+  /// "VelkReportingErrorDomain"; its code is -1, also (with a line in the log) when the daemon could not be asked:
+  /// there is none, the connection ended, it was too slow; or the status of HTTP of a server that refused.
   void flushMessagesWithCompletion(FlushCallback completion);
   /// Marks the session as finished gracefully. Overtakes what is still queued, and awaits nothing. Lost, with a line in
   /// the log, when no daemon answers. The last release does the same behind what is queued.

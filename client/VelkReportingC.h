@@ -61,7 +61,7 @@ typedef void (*VelkReportingDestroyFunction)(void* context);
 
 /* ---- Errors ---- */
 
-/* Codes in kVelkReportingErrorDomain. The daemon's own errors are -1 or a status of HTTP. */
+/* Codes in kVelkReportingErrorDomain. The errors of a flush have others: see VelkReportingFlushCallback. */
 enum {
   kVelkReportingErrorNoSessionInfo = 2,
   kVelkReportingErrorInvalidClientType = 3, /* outside 5 to 30 */
@@ -262,7 +262,9 @@ VELK_EXPORT bool VelkReportingSendMessageWithDictionary(VelkReportingClient* cli
 
 /* Has the daemon post what it batched for this session. */
 VELK_EXPORT void VelkReportingFlushMessages(VelkReportingClient* client);
-/* Why it failed, or null. */
+/* Why it failed, or null. The error is always in kVelkReportingErrorDomain; its code is -1, also when the daemon could
+ * not be asked (there is none, the connection ended, it was too slow), or the status of HTTP of a server that refused.
+ * Its text says why. */
 typedef void (*VelkReportingFlushCallback)(const VelkReportingError* error, void* context);
 VELK_EXPORT void VelkReportingFlushMessagesWithCompletion(VelkReportingClient* client,
                                                           VelkReportingFlushCallback callback, void* context,
