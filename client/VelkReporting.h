@@ -94,9 +94,10 @@ class VELK_EXPORT VelkReporting : public std::enable_shared_from_this<VelkReport
 
   /// Has the daemon post what it batched for this session. Always true.
   bool flushMessages();
-  /// The same. The callback is called once, with no error or with why it failed. The error is always in
-  /// "VelkReportingErrorDomain"; its code is -1, also (with a line in the log) when the daemon could not be asked:
-  /// there is none, the connection ended, it was too slow; or the status of HTTP of a server that refused.
+  /// The same. The callback is called once, with no error or with why it failed, in the words, domain and code of who
+  /// found out: the session ("VelkReportingErrorDomain": -1, or the status of a server that refused), its transport, or
+  /// (with a line in the log) the connection, "VelkConnectionErrorDomain": 9 no daemon answers, 1 it went away before
+  /// it had answered, 2 it reads too slowly, 10 this process may not use its socket.
   void flushMessagesWithCompletion(FlushCallback completion);
   /// Marks the session as finished gracefully. Overtakes what is still queued, and awaits nothing. Lost, with a line in
   /// the log, when no daemon answers. The last release does the same behind what is queued.

@@ -262,9 +262,9 @@ VELK_EXPORT bool VelkReportingSendMessageWithDictionary(VelkReportingClient* cli
 
 /* Has the daemon post what it batched for this session. */
 VELK_EXPORT void VelkReportingFlushMessages(VelkReportingClient* client);
-/* Why it failed, or null. The error is always in kVelkReportingErrorDomain; its code is -1, also when the daemon could
- * not be asked (there is none, the connection ended, it was too slow), or the status of HTTP of a server that refused.
- * Its text says why. */
+/* Why it failed, or null, in the words, domain and code of who found out: the session (kVelkReportingErrorDomain: -1,
+ * or the status of a server that refused), its transport, or the connection, "VelkConnectionErrorDomain": 9 no daemon
+ * answers, 1 it went away before it had answered, 2 it reads too slowly, 10 this process may not use its socket. */
 typedef void (*VelkReportingFlushCallback)(const VelkReportingError* error, void* context);
 VELK_EXPORT void VelkReportingFlushMessagesWithCompletion(VelkReportingClient* client,
                                                           VelkReportingFlushCallback callback, void* context,

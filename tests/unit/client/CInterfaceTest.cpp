@@ -206,6 +206,22 @@ TEST_F(CInterfaceTest, CallbacksHearOfADaemonThatIsNotThere) {
   ASSERT_TRUE(context.destroyed.waitFor(kPatience));
   EXPECT_EQ(context.texts, (std::vector<std::string>{"none"}));
   EXPECT_NE(flushAndWait(client), "none");
+  struct Heard {
+    std::string domain;
+    int code = 0;
+    Semaphore over;
+  } heard;
+  VelkReportingFlushMessagesWithCompletion(
+      client,
+      [](const VelkReportingError* error, void* context) {
+        auto& told = *static_cast<Heard*>(context);
+        told.domain = VelkReportingErrorGetDomain(error);
+        told.code = VelkReportingErrorGetCode(error);
+      },
+      &heard, [](void* context) { static_cast<Heard*>(context)->over.signal(); });
+  ASSERT_TRUE(heard.over.waitFor(kPatience));
+  EXPECT_EQ(heard.domain, "VelkConnectionErrorDomain");
+  EXPECT_EQ(heard.code, 9) << "as the headers say";
 }
 
 TEST_F(CInterfaceTest, MessageBlockIsReplacedAndEndsWithTheClient) {
