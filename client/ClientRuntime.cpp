@@ -106,6 +106,11 @@ void ClientRuntime::addClient(std::weak_ptr<LeavingClient> client) {
   _clients.push_back(std::move(client));
 }
 
+bool ClientRuntime::hasClients() {
+  Guard guard(_lock);
+  return !std::all_of(_clients.begin(), _clients.end(), [](const auto& client) { return client.expired(); });
+}
+
 SteadyTime ClientRuntime::deadlineFor(Duration bound) const {
   return std::min(_loop.clock().steadyTime(), _exitBegun.load()) + bound;
 }

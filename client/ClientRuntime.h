@@ -54,6 +54,8 @@ class ClientRuntime {
 
   /// From now on `client` is asked to send what it has when the process exits.
   void addClient(std::weak_ptr<LeavingClient> client);
+  /// Whether a client is there, or has been released and is not over yet.
+  [[nodiscard]] bool hasClients();
   /// The latest moment to which a client with that bound may wait: counted from now or, once the process exits, from
   /// the beginning of that.
   [[nodiscard]] SteadyTime deadlineFor(Duration bound) const;
