@@ -79,10 +79,8 @@ std::size_t VelkReportingImplementation::sendHeldEventsWithin(SteadyTime deadlin
     turn == Turn::behindTicks ? _reporting->asyncAfter(pause, work) : _queue->asyncAfter(pause, work);
     if (!look->over.waitFor(deadline - clock.steadyTime())) return events;
     events = look->events;
-    if (!look->retriesAfter || (look->held == 0 && !look->connection)) return events;
+    if (look->held == 0 || !look->retriesAfter) return events;
     if (look->connection && !look->connection->waitUntilSent(deadline - clock.steadyTime())) return events;
-    // What a connection could not send any more is about to be held again.
-    if (look->held == 0 && !look->connection->hasFailedToSend()) return events;
     // One that takes nothing more may not know yet that it has ended.
     const bool isStuck = std::exchange(heldBefore, look->held) == look->held;
     pause = std::max(*look->retriesAfter, isStuck ? kStuckPause : Duration::zero());

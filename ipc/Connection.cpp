@@ -81,8 +81,6 @@ bool Connection::waitUntilSent(Duration timeout) { return _core->waitUntilSent(t
 
 void Connection::keepUnsent() { _core->keepsUnsent = true; }
 
-bool Connection::hasFailedToSend() const noexcept { return _core->hasFailedToSend(); }
-
 bool Connection::hasRoomForAnyCall() const noexcept { return _core->hasRoomForAnyCall(); }
 
 std::vector<PropertyArray> Connection::takeUnsentCalls(std::uint32_t method) { return _core->takeUnsentCalls(method); }

@@ -199,9 +199,6 @@ class Connection {
   /// (false). For a process about to exit; not on the loop's thread.
   [[nodiscard]] bool waitUntilSent(Duration timeout);
 
-  /// True once the peer reads no more, or the socket is closed: what had not left never will.
-  [[nodiscard]] bool hasFailedToSend() const noexcept;
-
   /// Whether a call of the largest size would be taken now.
   [[nodiscard]] bool hasRoomForAnyCall() const noexcept;
 

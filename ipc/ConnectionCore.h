@@ -37,10 +37,6 @@ class ConnectionCore : public std::enable_shared_from_this<ConnectionCore> {
   void sendReply(std::uint64_t serial, std::size_t count, BodyEncoder encode, bool prompt);
   void sendErrorReply(std::uint64_t serial, const Error& error, bool prompt);
   [[nodiscard]] bool waitUntilSent(Duration timeout);
-  [[nodiscard]] bool hasFailedToSend() noexcept {
-    Guard guard(_lock);
-    return _sendFailed;
-  }
   [[nodiscard]] bool hasRoomForAnyCall() const noexcept {
     return _outboxBytes.load() + kFrameHeaderBytes + kMaximumFrameBytes <= kMaximumOutboxBytes;
   }

@@ -325,16 +325,14 @@ class Host {
     return waitFor(child);
   }
 
-  /// A child that does nothing and lives until nobody writes to its input any more.
+  /// A child that does nothing until somebody ends it: its number.
   static std::string forkedForItself() {
     std::fflush(stdout);
     const pid_t child = fork();
     if (child < 0) return std::string(" fork: ") + std::strerror(errno);
-    if (child != 0) return "";
+    if (child != 0) return " " + std::to_string(child);
     alarm(kPatienceSeconds);
-    for (char byte = 0; read(STDIN_FILENO, &byte, 1) == 1;) {
-    }
-    _exit(0);
+    for (;;) pause();
   }
 
   /// Nothing, or how the child failed.
