@@ -67,10 +67,7 @@ std::string cut(const std::string& text) {
   // A signed configuration may hold text that no encoding allows.
   if (!isUtf8(text)) return "(not text)";
   if (text.size() <= kMaximumStatusTextBytes) return text;
-  std::size_t end = kMaximumStatusTextBytes;
-  const auto isContinuation = [](char byte) { return (static_cast<unsigned char>(byte) & 0xC0U) == 0x80U; };
-  while (isContinuation(text[end])) --end;
-  return text.substr(0, end) + "\u2026";
+  return std::string(utf8Prefix(text, kMaximumStatusTextBytes)) + "\u2026";
 }
 
 /// The row with every text in it cut.

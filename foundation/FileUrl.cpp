@@ -8,13 +8,6 @@ namespace {
 
 constexpr std::string_view kScheme = "file:";
 
-int hexadecimalDigit(char character) noexcept {
-  if (character >= '0' && character <= '9') return character - '0';
-  if (character >= 'a' && character <= 'f') return character - 'a' + 10;
-  if (character >= 'A' && character <= 'F') return character - 'A' + 10;
-  return -1;
-}
-
 /// The byte of the escape that `text` begins with; 0 when it begins with none that may be resolved.
 char escapedByte(std::string_view text) noexcept {
   if (text.size() < 3 || text[0] != '%') return 0;

@@ -28,6 +28,13 @@ namespace velk {
 /// How many UTF-16 code units well-formed UTF-8 takes.
 [[nodiscard]] std::size_t utf16Length(std::string_view text) noexcept;
 
+/// The value of a hexadecimal digit of either case; -1 when it is none.
+[[nodiscard]] constexpr int hexadecimalDigit(char character) noexcept {
+  if (character >= '0' && character <= '9') return character - '0';
+  if (character >= 'a' && character <= 'f') return character - 'a' + 10;
+  if (character >= 'A' && character <= 'F') return character - 'A' + 10;
+  return -1;
+}
 /// Lower-case hexadecimal, two digits a byte.
 [[nodiscard]] std::string hexadecimal(std::span<const std::uint8_t> bytes);
 

@@ -25,10 +25,7 @@ std::string describe(const PeerCredentials& peer) {
 /// Error texts end up in frames, which hold only so much and only UTF-8.
 std::string wireText(std::string_view text) {
   if (!isUtf8(text)) return "(a text that is not UTF-8)";
-  if (text.size() <= kMaximumErrorTextBytes) return std::string(text);
-  std::size_t end = kMaximumErrorTextBytes;
-  while (end > 0 && (static_cast<unsigned char>(text[end]) & 0xC0U) == 0x80U) --end;
-  return std::string(text.substr(0, end));
+  return std::string(utf8Prefix(text, kMaximumErrorTextBytes));
 }
 
 }  // namespace

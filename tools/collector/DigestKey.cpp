@@ -13,13 +13,6 @@ namespace {
 
 constexpr std::size_t kMaximumKeyBytes = 64 * 1024;
 
-int hexadecimalDigit(char digit) {
-  if (digit >= '0' && digit <= '9') return digit - '0';
-  if (digit >= 'a' && digit <= 'f') return digit - 'a' + 10;
-  if (digit >= 'A' && digit <= 'F') return digit - 'A' + 10;
-  return -1;
-}
-
 bool isHexadecimal(std::string_view text) {
   return !text.empty() && text.size() % 2 == 0 &&
          std::all_of(text.begin(), text.end(), [](char digit) { return hexadecimalDigit(digit) >= 0; });

@@ -5,6 +5,7 @@
 #include <filesystem>
 #include <system_error>
 
+#include "foundation/Text.h"
 #include "foundation/Uuid.h"
 #include "platform/Files.h"
 
@@ -17,19 +18,12 @@ constexpr std::string_view kUploadPath = "/upload";
 constexpr int kNoRoom = 507;
 constexpr const char* kErrorDomain = "upload";
 
-int digitValue(char character) {
-  if (character >= '0' && character <= '9') return character - '0';
-  if (character >= 'a' && character <= 'f') return character - 'a' + 10;
-  if (character >= 'A' && character <= 'F') return character - 'A' + 10;
-  return -1;
-}
-
 std::string unescaped(std::string_view text) {
   std::string plain;
   for (std::size_t at = 0; at < text.size(); ++at) {
     const bool isEscape = text[at] == '%' && at + 2 < text.size();
-    const int high = isEscape ? digitValue(text[at + 1]) : -1;
-    const int low = isEscape ? digitValue(text[at + 2]) : -1;
+    const int high = isEscape ? hexadecimalDigit(text[at + 1]) : -1;
+    const int low = isEscape ? hexadecimalDigit(text[at + 2]) : -1;
     if (high < 0 || low < 0) {
       plain += text[at];
     } else {
