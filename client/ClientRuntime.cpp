@@ -108,7 +108,7 @@ void ClientRuntime::addClient(std::weak_ptr<LeavingClient> client) {
 
 bool ClientRuntime::hasClients() {
   Guard guard(_lock);
-  return !std::all_of(_clients.begin(), _clients.end(), [](const auto& client) { return client.expired(); });
+  return std::any_of(_clients.begin(), _clients.end(), [](const auto& client) { return !client.expired(); });
 }
 
 SteadyTime ClientRuntime::deadlineFor(Duration bound) const {

@@ -47,8 +47,12 @@ void VelkReportingImplementation::leave(const void* client, SteadyTime deadline)
     done->signal();
   });
   if (!done->waitFor(deadline - clock.steadyTime())) return;
+  waitForConnection(deadline);
+}
+
+void VelkReportingImplementation::waitForConnection(SteadyTime deadline) const {
   const auto connection = _link->current();
-  const Duration left = deadline - clock.steadyTime();
+  const Duration left = deadline - _runtime.loop().clock().steadyTime();
   if (connection && left > Duration::zero()) static_cast<void>(connection->waitUntilSent(left));
 }
 
@@ -100,7 +104,7 @@ void VelkReportingImplementation::finishAndClose(const void* client, SteadyTime 
   if (lost != 0) log::error(texts::kEventsAreLost, lost);
   reportOverflow();
   log::standard(texts::kAboutToDealloc, client);
-  if (!finishSessionNow()) log::standard(texts::kFinishSessionProxyFailure, "no daemon answers");
+  finishSessionNow();
   _aggregation->releaseAggregationBlock();
   setLoggingBlock(nullptr);
   _link->close(deadline - _runtime.loop().clock().steadyTime());
@@ -132,9 +136,7 @@ void VelkReportingImplementation::sendBeforeExit(SteadyTime begun) {
   const std::size_t lost = sendHeldEventsWithin(deadline, Turn::pastTicks);
   if (lost != 0) log::error("aboutToExit: %u events are lost: no daemon takes them", lost);
   reportOverflow();
-  const auto connection = _link->current();
-  const Duration left = deadline - clock.steadyTime();
-  if (connection && left > Duration::zero()) static_cast<void>(connection->waitUntilSent(left));
+  waitForConnection(deadline);
 }
 
 }  // namespace velk

@@ -11,7 +11,6 @@ inline constexpr std::string_view kClientTypeIsInvalid = "validateSessionInfo: c
 inline constexpr std::string_view kClientStartsLogging = "startLogging: Client starts logging...";
 inline constexpr std::string_view kSessionDisabled = "initWithSessionInfo: the session is disabled";
 inline constexpr std::string_view kNotEntitled = "initWithSessionInfo: IPC not entitled, %d";
-inline constexpr std::string_view kEventsAreLost = "aboutToDealloc: %u events are lost: no daemon takes them";
 inline constexpr std::string_view kFailedToConnect = "initWithSessionInfo: Failed to connect to daemon";
 inline constexpr std::string_view kFailedToCreateQueue = "initWithSessionInfo: Failed to create reporting queue";
 inline constexpr std::string_view kNoThread =
@@ -89,6 +88,7 @@ inline constexpr std::string_view kAggregationBlockWasSlow =
     "sendMessageToClient: %u events were dropped: the aggregation block is slower than they come";
 inline constexpr std::string_view kAboutToDealloc =
     "aboutToDealloc: VelkReporting client session %p is about to dealloc";
+inline constexpr std::string_view kEventsAreLost = "aboutToDealloc: %u events are lost: no daemon takes them";
 
 // Periodic tasks
 inline constexpr std::string_view kRegisteredModule = "registerPeriodicTaskForModule: %u,%s update,%s reporting";

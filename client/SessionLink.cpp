@@ -61,7 +61,7 @@ SessionLink::SessionLink(ClientRuntime& runtime, std::shared_ptr<Queue> queue, S
 void SessionLink::open(std::function<void(UnsentEvents)> whenLost) {
   _whenLost = std::move(whenLost);
   _queue->async([self = shared_from_this()] {
-    if (!self->_isClosed && !self->tryToConnect() && self->_description.hasAggregationBlock) self->reconnectLater();
+    if (!self->tryToConnect() && self->_description.hasAggregationBlock) self->reconnectLater();
   });
 }
 
@@ -84,8 +84,6 @@ std::shared_ptr<Connection> SessionLink::tryToConnect() {
   _connectedAt = now();
   setCurrent(connection);
   describeSession(connection);
-  // From here on the queue deals with what comes: the first time this is another thread, which touches nothing of the
-  // queue's any more.
   connection->resume();
   return connection;
 }
@@ -194,9 +192,9 @@ void SessionLink::wasInvalidated(Connection& connection) {
 }
 
 void SessionLink::wasLost(Connection& connection) {
-  auto unsent = unsentEvents(connection);
   if (const auto latest = current(); latest && latest->core() == connection.core()) forgetConnection();
-  _whenLost(std::move(unsent));
+  if (_isClosed) return reportLoss(connection);
+  _whenLost(unsentEvents(connection));
   reconnectLater();
 }
 

@@ -49,7 +49,8 @@ class SessionLink : public std::enable_shared_from_this<SessionLink> {
 
   /// Queues the first attempt to connect: whoever creates a client does not wait for a daemon whose own queue is full.
   /// Any thread, before anything else is on the queue. Fine when nobody answers. `whenLost` runs on the queue, each
-  /// time that a connection was lost, with the events that had not left it, oldest first.
+  /// time that a connection was lost, with the events that had not left it, oldest first;
+  /// once the link is closed the log hears of them instead.
   void open(std::function<void(UnsentEvents)> whenLost);
 
   /// A connection that works, made now if need be; null when nobody answers. After an attempt that failed, or a
@@ -100,7 +101,7 @@ class SessionLink : public std::enable_shared_from_this<SessionLink> {
   mutable Lock _lock;
   std::shared_ptr<Connection> _connection VELK_GUARDED_BY(_lock);
 
-  // On the reporting queue (and in `open`, before it has work).
+  // On the reporting queue (and in `open`, before anything is on it).
   SessionDescription _description;
   std::function<void(UnsentEvents)> _whenLost;
   bool _isClosed = false;

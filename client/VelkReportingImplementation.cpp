@@ -182,10 +182,6 @@ void VelkReportingImplementation::reportOverflow() {
 
 /// What had not left goes to the front again, the oldest first.
 void VelkReportingImplementation::connectionWasLost(SessionLink::UnsentEvents unsent) {
-  if (_isFinished) {
-    if (!unsent.empty()) log::error(texts::kEventsAreLost, unsent.size());
-    return;
-  }
   for (auto event = unsent.rbegin(); event != unsent.rend(); ++event) {
     const std::size_t size = estimatedSize(*event);
     if (_outbox.reserve(size)) _outbox.held.push_front({std::move(*event), size, nullptr});
@@ -194,18 +190,15 @@ void VelkReportingImplementation::connectionWasLost(SessionLink::UnsentEvents un
 }
 
 void VelkReportingImplementation::finishSession() {
-  if (finishSessionNow()) return;
+  if (_link->current()) return finishSessionNow();
   // The first connection may be about to be made.
-  _queue->async([self = shared_from_this()] {
-    if (!self->finishSessionNow()) log::standard(texts::kFinishSessionProxyFailure, "no daemon answers");
-  });
+  _queue->async([self = shared_from_this()] { self->finishSessionNow(); });
 }
 
-bool VelkReportingImplementation::finishSessionNow() {
+void VelkReportingImplementation::finishSessionNow() {
   const auto connection = _link->current();
-  if (!connection) return false;
+  if (!connection) return log::standard(texts::kFinishSessionProxyFailure, "no daemon answers");
   SessionInterfaceProxy(connection, loggingHandler(texts::kFinishSessionProxyFailure)).finishSessionGracefully();
-  return true;
 }
 
 void VelkReportingImplementation::setMessageSentDelegate(std::weak_ptr<VelkReportingMessageSentDelegate> delegate,

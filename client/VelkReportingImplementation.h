@@ -44,7 +44,8 @@ class VelkReportingImplementation final : public LeavingClient,
 
   VelkReportingImplementation(ClientRuntime& runtime, SessionDescription description,
                               VelkReportingAggregationBlock aggregationBlock);
-  /// Connects; on the creator's thread, once, before anything else. `client` is the object that this stands behind.
+  /// Begins to connect; on the creator's thread, once, before anything else. `client` is the object that this stands
+  /// behind.
   void open(std::weak_ptr<VelkReporting> client);
   /// False only for what was left half made, for want of memory: it has no end either.
   [[nodiscard]] bool isOpen() const noexcept { return _periodicTasks != nullptr; }
@@ -131,8 +132,9 @@ class VelkReportingImplementation final : public LeavingClient,
   void connectionWasLost(SessionLink::UnsentEvents unsent);
   void leave(const void* client, SteadyTime deadline);
   void finishAndClose(const void* client, SteadyTime deadline);
-  /// False when there is no connection.
-  [[nodiscard]] bool finishSessionNow();
+  void finishSessionNow();
+  /// Until everything sent has been handed to the system, and no longer.
+  void waitForConnection(SteadyTime deadline) const;
   [[nodiscard]] std::size_t heldEvents() const;
   void fetchDisplayURL(const std::shared_ptr<Connection>& connection);
   void logText(const std::string& text);

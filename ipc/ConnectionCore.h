@@ -106,7 +106,7 @@ class ConnectionCore : public std::enable_shared_from_this<ConnectionCore> {
   void pump(Sender self);
   [[nodiscard]] bool refillSending(Sender self);
   void sendingFailed();
-  void keepUnsentLocked(Outbox& waiting) VELK_REQUIRES(_lock);
+  void failSendingLocked() VELK_REQUIRES(_lock);
   void bytesLeft(std::size_t count);
   void resumeDelivery();
 

@@ -270,14 +270,10 @@ void ConnectionCore::endHere() {
 /// Stops sending: what is still here never leaves. On the loop's thread, where the sender of such a connection works.
 std::vector<PropertyArray> ConnectionCore::takeUnsentCalls(std::uint32_t method) {
   std::vector<std::uint8_t> frames;
-  Outbox waiting;
   {
     Guard guard(_lock);
-    _sendFailed = true;
-    std::swap(waiting, _outbox);
-    keepUnsentLocked(waiting);
+    failSendingLocked();
     frames.swap(_unsent);
-    _outboxBytes = 0;
   }
   _allSent.notifyAll();
   std::vector<PropertyArray> calls;

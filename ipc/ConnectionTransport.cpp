@@ -166,25 +166,26 @@ bool ConnectionCore::refillSending(Sender self) {
   return false;
 }
 
-/// What the sender was at, then what waited behind it. By the sender, or where there is none.
-void ConnectionCore::keepUnsentLocked(Outbox& waiting) {
-  for (Outbox* const outbox : {&_sending, &waiting}) {
-    const auto frames = outbox->unsentFrames();
-    if (keepsUnsent) _unsent.insert(_unsent.end(), frames.begin(), frames.end());
+/// Nothing leaves any more: neither what the sender was at nor what waited behind it. By the sender, or where there is
+/// none.
+void ConnectionCore::failSendingLocked() {
+  _sendFailed = true;
+  for (Outbox* const outbox : {&_sending, &_outbox}) {
+    if (keepsUnsent) {
+      const auto frames = outbox->unsentFrames();
+      _unsent.insert(_unsent.end(), frames.begin(), frames.end());
+    }
     outbox->clear();
   }
+  _outboxBytes = 0;
 }
 
 /// The peer reads no more. What it had sent before may still wait in the socket, so reading goes on.
 void ConnectionCore::sendingFailed() {
-  Outbox dropped;
   {
     Guard guard(_lock);
-    _sendFailed = true;
-    std::swap(dropped, _outbox);
-    keepUnsentLocked(dropped);
+    failSendingLocked();
     _sender = Sender::nobody;
-    _outboxBytes = 0;
   }
   _allSent.notifyAll();
   resumeDelivery();
@@ -222,7 +223,6 @@ void ConnectionCore::closeWhenSent(Duration drainTime) {
 
 void ConnectionCore::closeNow() {
   if (_closed) return;
-  Outbox dropped;
   {
     Guard guard(_lock);
     if (_sender == Sender::deliveryQueue) {
@@ -230,12 +230,9 @@ void ConnectionCore::closeNow() {
       return shutDownLocalSocket(_socket.get());
     }
     _closed = true;
-    _sendFailed = true;
     _accepting = false;
+    failSendingLocked();
     _sender = Sender::nobody;
-    std::swap(dropped, _outbox);
-    keepUnsentLocked(dropped);
-    _outboxBytes = 0;
   }
   _watch.reset();
   _socketStays.reset();
