@@ -31,6 +31,17 @@ class HttpLinesTest : public HttpSessionTest {
     for (const auto& server : _slow) ASSERT_TRUE(server->waitForRequests(1));
   }
 
+  /// Twenty such requests, of which a server is asked eight at once; `bulk` is one like them.
+  void startBulkThatIsNeverAnswered(HttpRequest& bulk) {
+    _server.setHandler([](const TlsTestServer::Request& request) {
+      return TlsTestServer::Response{.silent = request.target == "/bulk"};
+    });
+    bulk = request("/bulk");
+    bulk.isBulk = true;
+    for (int number = 0; number < 20; ++number) start(bulk, std::to_string(number));
+    ASSERT_TRUE(_server.waitForRequests(8));
+  }
+
  private:
   std::vector<std::unique_ptr<TlsTestServer>> _slow;
 };
@@ -94,26 +105,16 @@ TEST_F(HttpLinesTest, ATaskInLineEndsAtItsTimeout) {
 }
 
 TEST_F(HttpLinesTest, BulkStandsInALineOfItsOwn) {
-  _server.setHandler([](const TlsTestServer::Request& request) {
-    return TlsTestServer::Response{.silent = request.target == "/bulk"};
-  });
-  auto bulk = request("/bulk");
-  bulk.isBulk = true;
-  for (int number = 0; number < 20; ++number) start(bulk, std::to_string(number));
-  ASSERT_TRUE(_server.waitForRequests(8));
+  HttpRequest bulk;
+  ASSERT_NO_FATAL_FAILURE(startBulkThatIsNeverAnswered(bulk));
   EXPECT_FALSE(fetch(request("/small")).error);
   EXPECT_EQ(_delegate->completed, 1);
   EXPECT_EQ(_server.requests().size(), 9U) << "no more of the bulk either";
 }
 
 TEST_F(HttpLinesTest, TheEndOfBulkEndsItWhereverItIsAndNothingElse) {
-  _server.setHandler([](const TlsTestServer::Request& request) {
-    return TlsTestServer::Response{.silent = request.target == "/bulk"};
-  });
-  auto bulk = request("/bulk");
-  bulk.isBulk = true;
-  for (int number = 0; number < 20; ++number) start(bulk, std::to_string(number));
-  ASSERT_TRUE(_server.waitForRequests(8));
+  HttpRequest bulk;
+  ASSERT_NO_FATAL_FAILURE(startBulkThatIsNeverAnswered(bulk));
   _service->endBulk();
   ASSERT_TRUE(waitForCompletions(20));
   start(bulk, "later");
