@@ -256,7 +256,7 @@ void HTTPSPostBackend::postJSONMessage(std::string json, std::uint32_t flag, std
     completion(errorObject(backend_texts::kPostURLMissing, kReportingError));
     return;
   }
-  if (const auto sender = transport()) sender->waitForRoom();
+  if (const auto sender = transport()) sender->waitForRoom(0);
   auto compressed = gzipDeflate(std::string_view(json));
   const bool isCompressed = compressed && !compressed->empty() && compressed->size() < json.size();
   const auto plain = std::make_shared<const std::string>(std::move(json));

@@ -23,9 +23,9 @@ class ReportingSessionConnectivityInterface {
   virtual ~ReportingSessionConnectivityInterface() = default;
   /// Asynchronous; the completion runs on the transport's own queue. Any thread; never blocks.
   virtual void postURLRequestWithCompletionHandler(HttpRequest request, HttpCompletion completion) = 0;
-  /// For senders of events, before they build the next request: waits while too many are under way. Never call it with
-  /// the agent's lock held.
-  virtual void waitForRoom() {}
+  /// For senders of events, before they build the next request: waits while too many of `sender` are under way. Never
+  /// call it with the agent's lock held.
+  virtual void waitForRoom(std::uint64_t /*sender*/) {}
 };
 
 /// The agent, as the transport knows it.

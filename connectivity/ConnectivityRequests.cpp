@@ -32,7 +32,7 @@ std::string nextTaskDescription() {
 
 Lock ReportingSessionConnectivityHelper::classLock;
 
-void ReportingSessionConnectivityHelper::waitForRoom() { _window->waitForRoom(); }
+void ReportingSessionConnectivityHelper::waitForRoom(std::uint64_t /*sender*/) { _window->waitForRoom(); }
 
 void ReportingSessionConnectivityHelper::postURLRequestWithCompletionHandler(HttpRequest request,
                                                                              HttpCompletion completion) {

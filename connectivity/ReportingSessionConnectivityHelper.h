@@ -80,7 +80,7 @@ class ReportingSessionConnectivityHelper : public ReportingSessionConnectivityIn
   /// Dropped, completion uncalled: on an inactive helper, in a mode for pulls, when no task could be made.
   void postURLRequestWithCompletionHandler(HttpRequest request, HttpCompletion completion) override;
   /// Waits while RequestWindow::kMaximumRequests are under way; not once the helper has been invalidated.
-  void waitForRoom() override;
+  void waitForRoom(std::uint64_t sender) override;
   /// Dropped, completion uncalled: an address that this helper has been asked for before, finished or not.
   /// Urgent pulls start at once, others after a random delay of less than two hours.
   void getURLRequestWithCompletionHandler(HttpRequest request, bool isUrgent, HttpCompletion completion);

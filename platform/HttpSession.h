@@ -37,6 +37,10 @@ struct HttpRequest {
   bool requiresHttps = true;
   /// Large and patient: it stands in a line of its own, so that small requests to the same server go on beside it.
   bool isBulk = false;
+  /// Stands in no line: a thread waits for the answer.
+  bool isUrgent = false;
+  /// The session that sends it. Requests of different senders to one server take turns. 0: no particular sender.
+  std::uint64_t sender = 0;
   /// Where this is less than what the session's configuration says, it is the bound for the answer.
   std::optional<std::size_t> maximumResponseBytes;
 

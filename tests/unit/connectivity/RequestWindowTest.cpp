@@ -75,7 +75,7 @@ class HelperWindow : public ConnectivityHelperTest {
 TEST_F(HelperWindow, DroppedRequestsTakeNoRoom) {
   const auto helper = make(4);
   post(helper, 200);
-  helper->waitForRoom();  // would never return
+  helper->waitForRoom(0);  // would never return
 }
 
 TEST_F(HelperWindow, AnsweredAndFailedRequestsLeaveIt) {
@@ -83,7 +83,7 @@ TEST_F(HelperWindow, AnsweredAndFailedRequestsLeaveIt) {
   post(helper, static_cast<int>(RequestWindow::kMaximumRequests));
   http.startedTasks().front()->complete();
   scheduler().runUntilIdle();
-  helper->waitForRoom();
+  helper->waitForRoom(0);
   for (const auto& task : http.startedTasks()) {
     if (task != http.startedTasks().front()) task->complete();
   }
