@@ -39,11 +39,16 @@ if(NOT CMAKE_CXX_COMPILER_ID STREQUAL "GNU" OR CMAKE_BUILD_TYPE STREQUAL "Releas
 endif()
 set(VELK_PRECOMPILED_HEADERS <algorithm> <array> <atomic> <chrono> <cstdint> <deque> <functional> <map> <memory>
     <optional> <ranges> <span> <string> <string_view> <unordered_map> <utility> <variant> <vector>)
-# A target that compiles the headers once, for others of the same compiler options: velk_precompile(name HEADER ...)
-function(velk_precompile name)
+# A target that compiles the headers once, for others of its kind: velk_precompile(name LIBRARY|PROGRAM HEADER ...)
+# gcc takes no header that was compiled for a library into a program's file, nor the other way round.
+function(velk_precompile name kind)
   if(VELK_PRECOMPILE)
-    file(WRITE ${CMAKE_BINARY_DIR}/${name}.cpp "")
-    add_library(${name} OBJECT ${CMAKE_BINARY_DIR}/${name}.cpp)
+    file(CONFIGURE OUTPUT ${CMAKE_BINARY_DIR}/${name}.cpp CONTENT "int main() {}\n")
+    if(kind STREQUAL "PROGRAM")
+      add_executable(${name} ${CMAKE_BINARY_DIR}/${name}.cpp)
+    else()
+      add_library(${name} OBJECT ${CMAKE_BINARY_DIR}/${name}.cpp)
+    endif()
     # ccache wants it.
     target_compile_options(${name} PRIVATE -fpch-preprocess)
     target_precompile_headers(${name} PRIVATE ${ARGN})
@@ -55,7 +60,7 @@ function(velk_use_precompiled target name)
     target_precompile_headers(${target} REUSE_FROM ${name})
   endif()
 endfunction()
-velk_precompile(velk_precompiled ${VELK_PRECOMPILED_HEADERS})
+velk_precompile(velk_precompiled LIBRARY ${VELK_PRECOMPILED_HEADERS})
 
 # The current folder (and its linux/ half) as a static library:
 # velk_library(name [EXCLUDE main.cpp] LINKS ... [COMPACT [FAST ...] [SMALL ...]])
