@@ -14,6 +14,7 @@
 #include <string>
 #include <vector>
 
+#include "backends/ClientEntryMatching.h"
 #include "backends/EventBatch.h"
 #include "backends/EventFilter.h"
 #include "backends/VelkReportingBackend.h"
@@ -74,6 +75,7 @@ class HTTPSPostBackend final : public VelkReportingBackend {
                                         const std::string* serviceName);
   void expedite(const PropertyArray& clients, const std::string* clientName, const std::string* serviceName);
   void configureWithoutUserInfo(const PropertyArray& clients);
+  [[nodiscard]] bool isUsable(const std::optional<WrongType>& wrong) const;
   [[nodiscard]] bool passesConsent(const PropertyDictionary& entry);
   [[nodiscard]] bool passesPlaceAndDevice(const PropertyDictionary& entry, const std::string* countryCode) const;
   [[nodiscard]] bool takesFilters(const PropertyDictionary& entry);

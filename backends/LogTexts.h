@@ -32,6 +32,8 @@ inline constexpr const char* kNotInDeviceWhitelist =
 inline constexpr const char* kInDeviceBlacklist =
     "HTTPSPostBackend(updateBackendState): (%s) is in device blacklist %s";
 inline constexpr const char* kFiltersRequired = "HTTPSPostBackend(updateBackendState): filters are required.";
+inline constexpr const char* kWrongType =
+    "HTTPSPostBackend(updateBackendState): %s: \"%s\" of a client entry must be %s, so the entry applies to nothing";
 inline constexpr const char* kSamplingThresholdChanged =
     "HTTPSPostBackend(updateBackendState): sampling threshold for %s changed from %.02f to %.02f";
 inline constexpr const char* kClientFound =
