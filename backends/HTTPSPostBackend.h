@@ -118,7 +118,7 @@ class HTTPSPostBackend final : public VelkReportingBackend {
   bool _forceEventLogging = false;
 
   // Guarded by the state queue.
-  const std::shared_ptr<EventBatch> _batch = std::make_shared<EventBatch>();
+  const std::shared_ptr<EventBatch> _batch = std::make_shared<EventBatch>(_context.batchMemory);
 
   // Used on the owning session's queue only.
   std::optional<std::string> _postURL;

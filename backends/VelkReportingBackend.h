@@ -16,6 +16,7 @@
 #include <string_view>
 
 #include "backends/BackendStateHandle.h"
+#include "backends/BatchMemory.h"
 #include "backends/DottedVersion.h"
 #include "backends/ProcessUploads.h"
 #include "connectivity/ConnectivityInterface.h"
@@ -49,6 +50,7 @@ struct BackendContext {
   /// On a disk with room for what is too large for memory. What is kept there has no name.
   std::string largeFilesDirectory = "/var/tmp";
   std::shared_ptr<ProcessUploads> uploads = std::make_shared<ProcessUploads>();
+  std::shared_ptr<BatchMemory> batchMemory = std::make_shared<BatchMemory>();
 };
 
 /// A file that a client hands over for upload.
