@@ -228,7 +228,8 @@ void HTTPSPostBackend::resetBackendStateWithClient(const PropertyDictionary* ent
 void HTTPSPostBackend::takeCustomIdentifier(const PropertyDictionary& entry, const std::string* clientName,
                                             const std::string* serviceName) {
   if (!entry.contains("custom_clientId")) return;
-  _uuidCustom = getPersistentIdentifierForCustomClientIDSuffix(_context.platform.defaults, clientName, serviceName);
+  _uuidCustom = _context.identifiers->getPersistentIdentifierForCustomClientIDSuffix(_context.platform.defaults,
+                                                                                     clientName, serviceName);
 }
 
 bool HTTPSPostBackend::updatePostLink(const PropertyDictionary& entry) {

@@ -41,6 +41,14 @@ inline constexpr const char* kClientFound =
 inline constexpr const char* kEventWhitelist = "HTTPSPostBackend(updateBackendState): %s: eventWhitelist=%@";
 inline constexpr const char* kEventBlacklist = "HTTPSPostBackend(updateBackendState): %s: eventBlacklist=%@";
 
+inline constexpr const char* kPersistentIdentifierForCustomClientIDSuffix =
+    "getPersistentIdentifierForCustomClientIDSuffix: The value for %s: %s";
+inline constexpr const char* kIdentifierNameTooLong =
+    "getPersistentIdentifierForCustomClientIDSuffix: a client or service name is longer than %d bytes, so identifiers "
+    "of such names are not kept";
+inline constexpr const char* kTooManyIdentifiers =
+    "getPersistentIdentifierForCustomClientIDSuffix: %d identifiers are stored, further ones are not kept";
+
 // Sending and batching.
 inline constexpr const char* kNoMessage = "HTTPSPostBackend(sendMessage): SESSION_TYPE_STOP message dictionary is nil";
 inline constexpr const char* kAddingStopFields =

@@ -17,6 +17,7 @@
 
 #include "backends/BackendStateHandle.h"
 #include "backends/BatchMemory.h"
+#include "backends/ClientIdentifiers.h"
 #include "backends/DottedVersion.h"
 #include "backends/ProcessUploads.h"
 #include "connectivity/ConnectivityInterface.h"
@@ -51,6 +52,7 @@ struct BackendContext {
   std::string largeFilesDirectory = "/var/tmp";
   std::shared_ptr<ProcessUploads> uploads = std::make_shared<ProcessUploads>();
   std::shared_ptr<BatchMemory> batchMemory = std::make_shared<BatchMemory>();
+  std::shared_ptr<ClientIdentifiers> identifiers = std::make_shared<ClientIdentifiers>();
 };
 
 /// A file that a client hands over for upload.
