@@ -99,6 +99,8 @@ inline constexpr const char* kNoServerIP = "DashboardBackend(initWithName): can'
 inline constexpr const char* kNoServerPort = "DashboardBackend(initWithName): can't resolve server port";
 inline constexpr const char* kSocketFailed = "DashboardBackend(initWithName): socket() failed (%d)";
 inline constexpr const char* kAllNullParameters = "DashboardBackend(initWithName): initWitName with all null params.";
+inline constexpr const char* kNoServerAddress =
+    "DashboardBackend(initWithName): '%s' is no IPv4 address, so no datagrams are sent";
 inline constexpr const char* kConnectFailed = "DashboardBackend(initWithName): socket connect() failed.";
 inline constexpr const char* kNoTimerSource = "DashboardBackend(initWithName): can't create timer source.";
 inline constexpr const char* kCannotBind = "DashboardBackend(useReliableUDP): can't bind socket, %d";
