@@ -33,7 +33,7 @@ bool EventBatch::countReaches(const PropertyValue* method, std::int32_t threshol
 EventBatch::Appended EventBatch::append(PropertyDictionary event) {
   _exists = true;
   const std::uint64_t size = memoryEstimate(event);
-  if (_bytes + size > kMaximumBytes) return std::exchange(_refused, true) ? Appended::stillFull : Appended::full;
+  if (!_memory->take(size, _bytes)) return std::exchange(_refused, true) ? Appended::stillFull : Appended::full;
   _bytes += size;
   _events.push_back(std::move(event));
   return Appended::kept;
@@ -42,7 +42,7 @@ EventBatch::Appended EventBatch::append(PropertyDictionary event) {
 std::vector<PropertyDictionary> EventBatch::take() {
   _exists = false;
   _refused = false;
-  _bytes = 0;
+  _memory->giveBack(std::exchange(_bytes, 0));
   return std::exchange(_events, {});
 }
 

@@ -4,23 +4,28 @@
 
 #include <cstddef>
 #include <cstdint>
+#include <memory>
 #include <string>
 #include <unordered_map>
+#include <utility>
 #include <vector>
 
+#include "backends/BatchMemory.h"
 #include "foundation/PropertyValue.h"
 
 namespace velk {
 
 class EventBatch {
  public:
-  /// A batch never holds more than this (estimated): further events are refused until it is emptied. An ordinary batch
-  /// stays below a thousandth of it; only a session that can neither post nor discard comes here.
-  static constexpr std::uint64_t kMaximumBytes = 64U * 1024 * 1024;
   /// So many methods are counted; further ones never reach a threshold by themselves.
   static constexpr std::size_t kMaximumCounters = 65'536;
 
   enum class Appended : std::uint8_t { kept, full, stillFull };
+
+  explicit EventBatch(std::shared_ptr<BatchMemory> memory) : _memory(std::move(memory)) {}
+  ~EventBatch() { _memory->giveBack(_bytes); }
+  EventBatch(const EventBatch&) = delete;
+  EventBatch& operator=(const EventBatch&) = delete;
 
   /// From the first event, kept or not, to the next `take` or `discard`.
   [[nodiscard]] bool exists() const noexcept { return _exists; }
@@ -30,6 +35,8 @@ class EventBatch {
   [[nodiscard]] bool countReaches(const PropertyValue* method, std::int32_t threshold);
   void clearCounters() { _counters.clear(); }
 
+  /// Refuses an event for which the batches of the process have no room (estimated), until this one is emptied or
+  /// others are. An ordinary batch holds some kilobytes; only one that can neither post nor discard comes here.
   /// `stillFull` when this is not the first event that is refused.
   Appended append(PropertyDictionary event);
   /// The events; the batch no longer exists. The counters stay.
@@ -45,6 +52,7 @@ class EventBatch {
   std::vector<PropertyDictionary> _events;
   // By the method's number; a method that is not a whole number is counted under its text's hash.
   std::unordered_map<std::int64_t, std::int64_t> _counters;
+  const std::shared_ptr<BatchMemory> _memory;
   std::uint64_t _bytes = 0;
   bool _exists = false;
   bool _refused = false;

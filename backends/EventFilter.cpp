@@ -1,11 +1,10 @@
 #include "backends/EventFilter.h"
 
 #include <algorithm>
-#include <string_view>
+#include <string>
 #include <utility>
 
 #include "backends/VelkReportingBackend.h"
-#include "foundation/Text.h"
 
 namespace velk {
 
@@ -22,32 +21,35 @@ FilterAction actionNamed(const std::string* word) {
 
 std::int32_t numberOrEvery(const PropertyValue* value) { return value != nullptr ? int32Value(value) : -1; }
 
-PropertyValue valueOf(const PropertyDictionary& entry, std::string_view key) {
-  const PropertyValue* value = entry.find(key);
-  return value != nullptr ? *value : PropertyValue();
+std::optional<FoldedText> keyOf(const PropertyDictionary& entry) {
+  const std::string* key = entry.string("key");
+  return key != nullptr ? std::optional<FoldedText>(*key) : std::nullopt;
+}
+
+std::vector<FoldedText> valuesOf(const PropertyDictionary& entry) {
+  std::vector<FoldedText> values;
+  const PropertyArray* list = entry.array("value");
+  if (list == nullptr) return values;
+  for (const PropertyValue& element : *list) {
+    if (const std::string* text = element.string()) values.emplace_back(*text);
+  }
+  return values;
 }
 
 FilterRecord recordOf(const PropertyValue& filter) {
   const PropertyDictionary* entry = filter.dictionary();
   if (entry == nullptr) return {};
   return FilterRecord{numberOrEvery(entry->find("method")), numberOrEvery(entry->find("status")),
-                      actionNamed(entry->string("action")), valueOf(*entry, "key"), valueOf(*entry, "value")};
-}
-
-bool matchesKey(const FilterRecord& record, std::string_view key) {
-  const std::string* text = record.key.string();
-  return text != nullptr && text->size() == key.size() && equalsIgnoringCase(*text, key);
+                      actionNamed(entry->string("action")), keyOf(*entry), valuesOf(*entry)};
 }
 
 /// Whether the value is text that contains one of the record's values.
 bool holdsListedValue(const FilterRecord& record, const PropertyValue& value) {
   const std::string* text = value.string();
-  const PropertyArray* list = record.value.array();
-  if (text == nullptr || list == nullptr) return false;
-  return std::any_of(list->begin(), list->end(), [text](const PropertyValue& element) {
-    const std::string* part = element.string();
-    return part != nullptr && containsIgnoringCase(*text, *part);
-  });
+  if (text == nullptr) return false;
+  Foldable foldable(*text);
+  return std::any_of(record.values.begin(), record.values.end(),
+                     [&foldable](const FoldedText& part) { return foldable.contains(part); });
 }
 
 bool removesKey(const FilterRecord& record, const PropertyValue& value) {
@@ -89,15 +91,16 @@ void EventFilter::apply(PropertyDictionary& event) const {
   if (_records.empty()) return;
   const std::int32_t method = int32Value(event.find("_method"));
   const std::int32_t status = int32Value(event.find("_status"));
-  const auto applies = [&](const FilterRecord& record, std::string_view key) {
-    return matchesKey(record, key) && (record.method < 0 || record.method == method) &&
-           (record.status < 0 || record.status == status);
+  const auto applies = [&](const FilterRecord& record, Foldable& key) {
+    return (record.method < 0 || record.method == method) && (record.status < 0 || record.status == status) &&
+           record.key && key.equals(*record.key);
   };
   // First find, then act: acting moves the entries.
   std::vector<std::pair<std::string, const FilterRecord*>> matches;
   for (const auto& entry : event) {
+    Foldable key(entry.key);
     for (const FilterRecord& record : _records) {
-      if (!applies(record, entry.key)) continue;
+      if (!applies(record, key)) continue;
       if (record.action != FilterAction::none) matches.emplace_back(entry.key, &record);
       break;
     }

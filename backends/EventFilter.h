@@ -4,10 +4,11 @@
 
 #include <cstddef>
 #include <cstdint>
-#include <string>
+#include <optional>
 #include <vector>
 
 #include "foundation/PropertyValue.h"
+#include "unicode/CaseFolding.h"
 
 namespace velk {
 
@@ -17,8 +18,8 @@ struct FilterRecord {
   std::int32_t method = -1;  ///< -1: every method
   std::int32_t status = -1;  ///< -1: every status
   FilterAction action = FilterAction::none;
-  PropertyValue key;    ///< one that is not text matches no key
-  PropertyValue value;  ///< the action's argument
+  std::optional<FoldedText> key;   ///< none: no key matches
+  std::vector<FoldedText> values;  ///< the texts among the action's argument
 };
 
 class EventFilter {

@@ -14,6 +14,7 @@
 #include <string>
 #include <vector>
 
+#include "backends/ClientEntryMatching.h"
 #include "backends/EventBatch.h"
 #include "backends/EventFilter.h"
 #include "backends/VelkReportingBackend.h"
@@ -74,6 +75,7 @@ class HTTPSPostBackend final : public VelkReportingBackend {
                                         const std::string* serviceName);
   void expedite(const PropertyArray& clients, const std::string* clientName, const std::string* serviceName);
   void configureWithoutUserInfo(const PropertyArray& clients);
+  [[nodiscard]] bool isUsable(const std::optional<WrongType>& wrong) const;
   [[nodiscard]] bool passesConsent(const PropertyDictionary& entry);
   [[nodiscard]] bool passesPlaceAndDevice(const PropertyDictionary& entry, const std::string* countryCode) const;
   [[nodiscard]] bool takesFilters(const PropertyDictionary& entry);
@@ -116,7 +118,7 @@ class HTTPSPostBackend final : public VelkReportingBackend {
   bool _forceEventLogging = false;
 
   // Guarded by the state queue.
-  const std::shared_ptr<EventBatch> _batch = std::make_shared<EventBatch>();
+  const std::shared_ptr<EventBatch> _batch = std::make_shared<EventBatch>(_context.batchMemory);
 
   // Used on the owning session's queue only.
   std::optional<std::string> _postURL;

@@ -105,7 +105,7 @@ std::int32_t HTTPSPostBackend::updateBackendState() {
   }
   if (!hasUserInfo) return kBackendNotConfigured;
   const PropertyDictionary* entry = firstEntry(*clients, [&](const PropertyDictionary& candidate) {
-    return matchClientNameAndServiceID(candidate, clientName, serviceName) &&
+    return isUsable(wrongTypeOfChoice(candidate)) && matchClientNameAndServiceID(candidate, clientName, serviceName) &&
            isFrameworkEnabledForClient(candidate, _selfVersion);
   });
   return entry != nullptr ? configureWithClientEntry(*entry, clientName, serviceName) : kBackendDisabled;
@@ -132,7 +132,8 @@ std::int32_t HTTPSPostBackend::configureWithClientEntry(const PropertyDictionary
                                                         const std::string* serviceName) {
   const auto country = _context.platform.locale.countryCode();
   const std::string* countryCode = country ? &*country : nullptr;
-  if (!passesConsent(entry) || !passesPlaceAndDevice(entry, countryCode) || !takesFilters(entry)) {
+  if (!passesConsent(entry) || !isUsable(wrongTypeOfRestriction(entry)) || !passesPlaceAndDevice(entry, countryCode) ||
+      !takesFilters(entry)) {
     return kBackendDisabled;
   }
   updateSamplingThreshold(entry, countryCode);
@@ -145,6 +146,11 @@ std::int32_t HTTPSPostBackend::configureWithClientEntry(const PropertyDictionary
   _includeSessionIDInHeader = lowByteIsSet(entry, "include_session_id");
   _shouldUseWiFiOnly = lowByteIsSet(entry, "use_wifi_only");
   return newState;
+}
+
+bool HTTPSPostBackend::isUsable(const std::optional<WrongType>& wrong) const {
+  if (wrong) log::error(backend_texts::kWrongType, _name, wrong->key, wrong->expected);
+  return !wrong;
 }
 
 bool HTTPSPostBackend::passesConsent(const PropertyDictionary& entry) {
@@ -181,6 +187,7 @@ bool HTTPSPostBackend::takesFilters(const PropertyDictionary& entry) {
     log::error(backend_texts::kFiltersRequired);
     return false;
   }
+  if (!isUsable(wrongTypeOfFilters(entry))) return false;
   _filter.createFiltersFromArray(*filters);
   return true;
 }
@@ -221,7 +228,8 @@ void HTTPSPostBackend::resetBackendStateWithClient(const PropertyDictionary* ent
 void HTTPSPostBackend::takeCustomIdentifier(const PropertyDictionary& entry, const std::string* clientName,
                                             const std::string* serviceName) {
   if (!entry.contains("custom_clientId")) return;
-  _uuidCustom = getPersistentIdentifierForCustomClientIDSuffix(_context.platform.defaults, clientName, serviceName);
+  _uuidCustom = _context.identifiers->getPersistentIdentifierForCustomClientIDSuffix(_context.platform.defaults,
+                                                                                     clientName, serviceName);
 }
 
 bool HTTPSPostBackend::updatePostLink(const PropertyDictionary& entry) {

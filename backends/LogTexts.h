@@ -32,12 +32,22 @@ inline constexpr const char* kNotInDeviceWhitelist =
 inline constexpr const char* kInDeviceBlacklist =
     "HTTPSPostBackend(updateBackendState): (%s) is in device blacklist %s";
 inline constexpr const char* kFiltersRequired = "HTTPSPostBackend(updateBackendState): filters are required.";
+inline constexpr const char* kWrongType =
+    "HTTPSPostBackend(updateBackendState): %s: \"%s\" of a client entry must be %s, so the entry applies to nothing";
 inline constexpr const char* kSamplingThresholdChanged =
     "HTTPSPostBackend(updateBackendState): sampling threshold for %s changed from %.02f to %.02f";
 inline constexpr const char* kClientFound =
     "HTTPSPostBackend(updateBackendState): %s: client found %s:%s, state=%d, samplingFactor=%f";
 inline constexpr const char* kEventWhitelist = "HTTPSPostBackend(updateBackendState): %s: eventWhitelist=%@";
 inline constexpr const char* kEventBlacklist = "HTTPSPostBackend(updateBackendState): %s: eventBlacklist=%@";
+
+inline constexpr const char* kPersistentIdentifierForCustomClientIDSuffix =
+    "getPersistentIdentifierForCustomClientIDSuffix: The value for %s: %s";
+inline constexpr const char* kIdentifierNameTooLong =
+    "getPersistentIdentifierForCustomClientIDSuffix: a client or service name is longer than %d bytes, so identifiers "
+    "of such names are not kept";
+inline constexpr const char* kTooManyIdentifiers =
+    "getPersistentIdentifierForCustomClientIDSuffix: %d identifiers are stored, further ones are not kept";
 
 // Sending and batching.
 inline constexpr const char* kNoMessage = "HTTPSPostBackend(sendMessage): SESSION_TYPE_STOP message dictionary is nil";
@@ -89,6 +99,8 @@ inline constexpr const char* kNoServerIP = "DashboardBackend(initWithName): can'
 inline constexpr const char* kNoServerPort = "DashboardBackend(initWithName): can't resolve server port";
 inline constexpr const char* kSocketFailed = "DashboardBackend(initWithName): socket() failed (%d)";
 inline constexpr const char* kAllNullParameters = "DashboardBackend(initWithName): initWitName with all null params.";
+inline constexpr const char* kNoServerAddress =
+    "DashboardBackend(initWithName): '%s' is no IPv4 address, so no datagrams are sent";
 inline constexpr const char* kConnectFailed = "DashboardBackend(initWithName): socket connect() failed.";
 inline constexpr const char* kNoTimerSource = "DashboardBackend(initWithName): can't create timer source.";
 inline constexpr const char* kCannotBind = "DashboardBackend(useReliableUDP): can't bind socket, %d";

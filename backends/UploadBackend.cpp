@@ -134,8 +134,8 @@ HttpRequest UploadBackend::makeRequest(std::string address, const CompressedFile
   request.timeout = timeoutFor(body.size());
   request.maximumResponseBytes = kMaximumAnswerBytes;
   request.isBulk = true;
-  // As with events: only internal builds may speak plain http.
-  request.requiresHttps = !_isInternal;
+  // The address as the signed storebag has it.
+  request.requiresHttps = false;
   request.setHeader("Content-Type", "application/octet-stream");
   request.setHeader("Content-Encoding", "gzip");
   return request;

@@ -16,6 +16,8 @@
 #include <string_view>
 
 #include "backends/BackendStateHandle.h"
+#include "backends/BatchMemory.h"
+#include "backends/ClientIdentifiers.h"
 #include "backends/DottedVersion.h"
 #include "backends/ProcessUploads.h"
 #include "connectivity/ConnectivityInterface.h"
@@ -49,6 +51,8 @@ struct BackendContext {
   /// On a disk with room for what is too large for memory. What is kept there has no name.
   std::string largeFilesDirectory = "/var/tmp";
   std::shared_ptr<ProcessUploads> uploads = std::make_shared<ProcessUploads>();
+  std::shared_ptr<BatchMemory> batchMemory = std::make_shared<BatchMemory>();
+  std::shared_ptr<ClientIdentifiers> identifiers = std::make_shared<ClientIdentifiers>();
 };
 
 /// A file that a client hands over for upload.

@@ -140,7 +140,7 @@ DaemonProcess::Parts::Parts(const DaemonOptions& options, process::RunLoop& loop
       storebagPool(makeThreadPool()),
       defaults(openUserDefaults(kVelkReportingDefaultsSuite, directories.state, directories.configuration)),
       device(makeDeviceInformation(directories.configuration)),
-      locale(makeLocale()),
+      locale(makeLocale(openUserDefaults(kTimeDefaultsSuite, directories.state, directories.configuration))),
       http(makeHttpSessionService()),
       random(makeRandomSource()),
       consent(makeConsent(*defaults)),

@@ -6,11 +6,11 @@
 
 #include "device/ComponentTable.h"
 #include "device/LogTexts.h"
-#include "foundation/Text.h"
 #include "ipc/Vocabulary.h"
 #include "platform/DeviceInformation.h"
 #include "platform/Log.h"
 #include "platform/UserDefaults.h"
+#include "unicode/CaseFolding.h"
 
 namespace velk {
 namespace {
@@ -84,7 +84,7 @@ std::optional<std::string_view> environmentSectionName(std::uint32_t environment
 std::string userInfoIdentifierString(const PropertyDictionary& userInfo) {
   const auto name = [&](std::string_view key) {
     const auto* text = userInfo.string(key);
-    return text != nullptr ? lowerCased(*text) : std::string();
+    return text != nullptr ? lowerCasedText(*text) : std::string();
   };
   return name(kVelkReportingUserInfoClientName) + ":" + name(kVelkReportingUserInfoServiceName);
 }

@@ -16,6 +16,13 @@ char escapedByte(std::string_view text) noexcept {
   return high < 0 || low < 0 ? '\0' : static_cast<char>(high * 16 + low);
 }
 
+/// What RFC 3986 allows in a path as it stands.
+bool isAllowedInPath(char character) noexcept {
+  const bool isLetter = (character >= 'a' && character <= 'z') || (character >= 'A' && character <= 'Z');
+  const bool isDigit = character >= '0' && character <= '9';
+  return isLetter || isDigit || std::string_view("-._~!$&'()*+,;=:@/").find(character) != std::string_view::npos;
+}
+
 std::string withoutEscapes(std::string_view text) {
   std::string path;
   path.reserve(text.size());
@@ -38,6 +45,23 @@ std::string fileSystemPath(std::string_view url) {
     rest = slash == std::string_view::npos ? std::string_view() : rest.substr(slash);
   }
   return withoutEscapes(rest);
+}
+
+std::string absoluteFileUrl(std::string_view urlOrPath) {
+  if (urlOrPath.empty() || urlOrPath.front() != '/') return std::string(urlOrPath);
+  constexpr std::string_view kDigits = "0123456789ABCDEF";
+  std::string url = "file://";
+  for (const char character : urlOrPath) {
+    if (isAllowedInPath(character)) {
+      url += character;
+      continue;
+    }
+    const auto byte = static_cast<unsigned char>(character);
+    url += '%';
+    url += kDigits[byte >> 4U];
+    url += kDigits[byte & 0xFU];
+  }
+  return url;
 }
 
 }  // namespace velk

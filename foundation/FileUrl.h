@@ -1,4 +1,5 @@
-// The path that a file address names. The client's library opens it; for the daemon it is only a word.
+// The path that a file address names, and the other way round. The client's library opens it; for the daemon it is only
+// a word.
 #pragma once
 
 #include <string>
@@ -10,5 +11,9 @@ namespace velk {
 /// percent escapes resolved (but for a null byte, which stays escaped); empty for a host alone. Text that is no such
 /// address is taken for a path as it is, "file:PATH" included: a relative path may begin so.
 [[nodiscard]] std::string fileSystemPath(std::string_view url);
+
+/// The absolute address of a file. An address stays as it is, an absolute path becomes "file:///PATH" with percent
+/// escapes; a relative path stays as well, since only its owner knows what it is relative to.
+[[nodiscard]] std::string absoluteFileUrl(std::string_view urlOrPath);
 
 }  // namespace velk

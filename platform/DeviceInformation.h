@@ -9,6 +9,8 @@
 
 namespace velk {
 
+class UserDefaults;
+
 /// Answers questions about the device: "ProductVersion", "BuildVersion", "ProductType", "DeviceName",
 /// "HWModelStr", "SerialNumber", "UniqueDeviceID", "ReleaseType", and whatever else `device.conf` holds. Any thread.
 class DeviceInformation {
@@ -31,12 +33,17 @@ class Locale {
   [[nodiscard]] virtual std::optional<std::string> countryCode() const = 0;
   /// The local zone's offset from GMT in seconds, at this moment.
   [[nodiscard]] virtual std::int32_t timeZoneOffset() const = 0;
-  /// Whether the system sets its time zone by itself; nothing where the system offers no answer.
+  /// Whether the system sets its time zone by itself; nothing where nobody has said so.
   [[nodiscard]] virtual std::optional<bool> automaticTimeZoneEnabled() const = 0;
 };
 
-/// LC_ALL, LC_MESSAGES, LANG of the environment, else /etc/locale.conf (and /etc/default/locale); the zone by tzdata.
-/// `root` stands before these paths (tests have their own).
-[[nodiscard]] std::unique_ptr<Locale> makeLocale(const std::string& root = {});
+/// The suite of the time daemon, which says there whether it sets the zone by itself.
+inline constexpr std::string_view kTimeDefaultsSuite = "com.tavrin.timed";
+
+/// LC_ALL, LC_MESSAGES, LANG of the environment, else /etc/locale.conf (and /etc/default/locale); the zone by tzdata;
+/// whether it is set automatically by "TMAutomaticTimeZoneEnabled" of `timeSuite` (null: no answer). `root` stands
+/// before these paths (tests have their own).
+[[nodiscard]] std::unique_ptr<Locale> makeLocale(std::unique_ptr<UserDefaults> timeSuite = nullptr,
+                                                 const std::string& root = {});
 
 }  // namespace velk

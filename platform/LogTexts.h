@@ -6,7 +6,5 @@ namespace velk::logtexts {
 inline constexpr const char* kPersistentIdentifierForDNU = "getPersistentIdentifierForDNU: The value for %s: %s";
 inline constexpr const char* kRegeneratedPersistentIdentifierForDNU =
     "regeneratePersistentIdentifierForDNU: Set new value for %s: %s";
-inline constexpr const char* kPersistentIdentifierForCustomClientIDSuffix =
-    "getPersistentIdentifierForCustomClientIDSuffix: The value for %s: %s";
 
 }  // namespace velk::logtexts

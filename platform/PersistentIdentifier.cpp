@@ -61,13 +61,4 @@ void regeneratePersistentIdentifierForDNU(UserDefaults& defaults, bool respectCo
   log::standard(logtexts::kRegeneratedPersistentIdentifierForDNU, key, identifier);
 }
 
-std::string getPersistentIdentifierForCustomClientIDSuffix(UserDefaults& defaults, const std::string* prefix,
-                                                           const std::string* suffix) {
-  const std::string key =
-      "uuid:" + (prefix != nullptr ? *prefix : std::string()) + ":" + (suffix != nullptr ? *suffix : std::string());
-  const std::string identifier = persistentIdentifier(defaults, key);
-  log::standard(logtexts::kPersistentIdentifierForCustomClientIDSuffix, key, identifier);
-  return identifier;
-}
-
 }  // namespace velk

@@ -19,9 +19,4 @@ namespace velk {
 /// Replaces the identifier; the other one stays.
 void regeneratePersistentIdentifierForDNU(UserDefaults& defaults, bool respectConsent);
 
-/// "uuid:<prefix>:<suffix>": an identifier of one client and service. Absent parts count as empty.
-[[nodiscard]] std::string getPersistentIdentifierForCustomClientIDSuffix(UserDefaults& defaults,
-                                                                         const std::string* prefix,
-                                                                         const std::string* suffix);
-
 }  // namespace velk

@@ -50,6 +50,9 @@ class UdpSocket {
   virtual void close() = 0;
 };
 
+/// Whether the text is a dotted quad.
+[[nodiscard]] bool isIPv4Address(std::string_view text);
+
 /// Any thread. Outlives the sockets that it made, and the queues of their read sources.
 class UdpSocketService {
  public:

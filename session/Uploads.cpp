@@ -42,7 +42,8 @@ void finishFileUpload(MessageLog& messageLog, const std::string& url, const File
     log::error(session_texts::kUploadFailed, upload.path);
   }
   messageLog.writeToLogFile(
-      formatText(session_texts::kMessageLogUpload, {taken ? "succeeded" : "failed", withoutControlCharacters(url)}));
+      formatText(session_texts::kMessageLogUpload,
+                 {taken ? "succeeded" : "failed", withoutControlCharacters(absoluteFileUrl(url))}));
   reply(taken, upload.isDelivered);
 }
 

@@ -8,10 +8,13 @@
 #include "platform/DeviceInformation.h"
 #include "platform/Files.h"
 #include "platform/LocalTime.h"
+#include "platform/UserDefaults.h"
 #include "platform/linux/KeyValueFile.h"
 
 namespace velk {
 namespace {
+
+constexpr std::string_view kAutomaticTimeZoneSetting = "TMAutomaticTimeZoneEnabled";
 
 /// The region of a locale's name: "AT" of "de_AT.UTF-8@euro", "419" of "es_419". None in "C" or "POSIX".
 std::optional<std::string> regionOf(std::string_view locale) {
@@ -34,7 +37,8 @@ std::optional<std::string> regionOf(std::string_view locale) {
 
 class SystemLocale : public Locale {
  public:
-  explicit SystemLocale(std::string root) : _root(std::move(root)) {}
+  SystemLocale(std::unique_ptr<UserDefaults> timeSuite, std::string root)
+      : _timeSuite(std::move(timeSuite)), _root(std::move(root)) {}
 
   std::optional<std::string> countryCode() const override {
     // The first variable that is set decides, whether it names a region or not.
@@ -62,9 +66,13 @@ class SystemLocale : public Locale {
     return offset;
   }
 
-  std::optional<bool> automaticTimeZoneEnabled() const override { return std::nullopt; }
+  std::optional<bool> automaticTimeZoneEnabled() const override {
+    const auto setting = _timeSuite ? _timeSuite->value(kAutomaticTimeZoneSetting) : std::nullopt;
+    return setting ? std::optional(booleanValue(&*setting)) : std::nullopt;
+  }
 
  private:
+  const std::unique_ptr<UserDefaults> _timeSuite;
   const std::string _root;
   /// The second (upper half) and the offset in it (lower half).
   mutable std::atomic<std::uint64_t> _offsetOfSecond{0};
@@ -72,6 +80,8 @@ class SystemLocale : public Locale {
 
 }  // namespace
 
-std::unique_ptr<Locale> makeLocale(const std::string& root) { return std::make_unique<SystemLocale>(root); }
+std::unique_ptr<Locale> makeLocale(std::unique_ptr<UserDefaults> timeSuite, const std::string& root) {
+  return std::make_unique<SystemLocale>(std::move(timeSuite), root);
+}
 
 }  // namespace velk

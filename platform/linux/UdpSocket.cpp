@@ -173,6 +173,11 @@ class LinuxUdpSocketService final : public UdpSocketService {
 
 }  // namespace
 
+bool isIPv4Address(std::string_view text) {
+  in_addr address{};
+  return ::inet_pton(AF_INET, std::string(text).c_str(), &address) == 1;
+}
+
 std::unique_ptr<UdpSocketService> makeUdpSocketService() { return std::make_unique<LinuxUdpSocketService>(); }
 
 }  // namespace velk

@@ -4,6 +4,7 @@
 #include <sys/file.h>
 #include <sys/stat.h>
 
+#include <algorithm>
 #include <cerrno>
 #include <system_error>
 
@@ -13,11 +14,15 @@
 #include "platform/Files.h"
 #include "platform/Lock.h"
 #include "platform/Log.h"
+#include "platform/Platform.h"
 
 namespace velk {
 namespace {
 
+/// No write makes a file larger than this, but for the consent's.
 constexpr std::size_t kMaximumSuiteBytes = 4 * 1024 * 1024;
+/// What is read: consent can be given and withdrawn in a full file as well.
+constexpr std::size_t kMaximumReadBytes = kMaximumSuiteBytes + 64 * 1024;
 
 /// What one version of a file is told by. Files are replaced, never written in place, and a version that is in use is
 /// kept open, so that its number cannot be given to the next one; size and time of change tell when somebody edits it
@@ -72,7 +77,7 @@ Version readVersion(const std::string& path) {
   if (::fstat(version.file.get(), &status) == 0) version.identity = identityOf(status);
   version.isTrustworthy = files::isTrustworthy(path);
   // The open descriptor, not the path: the file may be replaced at any moment.
-  const auto bytes = files::readDescriptor(version.file.get(), path, kMaximumSuiteBytes);
+  const auto bytes = files::readDescriptor(version.file.get(), path, kMaximumReadBytes);
   if (!bytes) {
     const bool tooLarge = bytes.error().code == static_cast<int>(files::Code::tooLarge);
     return problematic(std::move(version), tooLarge ? Usability::corrupt : Usability::unreadable,
@@ -171,10 +176,11 @@ class FileUserDefaults : public UserDefaults {
   }
 
   Result<void> set(std::string_view key, PropertyValue value) override {
-    return change([&](PropertyDictionary& values) {
+    const auto edit = [&](PropertyDictionary& values) {
       values.set(key, std::move(value));
       return true;
-    });
+    };
+    return change(edit, key == kDiagnosticsAndUsageSetting ? kMaximumReadBytes : kMaximumSuiteBytes);
   }
 
   Result<void> remove(std::string_view key) override {
@@ -240,8 +246,10 @@ class FileUserDefaults : public UserDefaults {
     return refused ? PropertyDictionary() : version->values;
   }
 
-  /// Reads, lets `edit` change the values, and writes them when it returns true: one step among all processes.
-  Result<void> change(const std::function<bool(PropertyDictionary&)>& edit) {
+  /// Reads, lets `edit` change the values, and writes them when it returns true: one step among all processes. Refused
+  /// when the file would be larger than `maximumBytes` and larger than it is.
+  Result<void> change(const std::function<bool(PropertyDictionary&)>& edit,
+                      std::size_t maximumBytes = kMaximumSuiteBytes) {
     if (auto made = files::createDirectories(_stateDirectory, 0700); !made) return made;
     const SuiteLock suite(_lockPath);
     if (!suite.held()) return failure("UserDefaults", 1, "cannot lock " + _lockPath + ": " + suite.whyNot());
@@ -255,8 +263,16 @@ class FileUserDefaults : public UserDefaults {
     if (!json::writePretty(values, text, json::Extensions::tagged)) {
       return failure("UserDefaults", 3, "a value cannot be stored in " + _user.path());
     }
+    const auto present = version->identity.size > 0 ? static_cast<std::size_t>(version->identity.size) : 0;
+    const auto mayBe = std::max(maximumBytes, present);
+    if (text.size() >= mayBe) {
+      // Without its blanks it may still fit: a file that was written by hand may have had none.
+      text.clear();
+      if (!json::write(values, text, json::Extensions::tagged) || text.size() >= mayBe) {
+        return failure("UserDefaults", 4, _user.path() + " would grow too large");
+      }
+    }
     text += '\n';
-    if (text.size() > kMaximumSuiteBytes) return failure("UserDefaults", 4, _user.path() + " would grow too large");
     return files::writeAtomically(_user.path(), {reinterpret_cast<const std::uint8_t*>(text.data()), text.size()});
   }
 

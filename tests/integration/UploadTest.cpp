@@ -100,7 +100,8 @@ TEST_F(Upload, DeliveredFilesAreRemovedByTheirOwner) {
   EXPECT_EQ(*posts[1].request.header("Content-Encoding"), "gzip");
   EXPECT_EQ(*posts[1].request.header("Content-Type"), "application/octet-stream");
   EXPECT_EQ(session.finish(), 0);
-  EXPECT_NE(daemon.messageLog().find("[uploadFileWithURL] Upload succeeded for file " + one + "\n"), std::string::npos);
+  EXPECT_NE(daemon.messageLog().find("[uploadFileWithURL] Upload succeeded for file file://" + one + "\n"),
+            std::string::npos);
 }
 
 TEST_F(Upload, WhatIsNoFileOrHoldsNothingStays) {

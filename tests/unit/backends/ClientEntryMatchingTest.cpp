@@ -33,6 +33,16 @@ TEST(ClientEntryMatching, ComparesWithoutRegardToCase) {
   EXPECT_TRUE(matchStringWithList(&list, &kRussia, false));
 }
 
+TEST(ClientEntryMatching, ComparesLettersOfAnyScriptWithoutRegardToCase) {
+  const std::string client = "Me\u0301dia";
+  const std::string service = "com.example.ПОЧТА";
+  EXPECT_TRUE(matchClientNameAndServiceID({{"client", "a,M\u00c9DIA"}, {"service", "почта"}}, &client, &service));
+  EXPECT_FALSE(matchClientNameAndServiceID({{"client", "media"}}, &client, &service));
+  const PropertyArray devices{"GRÖSSE"};
+  const std::string device = "Große Größe";
+  EXPECT_TRUE(matchStringWithList(&devices, &device, false));
+}
+
 TEST(ClientEntryMatching, MatchesNothingWithElementsThatAreNoText) {
   const PropertyArray list{5, PropertyArray{"US"}, nullptr};
   const std::string text = "5";
@@ -75,6 +85,18 @@ TEST(ClientEntryMatching, ComparesVersionsPartByPart) {
 TEST(ClientEntryMatching, ReadsAVersionGivenAsANumber) {
   EXPECT_FALSE(isFrameworkEnabledForClient({{"enabledSince", 8.5}}, {8, 1, 0}));
   EXPECT_TRUE(isFrameworkEnabledForClient({{"enabledSince", 8}}, {8, 1, 0}));
+}
+
+TEST(ClientEntryMatching, IsForNobodyWithNamesOfTheWrongType) {
+  const std::string client = "A";
+  for (const PropertyValue& value :
+       {PropertyValue(PropertyArray{"A", "B"}), PropertyValue(5), PropertyValue(nullptr)}) {
+    EXPECT_FALSE(matchClientNameAndServiceID({{"client", value}}, &client, &client));
+    EXPECT_FALSE(matchClientNameAndServiceID({{"client", value}}, nullptr, nullptr));
+    EXPECT_FALSE(matchClientNameAndServiceID({{"service", value}}, &client, &client));
+  }
+  EXPECT_FALSE(isFrameworkEnabledForClient({{"enabledSince", PropertyArray{}}}, {8, 1, 0}));
+  EXPECT_FALSE(isFrameworkEnabledForClient({{"enabledSince", true}}, {8, 1, 0}));
 }
 
 TEST(ClientEntryMatching, FindsExactTexts) {

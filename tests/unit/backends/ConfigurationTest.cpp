@@ -190,7 +190,7 @@ TEST_F(ConfigurationTest, ReplacesTheThresholdOfACountryOnce) {
   fakes.locale.country = "CA";
   auto entry = with(with(openEntry(), "locale_whitelist", PropertyArray{"A"}), "sampling_threshold", 0.25);
   entry.set("per_country_sampling_thresholds",
-            PropertyArray{7, PropertyDictionary{{"country", "CA"}, {"threshold", 0.1}},
+            PropertyArray{PropertyDictionary{{"country", PropertyArray{"AC"}}, {"threshold", 0.1}},
                           PropertyDictionary{{"country", PropertyArray{"US", "CA"}}, {"threshold", 0.75}},
                           PropertyDictionary{{"country", PropertyArray{"CA"}}, {"threshold", 0.0}}});
   auto backend = makePost(entry);
@@ -217,8 +217,76 @@ TEST_F(ConfigurationTest, CopiesTheEventLists) {
   EXPECT_EQ(backend->eventBlacklist(), PropertyArray{8});
   EXPECT_EQ(log.count("HTTPSPostBackend(updateBackendState): korrin: eventWhitelist=[7,8]"), 1);
   EXPECT_EQ(log.count("HTTPSPostBackend(updateBackendState): korrin: eventBlacklist=[8]"), 1);
-  auto plain = makeConfigured(with(openEntry(), "event_whitelist", "7"));
-  EXPECT_EQ(plain->eventWhitelist(), std::nullopt);
+}
+
+TEST_F(ConfigurationTest, AppliesToNobodyWhenARestrictionHasTheWrongType) {
+  const auto dictionary = [](const char* key, PropertyValue value) {
+    return PropertyDictionary{{key, std::move(value)}};
+  };
+  auto badThreshold = dictionary("country", PropertyArray{"US"});
+  badThreshold.set("threshold", PropertyArray{0});
+  const auto listing = [](PropertyValue key, const char* action, PropertyValue value) {
+    return PropertyArray{PropertyDictionary{{"key", std::move(key)}, {"action", action}, {"value", std::move(value)}}};
+  };
+  auto badMethod = dictionary("key", "a");
+  badMethod.set("method", PropertyArray{7});
+  for (const auto& [key, value] : std::vector<std::pair<const char*, PropertyValue>>{
+           {"client", PropertyArray{"Media", "Other"}},
+           {"client", nullptr},
+           {"service", PropertyArray{"Calls"}},
+           {"service", 5},
+           {"enabledSince", PropertyArray{8, 0}},
+           {"enabledSince", true},
+           {"locale_whitelist", "US"},
+           {"locale_whitelist", PropertyArray{"US", 1}},
+           {"device_whitelist", "Lamp"},
+           {"device_whitelist", PropertyArray{"Lamp", PropertyArray{}}},
+           {"device_blacklist", "Radio"},
+           {"device_blacklist", PropertyArray{5}},
+           {"filters", PropertyArray{5}},
+           {"filters", PropertyArray{dictionary("action", "remove")}},
+           {"filters", listing(5, "remove", nullptr)},
+           {"filters", listing("a", "blacklistValues", "b")},
+           {"filters", listing("a", "whitelistValues", PropertyArray{"b", 5})},
+           {"filters", PropertyArray{badMethod}},
+           {"sampling_threshold", PropertyArray{1}},
+           {"sampling_threshold", "often"},
+           {"per_country_sampling_thresholds", dictionary("US", 0.1)},
+           {"per_country_sampling_thresholds", PropertyArray{7}},
+           {"per_country_sampling_thresholds", PropertyArray{dictionary("country", "US")}},
+           {"per_country_sampling_thresholds", PropertyArray{badThreshold}},
+           {"event_whitelist", "7"},
+           {"event_whitelist", PropertyArray{7, "all"}},
+           {"event_blacklist", 7},
+           {"event_blacklist", PropertyArray{dictionary("id", 7)}},
+           {"use_wifi_only", "yes"}}) {
+    log.clear();
+    const auto entry = with(with(openEntry(), "override_dnu", 1), key, value);
+    EXPECT_EQ(stateWith(entry), kBackendDisabled) << key;
+    const auto lines = log.lines();
+    EXPECT_EQ(
+        std::count_if(lines.begin(), lines.end(), [](const auto& line) { return line.level == log::Level::error; }), 1)
+        << key;
+    EXPECT_TRUE(log.contains("korrin: \"" + std::string(key) + "\" of a client entry must be ")) << key;
+  }
+  EXPECT_EQ(log.count("HTTPSPostBackend(updateBackendState): korrin: \"use_wifi_only\" of a client entry must be a "
+                      "number, so the entry applies to nothing"),
+            1);
+}
+
+TEST_F(ConfigurationTest, TakesNumbersThatAreGivenAsText) {
+  auto entry = with(with(openEntry(), "event_whitelist", PropertyArray{"7"}), "sampling_threshold", " +1");
+  entry.set("use_wifi_only", "1");
+  EXPECT_EQ(stateWith(entry), kBackendEnabled);
+}
+
+TEST_F(ConfigurationTest, GoesOnToTheNextEntryWhenNamesHaveTheWrongType) {
+  auto backend = makePostWith(
+      PropertyArray{with(with(openEntry(), "client", PropertyArray{"Media"}), "post_url", "https://first.example/"),
+                    with(with(openEntry(), "expedite", 0), "post_url", "https://second.example/")});
+  EXPECT_EQ(backend->updateState(), kBackendEnabled);
+  EXPECT_EQ(backend->postURL(), "https://second.example/");
+  EXPECT_TRUE(log.contains("Store bag override  _batchEvent=1"));
 }
 
 TEST_F(ConfigurationTest, PrefersTheAddressesOfTheSuite) {

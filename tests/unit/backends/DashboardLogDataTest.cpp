@@ -60,14 +60,14 @@ TEST_F(DashboardLogDataTest, IsPostedAsABinaryPropertyList) {
   EXPECT_EQ(*archived, PropertyValue(logData));
 }
 
-TEST_F(DashboardLogDataTest, OfOrdinaryBuildsTravelsEncryptedOrNotAtAll) {
-  start();
-  backend->setIsInternal(false);
-  EXPECT_TRUE(upload());
-  backend->setIsInternal(true);
-  EXPECT_TRUE(upload());
-  EXPECT_TRUE(server->requests[0].requiresHttps);
-  EXPECT_FALSE(server->requests[1].requiresHttps);
+TEST_F(DashboardLogDataTest, GoesToTheAddressAsItIsConfigured) {
+  start({{"post_url", "http://logs.example/post"}});
+  for (const bool isInternal : {false, true}) {
+    backend->setIsInternal(isInternal);
+    EXPECT_TRUE(upload());
+    EXPECT_EQ(server->requests.back().url, "http://logs.example/post");
+    EXPECT_FALSE(server->requests.back().requiresHttps);
+  }
 }
 
 TEST_F(DashboardLogDataTest, TellsWhereItWent) {
@@ -167,14 +167,14 @@ TEST_F(DashboardLogDataTest, LogsNoAnswerThatIsNoAddress) {
   server->body = std::string(100'000, 'x');
   EXPECT_TRUE(upload());
   EXPECT_LT(log.lines().back().text.size(), 2200U);
-  server->body = std::string(3000, 'x') + "\xFF";
+  server->body.assign(3000, 'x').append("\xFF");
   EXPECT_TRUE(upload());
   EXPECT_EQ(log.lines().back().text, "DashboardBackend(uploadLogData): Log data uploaded to ");
 }
 
 TEST_F(DashboardLogDataTest, CutsALongAnswerBehindAWholeCharacter) {
   start();
-  server->body = std::string(2047, 'x') + "\xC3\xA9 and more";
+  server->body.assign(2047, 'x').append("\xC3\xA9 and more");
   EXPECT_TRUE(upload());
   EXPECT_EQ(log.lines().back().text, "DashboardBackend(uploadLogData): Log data uploaded to " + std::string(2047, 'x'));
 }

@@ -39,13 +39,6 @@ TEST_F(DashboardTest, ConnectsToTheAddressOfItsSection) {
   backend->cleanup();
 }
 
-TEST_F(DashboardTest, TakesSixteenCharactersOfAnAddress) {
-  const auto backend = makeWith(PropertyDictionary{{"ip", "192.0.2.7 and what follows"}, {"port", 1}});
-  ASSERT_TRUE(backend);
-  EXPECT_EQ(socket().address, "192.0.2.7 and wh");
-  backend->cleanup();
-}
-
 TEST_F(DashboardTest, NeedsAddressAndPortInItsSection) {
   for (const PropertyDictionary& profile : std::vector<PropertyDictionary>{
            {{"port", 1}}, {{"ip", PropertyValue()}, {"port", 1}}, {{"ip", 7}, {"port", 1}}, {}}) {
@@ -92,6 +85,28 @@ TEST_F(DashboardTest, ClosesASocketThatCannotBeConnected) {
     EXPECT_FALSE(socket().isRead());
   }
   EXPECT_EQ(fakes.udpSockets.openSockets(), 0);
+}
+
+TEST_F(DashboardTest, WithoutAnAddressThatIsOneServesAllButDatagrams) {
+  for (const PropertyDictionary& more : std::vector<PropertyDictionary>{{}, {{"reliable", 500}}}) {
+    log.clear();
+    auto parts = section(more);
+    parts.set("ip", "192.0.2.7 and what follows");
+    parts.set("display_url", "https://shown.example/");
+    const auto backend = makeWith(parts);
+    ASSERT_TRUE(backend);
+    EXPECT_EQ(backend->displayURL(), "https://shown.example/");
+    EXPECT_EQ(
+        log.lines(),
+        (std::vector<RecordingLog::Line>{{log::Level::error,
+                                          "DashboardBackend(initWithName): '192.0.2.7 and what follows' is no IPv4 "
+                                          "address, so no datagrams are sent"}}));
+    EXPECT_FALSE(socket().isOpen);
+    EXPECT_FALSE(socket().isRead());
+    EXPECT_TRUE(backend->sendMessageWithoutFlag(PropertyDictionary{}, kStart, 7, 3, 1));
+    tick(3);
+    EXPECT_TRUE(socket().sent.empty());
+  }
 }
 
 /// A scheduler that can make no timers.

@@ -7,6 +7,13 @@
 namespace velk::test {
 namespace {
 
+/// A batch with the memory of a process of its own.
+struct LoneBatch : EventBatch {
+  LoneBatch() : EventBatch(std::make_shared<BatchMemory>()) {}
+};
+
+PropertyDictionary eventOf(std::size_t bytes) { return {{"text", std::string(bytes, 'x')}}; }
+
 int countsUntilReached(EventBatch& batch, const PropertyValue* method, std::int32_t threshold) {
   for (int counted = 1; counted < 1000; ++counted) {
     if (batch.countReaches(method, threshold)) return counted;
@@ -15,7 +22,7 @@ int countsUntilReached(EventBatch& batch, const PropertyValue* method, std::int3
 }
 
 TEST(EventBatch, ExistsFromCreationToTaking) {
-  EventBatch batch;
+  LoneBatch batch;
   EXPECT_FALSE(batch.exists());
   batch.create();
   EXPECT_TRUE(batch.exists());
@@ -26,7 +33,7 @@ TEST(EventBatch, ExistsFromCreationToTaking) {
 }
 
 TEST(EventBatch, CountsEachMethodByItself) {
-  EventBatch batch;
+  LoneBatch batch;
   const PropertyValue first(1);
   const PropertyValue second(2);
   EXPECT_FALSE(batch.countReaches(&second, 3));
@@ -37,7 +44,7 @@ TEST(EventBatch, CountsEachMethodByItself) {
 }
 
 TEST(EventBatch, CountsAnyKindOfMethod) {
-  EventBatch batch;
+  LoneBatch batch;
   for (const PropertyValue& method : {PropertyValue("seven"), PropertyValue(1.5), PropertyValue(PropertyArray{})}) {
     EXPECT_EQ(countsUntilReached(batch, &method, 3), 5);
   }
@@ -45,13 +52,13 @@ TEST(EventBatch, CountsAnyKindOfMethod) {
 }
 
 TEST(EventBatch, ReachesAtOnceBelowAZeroThreshold) {
-  EventBatch batch;
+  LoneBatch batch;
   EXPECT_TRUE(batch.countReaches(nullptr, -1));
   EXPECT_TRUE(batch.countReaches(nullptr, -5));
 }
 
 TEST(EventBatch, CountsAFixedNumberOfMethods) {
-  EventBatch batch;
+  LoneBatch batch;
   for (std::size_t method = 0; method < EventBatch::kMaximumCounters; ++method) {
     const PropertyValue key(method);
     EXPECT_FALSE(batch.countReaches(&key, 0));
@@ -65,20 +72,54 @@ TEST(EventBatch, CountsAFixedNumberOfMethods) {
 }
 
 TEST(EventBatch, RefusesEventsWhenFull) {
-  EventBatch batch;
-  const PropertyDictionary large{{"text", std::string(10U * 1024 * 1024, 'x')}};
+  LoneBatch batch;
+  const auto large = eventOf(10U * 1024 * 1024);
   int kept = 0;
   while (batch.append(large) == EventBatch::Appended::kept) ++kept;
   EXPECT_GT(kept, 0);
-  EXPECT_LE(batch.estimatedSize(), EventBatch::kMaximumBytes);
+  EXPECT_LE(batch.estimatedSize(), BatchMemory::kMaximumBytes);
   EXPECT_EQ(batch.append(large), EventBatch::Appended::stillFull);
   EXPECT_EQ(batch.append({{"small", 1}}), EventBatch::Appended::kept);
   batch.discard();
   EXPECT_EQ(batch.append(large), EventBatch::Appended::kept);
 }
 
+TEST(EventBatch, LeavesRoomForTheBatchesOfOthers) {
+  const auto memory = std::make_shared<BatchMemory>(100'000);
+  EventBatch greedy(memory);
+  EventBatch second(memory);
+  EventBatch third(memory);
+  const auto small = eventOf(1000);
+  const auto fill = [&small](EventBatch& batch) {
+    while (batch.append(small) == EventBatch::Appended::kept) continue;
+    return batch.estimatedSize();
+  };
+  EXPECT_LE(fill(greedy), 50'000U);
+  EXPECT_GT(fill(second), 20'000U);
+  EXPECT_GT(fill(third), 10'000U);
+  EXPECT_LE(memory->taken(), 100'000U);
+  EXPECT_EQ(memory->taken(), greedy.estimatedSize() + second.estimatedSize() + third.estimatedSize());
+}
+
+TEST(EventBatch, GivesItsMemoryBack) {
+  const auto memory = std::make_shared<BatchMemory>();
+  {
+    EventBatch taken(memory);
+    EventBatch discarded(memory);
+    EventBatch dropped(memory);
+    for (auto* batch : {&taken, &discarded, &dropped}) batch->append(eventOf(1000));
+    EXPECT_EQ(memory->taken(), 3 * taken.estimatedSize());
+    EXPECT_EQ(taken.take().size(), 1U);
+    discarded.discard();
+    EXPECT_EQ(memory->taken(), dropped.estimatedSize());
+    EXPECT_EQ(dropped.append(eventOf(BatchMemory::kMaximumBytes)), EventBatch::Appended::full);
+    EXPECT_EQ(memory->taken(), dropped.estimatedSize());
+  }
+  EXPECT_EQ(memory->taken(), 0U);
+}
+
 TEST(EventBatch, WritesASessionIDIntoEveryEvent) {
-  EventBatch batch;
+  LoneBatch batch;
   batch.append({{"_sessionID", 5}});
   batch.append({{"a", 1}});
   batch.setSessionID("parent.child");
@@ -86,7 +127,7 @@ TEST(EventBatch, WritesASessionIDIntoEveryEvent) {
 }
 
 TEST(EventBatch, EstimatesItsSize) {
-  EventBatch batch;
+  LoneBatch batch;
   EXPECT_EQ(batch.estimatedSize(), 0U);
   const PropertyDictionary event{{"a", "some text"}};
   batch.append(event);

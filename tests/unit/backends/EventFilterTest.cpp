@@ -20,6 +20,27 @@ TEST(EventFilter, RemovesAKeyWhateverItsCase) {
   EXPECT_EQ(filtered({rule("Name", "remove")}, {{"name", "x"}, {"NAME2", 1}}), (PropertyDictionary{{"NAME2", 1}}));
 }
 
+TEST(EventFilter, RemovesAKeyWhateverTheCaseOfItsLetters) {
+  EXPECT_TRUE(filtered({rule("GRÖSSE", "remove")}, {{"größe", "x"}}).empty());
+  EXPECT_TRUE(filtered({rule("größe", "remove")}, {{"GRÖSSE", "x"}, {"Gro\u0308\u00dfe", 1}}).empty());
+  EXPECT_TRUE(filtered({rule("\u212aelvin", "remove")}, {{"kelvin", 1}}).empty());
+  EXPECT_EQ(filtered({rule("größe", "remove")}, {{"grosse", "x"}}).size(), 1U);
+}
+
+TEST(EventFilter, ComparesValuesWhateverTheCaseOfTheirLetters) {
+  const PropertyArray blacklist{rule("place", "blacklistValues", PropertyArray{"ZÜRICH"})};
+  EXPECT_TRUE(filtered(blacklist, {{"place", "in Zu\u0308rich"}}).empty());
+  EXPECT_EQ(filtered(blacklist, {{"place", "Zurich"}}).size(), 1U);
+  const PropertyArray whitelist{rule("place", "whitelistValues", PropertyArray{"zürich"})};
+  EXPECT_EQ(filtered(whitelist, {{"place", "ZÜRICH"}}).size(), 1U);
+  EXPECT_TRUE(filtered(whitelist, {{"place", "Zurich"}}).empty());
+}
+
+TEST(EventFilter, ComparesBytesOfTextThatIsNotUtf8) {
+  EXPECT_TRUE(filtered({rule("A\xff", "remove")}, {{"a\xff", 1}}).empty());
+  EXPECT_EQ(filtered({rule("a\xff", "remove")}, {{"a\xfe", 1}}).size(), 1U);
+}
+
 TEST(EventFilter, HashesText) {
   EXPECT_EQ(filtered({rule("id", "sha256")}, {{"id", "abc"}}),
             (PropertyDictionary{{"id", VelkReportingBackend::convertIntoSHA256("abc")}}));

@@ -107,7 +107,6 @@ TEST_F(UploadBackendTest, PostsTheCompressedFile) {
   EXPECT_EQ(headerOf(request, "Content-Encoding"), "gzip");
   EXPECT_EQ(request.headers.size(), 2U);
   EXPECT_EQ(lastBody(), "what happened");
-  EXPECT_TRUE(request.requiresHttps);
   EXPECT_EQ(request.timeout, std::chrono::seconds(60));
   EXPECT_EQ(log.count(log::Level::standard, "UploadBackend(uploadFileAtPath): Uploading file " + path), 1);
 }
@@ -234,10 +233,14 @@ TEST_F(UploadBackendTest, RequestThatTheTransportDropsHoldsNobodyUp) {
   EXPECT_TRUE(log.contains("UploadBackend(uploadFileAtPath): post "));
 }
 
-TEST_F(UploadBackendTest, OnlyInternalBuildsSpeakPlainHttp) {
-  backend->setIsInternal(true);
-  EXPECT_TRUE(upload(directory.write("log", "text")));
-  EXPECT_FALSE(server->requests[0].requiresHttps);
+TEST_F(UploadBackendTest, PostsToTheAddressAsItIsConfigured) {
+  backend->setUploadURL("http://logs.example/up");
+  for (const bool isInternal : {false, true}) {
+    backend->setIsInternal(isInternal);
+    EXPECT_TRUE(upload(directory.write("log", "text")));
+    EXPECT_EQ(server->requests.back().url.find("http://logs.example/up?"), 0U);
+    EXPECT_FALSE(server->requests.back().requiresHttps);
+  }
 }
 
 TEST_F(UploadBackendTest, LargeBodiesGetMoreTimeUpToAnHour) {

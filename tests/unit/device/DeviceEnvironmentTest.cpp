@@ -156,6 +156,7 @@ TEST_F(DeviceEnvironmentTest, AssumesAVersionOfTheFramework) {
 
 TEST(UserInfoIdentifier, JoinsLowerCasedNames) {
   EXPECT_EQ(userInfoIdentifierString({{"_clientName", "Media"}, {"_serviceName", "Calls"}}), "media:calls");
+  EXPECT_EQ(userInfoIdentifierString({{"_clientName", "MÉDIA"}, {"_serviceName", "ПОЧТА"}}), "média:почта");
   EXPECT_EQ(userInfoIdentifierString({{"_clientName", "Media"}}), "media:");
   EXPECT_EQ(userInfoIdentifierString({{"_serviceName", "Calls"}}), ":calls");
   EXPECT_EQ(userInfoIdentifierString({}), ":");

@@ -7,6 +7,7 @@
 #include <array>
 #include <cstdlib>
 
+#include "platform/UserDefaults.h"
 #include "tests/support/RecordingLog.h"
 #include "tests/support/TemporaryDirectory.h"
 
@@ -136,7 +137,9 @@ class LocaleTest : public testing::Test {
   static void clear() {
     for (const char* name : {"LC_ALL", "LC_MESSAGES", "LANG", "TZ"}) ::unsetenv(name);
   }
-  [[nodiscard]] std::optional<std::string> country() const { return makeLocale(directory.path())->countryCode(); }
+  [[nodiscard]] std::optional<std::string> country() const {
+    return makeLocale(nullptr, directory.path())->countryCode();
+  }
   [[nodiscard]] std::optional<std::string> countryOf(const char* locale) const {
     ::setenv("LANG", locale, 1);
     return country();
@@ -184,7 +187,16 @@ TEST_F(LocaleTest, TellsTheOffsetOfTheZone) {
   EXPECT_EQ(makeLocale()->timeZoneOffset(), 19800);
   ::setenv("TZ", "XYZ+3", 1);
   EXPECT_EQ(makeLocale()->timeZoneOffset(), -10800);
+}
+
+TEST_F(LocaleTest, AsksTheSuiteOfTheTimeDaemonWhetherItSetsTheZone) {
   EXPECT_EQ(makeLocale()->automaticTimeZoneEnabled(), std::nullopt);
+  const auto locale = makeLocale(openUserDefaults(kTimeDefaultsSuite, directory / "state", directory / "etc"));
+  EXPECT_EQ(locale->automaticTimeZoneEnabled(), std::nullopt);
+  directory.write("etc/com.tavrin.timed.json", "{\"TMAutomaticTimeZoneEnabled\": false}");
+  EXPECT_EQ(locale->automaticTimeZoneEnabled(), false);
+  directory.write("state/com.tavrin.timed.json", "{\"TMAutomaticTimeZoneEnabled\": true}");
+  EXPECT_EQ(locale->automaticTimeZoneEnabled(), true);
 }
 
 }  // namespace

@@ -12,43 +12,12 @@ namespace {
 
 class PersistentIdentifierTest : public testing::Test {
  protected:
-  std::string custom(const char* prefix, const char* suffix) {
-    const std::string prefixText = prefix != nullptr ? prefix : "";
-    const std::string suffixText = suffix != nullptr ? suffix : "";
-    return getPersistentIdentifierForCustomClientIDSuffix(defaults, prefix != nullptr ? &prefixText : nullptr,
-                                                          suffix != nullptr ? &suffixText : nullptr);
-  }
-
   test::RecordingLog log;
   test::FakeUserDefaults defaults;
 };
 
 bool isUuidText(const std::string& text) {
   return text.size() == 36 && text.find_first_not_of("0123456789ABCDEF-") == std::string::npos && text[14] == '4';
-}
-
-TEST_F(PersistentIdentifierTest, StaysTheSameForOneSuffix) {
-  const auto first = custom("abc", "def");
-  EXPECT_TRUE(isUuidText(first)) << first;
-  EXPECT_EQ(custom("abc", "def"), first);
-  EXPECT_NE(custom("abc", "other"), first);
-  EXPECT_NE(custom("other", "def"), first);
-  EXPECT_EQ(defaults.value("uuid:abc:def"), PropertyValue(first));
-  EXPECT_EQ(log.count(log::Level::standard,
-                      "getPersistentIdentifierForCustomClientIDSuffix: The value for uuid:abc:def: " + first),
-            2);
-}
-
-TEST_F(PersistentIdentifierTest, TakesAbsentPartsForEmpty) {
-  const auto identifier = custom(nullptr, nullptr);
-  EXPECT_EQ(defaults.value("uuid::"), PropertyValue(identifier));
-  EXPECT_EQ(custom("", ""), identifier);
-}
-
-TEST_F(PersistentIdentifierTest, ChangesWhenTheStoredValueIsRemoved) {
-  const auto first = custom("a", "b");
-  ASSERT_TRUE(defaults.remove("uuid:a:b"));
-  EXPECT_NE(custom("a", "b"), first);
 }
 
 TEST_F(PersistentIdentifierTest, KeepsOneForEachKindOfConsent) {

@@ -152,6 +152,32 @@ TEST_F(UserDefaultsTest, RefusesWhatCannotBeStored) {
   EXPECT_EQ(suite->value("key"), PropertyValue(1));
 }
 
+TEST_F(UserDefaultsTest, WithdrawsConsentInAFullFile) {
+  const auto suite = open();
+  constexpr std::size_t kMaximumBytes = 4U * 1024 * 1024;
+  const std::string frame = "{\n  \"large\": \"\"\n}\n";
+  ASSERT_TRUE(suite->set("large", std::string(kMaximumBytes - frame.size(), 'x')));
+  EXPECT_FALSE(suite->set("small", 1));
+  for (const bool consent : {true, false, true, false}) {
+    ASSERT_TRUE(suite->set(kDiagnosticsAndUsageSetting, consent));
+    EXPECT_EQ(open()->value(kDiagnosticsAndUsageSetting), PropertyValue(consent));
+  }
+  EXPECT_FALSE(suite->set("small", 1));
+  EXPECT_TRUE(suite->set("large", "now less"));
+  EXPECT_TRUE(suite->set("small", 1));
+}
+
+TEST_F(UserDefaultsTest, ChangesAFullFileThatHasNoBlanks) {
+  std::string text = R"({"last":[1,2],"list":[1)";
+  for (int i = 0; i < 700'000; ++i) text += ",1";
+  directory.write("state/suite.json", text + "]}");
+  const auto suite = open();
+  EXPECT_TRUE(suite->set(kDiagnosticsAndUsageSetting, false));
+  EXPECT_TRUE(suite->set("last", 1));
+  EXPECT_EQ(open()->value("last"), PropertyValue(1));
+  EXPECT_EQ(open()->value("list")->array()->size(), 700'001U);
+}
+
 TEST_F(UserDefaultsTest, TellsWhenItCannotWrite) {
   directory.write("state", "a file where the directory should be");
   const auto suite = open();

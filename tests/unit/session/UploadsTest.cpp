@@ -78,6 +78,14 @@ TEST_F(UploadsTest, DashboardComesLast) {
   EXPECT_EQ(displayURL(), "d");
 }
 
+TEST_F(UploadsTest, MessageLogNamesTheFileByItsAddress) {
+  prepareBackend = [](FakeBackend& each) { each.takesUploads = true; };
+  start({"upload_server"});
+  EXPECT_EQ(uploadFile("/tmp/a b"), true);
+  EXPECT_EQ(messageLog.journal.entries(),
+            std::vector<std::string>{"[uploadFileWithURL] Upload succeeded for file file:///tmp/a%20b"});
+}
+
 TEST_F(UploadsTest, EveryBackendIsOfferedTheFile) {
   prepareBackend = [](FakeBackend& each) { each.takesUploads = each.name() != "quill"; };
   start({"splunk", "korrin", "quill"});
