@@ -61,6 +61,16 @@ ThreadPoolOptions poolOptions() {
   return options;
 }
 
+/// One thread that never ends: an answer for which the agent's lock is held must not depend on a thread that the system
+/// may refuse. One is enough, because no task there waits for another.
+ThreadPoolOptions storebagPoolOptions() {
+  ThreadPoolOptions options;
+  options.runningThreads = 1;
+  options.maximumThreads = 1;
+  options.idleThreadLifetime = Duration::max();
+  return options;
+}
+
 std::string storebagDirectory(const Directories& directories) { return directories.cache + "/storebags"; }
 
 std::string textSetting(const UserDefaults& defaults, std::string_view key) {
@@ -137,7 +147,7 @@ DaemonProcess::Parts::Parts(const DaemonOptions& options, process::RunLoop& loop
       directories(daemonDirectories()),
       udpSockets(makeUdpSocketService()),
       pool(makeThreadPool(poolOptions())),
-      storebagPool(makeThreadPool()),
+      storebagPool(makeThreadPool(storebagPoolOptions())),
       defaults(openUserDefaults(kVelkReportingDefaultsSuite, directories.state, directories.configuration)),
       device(makeDeviceInformation(directories.configuration)),
       locale(makeLocale()),
@@ -169,7 +179,10 @@ DaemonProcess::Parts::Parts(const DaemonOptions& options, process::RunLoop& loop
       acceptQueue(pool->makeSerialQueue("com.tavrin.velkreportingd.accept")),
       reloadQueue(pool->makeSerialQueue("com.tavrin.velkreportingd.reload")),
       eventLoop("velk-ipc"),
-      entitlements(std::make_shared<EntitlementRules>(EntitlementRules::load(directories.configuration))) {}
+      entitlements(std::make_shared<EntitlementRules>(EntitlementRules::load(directories.configuration))) {
+  // Starts the thread, early.
+  storebagPool->makeSerialQueue("com.tavrin.velkreportingd.storebag")->async([] {});
+}
 
 bool DaemonProcess::Parts::hasEntitlement(std::string_view name, const Connection& connection) {
   std::shared_ptr<const EntitlementRules> rules;
