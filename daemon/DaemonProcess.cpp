@@ -3,6 +3,7 @@
 #include <atomic>
 #include <vector>
 
+#include "daemon/FrameworkVersion.h"
 #include "daemon/IdleWatch.h"
 #include "daemon/IncomingConnection.h"
 #include "daemon/MessageLogFile.h"
@@ -158,7 +159,7 @@ DaemonProcess::Parts::Parts(const DaemonOptions& options, process::RunLoop& loop
       logSubmission(makeLogSubmission(textSetting(*defaults, kLogSpoolSetting))),
       adaptorBundle(makeAdaptorBundle(directories.configuration)),
       powerLog(makePowerLog(*defaults)),
-      environment(*defaults, *device),
+      environment(*defaults, *device, installedFrameworkVersion(directories.data)),
       idleWatch(
           *pool, idleLimit(options, activated), [this] { return isOccupied(); }, [this] { runLoop.wakeUp(); }),
       platform{systemClock(),  *pool,           *defaults, *device,     *locale,        *http,
