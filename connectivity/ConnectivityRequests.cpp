@@ -10,8 +10,6 @@ namespace {
 
 namespace texts = connectivity_texts;
 
-constexpr std::uint32_t kPullDelayBound = 7200;
-
 std::optional<std::string> text(const std::optional<Error>& error) {
   if (!error) return std::nullopt;
   return error->description;
@@ -90,18 +88,25 @@ void ReportingSessionConnectivityHelper::postFile(HttpRequest request, HttpCompl
   deleteContainerAtURL(container);
 }
 
-void ReportingSessionConnectivityHelper::getURLRequestWithCompletionHandler(HttpRequest request, bool isUrgent,
-                                                                            HttpCompletion completion) {
+std::optional<std::uint32_t> ReportingSessionConnectivityHelper::getURLRequestWithCompletionHandler(
+    HttpRequest request, bool isUrgent, HttpCompletion completion, std::optional<std::uint32_t> delay) {
   if (_mode != GETRequestMode() && _mode != kBackgroundGETMode) {
     log::error(texts::kGetWrongMode, _mode);
     completion({}, nullptr, errorObject(texts::kGetUnrecognizedModeError, _mode));
-    return;
+    return std::nullopt;
   }
   if (!takeRequest(request.url)) {
     log::standard(texts::kGetDuplicate, request.url);
-    return;
+    return std::nullopt;
   }
-  schedulePull(std::move(request), isUrgent, std::move(completion));
+  if (isUrgent) {
+    delay = 0;
+  } else if (!delay) {
+    delay = _platform.random.below(kPullDelayBound);
+  }
+  request.isUrgent = isUrgent;
+  schedulePull(std::move(request), isUrgent, *delay, std::move(completion));
+  return delay;
 }
 
 // The mere presence of an entry counts: an address is pulled once in a helper's life.
@@ -115,8 +120,8 @@ void ReportingSessionConnectivityHelper::setRequestInProgress(const std::string&
   _requestInProgress[url] = inProgress;
 }
 
-void ReportingSessionConnectivityHelper::schedulePull(HttpRequest request, bool isUrgent, HttpCompletion completion) {
-  const std::uint32_t delay = isUrgent ? 0 : _platform.random.below(kPullDelayBound);
+void ReportingSessionConnectivityHelper::schedulePull(HttpRequest request, bool isUrgent, std::uint32_t delay,
+                                                      HttpCompletion completion) {
   if (isUrgent) {
     log::standard(texts::kGetUrgent, request.url);
   } else {

@@ -41,6 +41,8 @@ class ReportingSessionConnectivityHelper : public ReportingSessionConnectivityIn
   static constexpr std::int32_t kBackgroundGETMode = 2;
   [[nodiscard]] static constexpr std::int32_t POSTRequestMode() noexcept { return 4; }
   [[nodiscard]] static constexpr std::int32_t GETRequestMode() noexcept { return 8; }
+  /// Seconds. The random delay of a pull that is not urgent is less.
+  static constexpr std::uint32_t kPullDelayBound = 7200;
 
   // The folder of file-backed uploads.
   [[nodiscard]] static std::string storageRootFolder();
@@ -82,8 +84,11 @@ class ReportingSessionConnectivityHelper : public ReportingSessionConnectivityIn
   /// Waits while RequestWindow::kMaximumRequests are under way; not once the helper has been invalidated.
   void waitForRoom(std::uint64_t sender) override;
   /// Dropped, completion uncalled: an address that this helper has been asked for before, finished or not.
-  /// Urgent pulls start at once, others after a random delay of less than two hours.
-  void getURLRequestWithCompletionHandler(HttpRequest request, bool isUrgent, HttpCompletion completion);
+  /// Urgent pulls start at once, others after `delay` seconds; without one, after a random delay below kPullDelayBound.
+  /// Returns the delay of a pull that will be made, nothing for one that will not.
+  std::optional<std::uint32_t> getURLRequestWithCompletionHandler(HttpRequest request, bool isUrgent,
+                                                                  HttpCompletion completion,
+                                                                  std::optional<std::uint32_t> delay = std::nullopt);
 
   [[nodiscard]] HttpSessionConfiguration privateURLSessionConfigWithMode(std::int32_t mode) const;
 
@@ -121,7 +126,7 @@ class ReportingSessionConnectivityHelper : public ReportingSessionConnectivityIn
   [[nodiscard]] HttpCompletion pullWrapper(std::string url, HttpCompletion completion);
   void createHelperForTask(HttpTask& task, HttpCompletion completion);
 
-  void schedulePull(HttpRequest request, bool isUrgent, HttpCompletion completion);
+  void schedulePull(HttpRequest request, bool isUrgent, std::uint32_t delay, HttpCompletion completion);
   void setRequestInProgress(const std::string& url, bool inProgress);
   [[nodiscard]] bool takeRequest(const std::string& url);
 

@@ -3,6 +3,7 @@
 #include <atomic>
 #include <vector>
 
+#include "daemon/FrameworkVersion.h"
 #include "daemon/IdleWatch.h"
 #include "daemon/IncomingConnection.h"
 #include "daemon/MessageLogFile.h"
@@ -58,6 +59,16 @@ std::optional<Duration> idleLimit(const DaemonOptions& options, bool activated) 
 ThreadPoolOptions poolOptions() {
   ThreadPoolOptions options;
   options.emergencyThreads = kEmergencyThreads;
+  return options;
+}
+
+/// One thread that never ends: an answer for which the agent's lock is held must not depend on a thread that the system
+/// may refuse. One is enough, because no task there waits for another.
+ThreadPoolOptions storebagPoolOptions() {
+  ThreadPoolOptions options;
+  options.runningThreads = 1;
+  options.maximumThreads = 1;
+  options.idleThreadLifetime = Duration::max();
   return options;
 }
 
@@ -137,7 +148,7 @@ DaemonProcess::Parts::Parts(const DaemonOptions& options, process::RunLoop& loop
       directories(daemonDirectories()),
       udpSockets(makeUdpSocketService()),
       pool(makeThreadPool(poolOptions())),
-      storebagPool(makeThreadPool()),
+      storebagPool(makeThreadPool(storebagPoolOptions())),
       defaults(openUserDefaults(kVelkReportingDefaultsSuite, directories.state, directories.configuration)),
       device(makeDeviceInformation(directories.configuration)),
       locale(makeLocale(openUserDefaults(kTimeDefaultsSuite, directories.state, directories.configuration))),
@@ -148,7 +159,7 @@ DaemonProcess::Parts::Parts(const DaemonOptions& options, process::RunLoop& loop
       logSubmission(makeLogSubmission(textSetting(*defaults, kLogSpoolSetting))),
       adaptorBundle(makeAdaptorBundle(directories.configuration)),
       powerLog(makePowerLog(*defaults)),
-      environment(*defaults, *device),
+      environment(*defaults, *device, installedFrameworkVersion(directories.data)),
       idleWatch(
           *pool, idleLimit(options, activated), [this] { return isOccupied(); }, [this] { runLoop.wakeUp(); }),
       platform{systemClock(),  *pool,           *defaults, *device,     *locale,        *http,
@@ -169,7 +180,10 @@ DaemonProcess::Parts::Parts(const DaemonOptions& options, process::RunLoop& loop
       acceptQueue(pool->makeSerialQueue("com.tavrin.velkreportingd.accept")),
       reloadQueue(pool->makeSerialQueue("com.tavrin.velkreportingd.reload")),
       eventLoop("velk-ipc"),
-      entitlements(std::make_shared<EntitlementRules>(EntitlementRules::load(directories.configuration))) {}
+      entitlements(std::make_shared<EntitlementRules>(EntitlementRules::load(directories.configuration))) {
+  // Starts the thread, early.
+  storebagPool->makeSerialQueue("com.tavrin.velkreportingd.storebag")->async([] {});
+}
 
 bool DaemonProcess::Parts::hasEntitlement(std::string_view name, const Connection& connection) {
   std::shared_ptr<const EntitlementRules> rules;

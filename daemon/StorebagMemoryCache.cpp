@@ -18,6 +18,10 @@ std::int32_t clientTypeOf(const ReportingdSession& session) {
   return sessionInfo ? int32Value(sessionInfo->find(kVelkReportingSessionInfoClientType)) : 0;
 }
 
+bool isLater(const TimeValue& time, const TimeValue& other) {
+  return secondsFromTimeValue(time) > secondsFromTimeValue(other);
+}
+
 PropertyValue dateValue(const TimeValue& time) { return Date{secondsFromTimeValue(time)}; }
 
 std::string_view stateText(bool succeeded) { return succeeded ? "Fetch Successful" : "Fetch Failure"; }
@@ -38,7 +42,8 @@ std::optional<PropertyDictionary> StorebagMemoryCache::storebagForSession(const 
 bool StorebagMemoryCache::mustFetch(const std::string& name, const Entry& entry, std::int32_t clientType) const {
   if (entry.expired) return true;
   const auto onDisk = _service.diskModificationDate(name);
-  if (onDisk && secondsFromTimeValue(*onDisk) > secondsFromTimeValue(entry.fetchTime)) {
+  // A refresh may be quicker than the fetch that started it, and its file older than that fetch's end.
+  if (onDisk && (isLater(*onDisk, entry.fetchTime) || !entry.copyDate || isLater(*onDisk, *entry.copyDate))) {
     log::standard(daemontexts::kDiskCacheOverrides, name, dateValue(*onDisk), dateValue(entry.fetchTime));
     return true;
   }
@@ -77,6 +82,7 @@ void StorebagMemoryCache::fetchAndCacheStorebag(std::int32_t clientType) {
     log::error(daemontexts::kUnableToFetch, clientType);
   }
   entry.fetchTime = _clock.wallTime();
+  entry.copyDate = fetched.copyDate;
   entry.fetchSucceeded = found || fetched.handled;
   entry.maxAge = fetched.maxAge;
   entry.expired = false;

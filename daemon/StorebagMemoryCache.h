@@ -43,6 +43,8 @@ class StorebagMemoryCache {
     std::optional<PropertyDictionary> data;
     std::optional<std::string> version;
     TimeValue fetchTime;
+    /// Of the file on disk that the last fetch has seen.
+    std::optional<TimeValue> copyDate;
     bool fetchSucceeded = false;
     std::int32_t maxAge = 0;
     bool expired = false;

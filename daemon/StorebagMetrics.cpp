@@ -3,6 +3,7 @@
 #include <algorithm>
 #include <vector>
 
+#include "connectivity/ReportingSessionConnectivityHelper.h"
 #include "daemon/LogTexts.h"
 #include "foundation/Format.h"
 #include "foundation/Text.h"
@@ -18,6 +19,7 @@ std::string metricKey(const std::string& name, std::string_view metric) {
 
 std::string maxAgeKey(const std::string& name) { return metricKey(name, "max-age"); }
 std::string lastModifiedKey(const std::string& name) { return metricKey(name, "Last-Modified"); }
+std::string pullDueKey(const std::string& name) { return metricKey(name, "pull-due"); }
 
 void logUnlessWritten(const Result<void>& written) {
   if (!written) log::error("saveLastLoadedStorebagMetricsWithName: could not store the metrics: %@", written.error());
@@ -64,5 +66,19 @@ void StorebagMetrics::save(const std::string& name, const HttpResponse& response
                                            : _defaults.remove(lastModifiedKey(name)));
   log::standard(daemontexts::kMetricsSaved, name, maxAge, lastModified);
 }
+
+std::optional<std::uint32_t> StorebagMetrics::secondsUntilPullDue(const std::string& name, TimeValue now) const {
+  constexpr std::int64_t kLongest = ReportingSessionConnectivityHelper::kPullDelayBound;
+  const auto stored = _defaults.value(pullDueKey(name));
+  const auto* due = stored ? stored->integer() : nullptr;
+  if (due == nullptr || *due > now.seconds + kLongest) return std::nullopt;
+  return *due > now.seconds ? static_cast<std::uint32_t>(*due - now.seconds) : 0;
+}
+
+void StorebagMetrics::savePullDue(const std::string& name, TimeValue now, std::uint32_t delay) {
+  logUnlessWritten(_defaults.set(pullDueKey(name), now.seconds + delay));
+}
+
+void StorebagMetrics::removePullDue(const std::string& name) { logUnlessWritten(_defaults.remove(pullDueKey(name))); }
 
 }  // namespace velk

@@ -1,11 +1,12 @@
-// What the server said about a storebag's age, kept in the user-defaults suite between fetches. Used by the storebag
-// service under the storebag lock.
+// What is known about a storebag's age between fetches, kept in the user-defaults suite: what the server said, and when
+// a pull that waits is due. Used by the storebag service under the storebag lock.
 #pragma once
 
 #include <cstdint>
 #include <optional>
 #include <string>
 
+#include "foundation/TimeValue.h"
 #include "platform/HttpSession.h"
 #include "platform/UserDefaults.h"
 
@@ -28,6 +29,13 @@ class StorebagMetrics {
 
   /// From the headers of a successful answer.
   void save(const std::string& name, const HttpResponse& response);
+
+  /// What is left of the delay after which the storebag is to be pulled, 0 when that time has passed. Nothing when no
+  /// time is stored, or one that no delay explains: the clock jumped, or somebody wrote it.
+  [[nodiscard]] std::optional<std::uint32_t> secondsUntilPullDue(const std::string& name, TimeValue now) const;
+  void savePullDue(const std::string& name, TimeValue now, std::uint32_t delay);
+  /// The pull has been made.
+  void removePullDue(const std::string& name);
 
  private:
   UserDefaults& _defaults;

@@ -22,6 +22,7 @@ constexpr auto kRequestTimeout = std::chrono::seconds(15);
 constexpr std::uint32_t kHelperReleaseTimeout = 30;
 constexpr int kStatusOk = 200;
 constexpr const char* kStoppingError = "the daemon is about to end";
+constexpr const char* kLateError = "no answer came in time";
 
 const PropertyDictionary* sectionOf(const PropertyDictionary& storebag, std::optional<std::string_view> name) {
   return name ? storebag.dictionary(*name) : nullptr;
@@ -49,16 +50,18 @@ struct StorebagService::PendingFetch {
 
 std::shared_ptr<StorebagService> StorebagService::make(const Platform& platform, const DeviceEnvironment& environment,
                                                        std::unique_ptr<StorebagDiskCache> diskCache,
-                                                       StorebagPublicKeySource publicKey) {
+                                                       StorebagPublicKeySource publicKey, Duration answerLimit) {
   return std::shared_ptr<StorebagService>(
-      new StorebagService(platform, environment, std::move(diskCache), std::move(publicKey)));
+      new StorebagService(platform, environment, std::move(diskCache), std::move(publicKey), answerLimit));
 }
 
 StorebagService::StorebagService(const Platform& platform, const DeviceEnvironment& environment,
-                                 std::unique_ptr<StorebagDiskCache> diskCache, StorebagPublicKeySource publicKey)
+                                 std::unique_ptr<StorebagDiskCache> diskCache, StorebagPublicKeySource publicKey,
+                                 Duration answerLimit)
     : _platform(platform),
       _environment(environment),
       _publicKey(std::move(publicKey)),
+      _answerLimit(answerLimit),
       _diskCache(std::move(diskCache)),
       _metrics(platform.defaults) {}
 
@@ -78,6 +81,7 @@ StorebagSection StorebagService::fetchStorebagForEnvironmentAndClientType(std::i
   const auto fetched = fetchStorebagWithName(std::string(*name));
   result.maxAge = fetched.maxAge;
   result.handled = fetched.handled;
+  result.copyDate = fetched.copyDate;
   if (!fetched.storebag) {
     if (!fetched.handled) log::error(daemontexts::kCouldNotFetch, clientType);
     return result;
@@ -111,52 +115,58 @@ StorebagSection StorebagService::fetchStorebagForEnvironmentAndClientType(std::i
 
 StorebagService::Fetched StorebagService::fetchStorebagWithName(const std::string& name) {
   Fetched fetched;
-  fetched.storebag = storebagFromDisk(name);
+  auto copy = copyFromDisk(name);
+  fetched.storebag = std::move(copy.storebag);
+  fetched.copyDate = copy.date;
   std::optional<ByteData> envelope;
-  if (!fetched.storebag) envelope = fetchSynchronously(name);
+  if (!fetched.storebag && !copy.lacksKey) envelope = fetchSynchronously(name);
   Guard guard(_storebagLock);
   // A refresh that has completed meanwhile may have changed it.
   fetched.maxAge = _metrics.maxAge(name);
-  if (envelope && !fetched.handled) fetched.storebag = verifyAndUnpackLocked(name, *envelope, Save::no);
+  if (!envelope) return fetched;
+  if (!fetched.handled) fetched.storebag = verifyAndUnpackLocked(name, *envelope, Save::no);
+  fetched.copyDate = _diskCache->modificationDate(name);
   return fetched;
 }
 
-std::optional<PropertyDictionary> StorebagService::storebagFromDisk(const std::string& name) {
-  std::optional<PropertyDictionary> storebag;
+StorebagService::DiskCopy StorebagService::copyFromDisk(const std::string& name) {
+  DiskCopy copy;
   std::optional<std::string> lastModified;
   bool expired = false;
   {
     Guard guard(_storebagLock);
-    storebag = usableDiskCopyLocked(name);
-    if (!storebag) return std::nullopt;
+    copy = diskCopyLocked(name);
+    if (!copy.storebag) return copy;
     const auto maxAge = _metrics.maxAge(name);
     _metrics.updateLastModified(name, lastModified);
-    expired = hasExpiredLocked(name, maxAge);
+    expired = hasExpired(copy, maxAge);
     log::standard(daemontexts::kLoadedFromDisk, name, expired ? daemontexts::kDiskExpired : daemontexts::kDiskValid);
   }
-  if (expired) refreshInBackground(name, lastModified);
-  return storebag;
+  // Nobody waits for it: the copy is served.
+  if (expired) pull(name, makeRequest(name, lastModified), false, nullptr);
+  return copy;
 }
 
-// A copy that cannot be used counts as none: it is verified before it decides anything, so that it can never start
-// the delayed refresh that would then stand in the way of the immediate fetch.
-std::optional<PropertyDictionary> StorebagService::usableDiskCopyLocked(const std::string& name) {
+// A copy that cannot be used counts as none: it is verified before it decides anything, so that it never starts a
+// delayed refresh in place of the immediate fetch.
+StorebagService::DiskCopy StorebagService::diskCopyLocked(const std::string& name) {
+  DiskCopy copy;
   if (_environment.isInternalBuild()) _diskCache->setStorageClassProtectionLevel(name);
+  copy.date = _diskCache->modificationDate(name);
   const auto envelope = _diskCache->loadStorebagFromDisk(name);
-  if (!envelope) return std::nullopt;
+  if (!envelope) return copy;
   const auto verified = verifyStorebagEnvelope(*envelope, _publicKey);
   // Without a key the file is not at fault and may be of use again.
-  if (verified.verdict == VerifiedBag::Verdict::noPublicKey) return std::nullopt;
-  std::optional<PropertyDictionary> storebag;
-  if (verified.verdict == VerifiedBag::Verdict::verified) storebag = unpackStorebag(name, verified.bag);
-  if (!storebag) _diskCache->setAside(name);
-  return storebag;
+  copy.lacksKey = verified.verdict == VerifiedBag::Verdict::noPublicKey;
+  if (copy.lacksKey) return copy;
+  if (verified.verdict == VerifiedBag::Verdict::verified) copy.storebag = unpackStorebag(name, verified.bag);
+  if (!copy.storebag) _diskCache->setAside(name);
+  return copy;
 }
 
-bool StorebagService::hasExpiredLocked(const std::string& name, std::int32_t maxAge) const {
-  const auto written = _diskCache->modificationDate(name);
-  if (!written) return true;
-  const auto age = std::abs(secondsFromTimeValue(_platform.clock.wallTime()) - secondsFromTimeValue(*written));
+bool StorebagService::hasExpired(const DiskCopy& copy, std::int32_t maxAge) const {
+  if (!copy.date) return true;
+  const auto age = std::abs(secondsFromTimeValue(_platform.clock.wallTime()) - secondsFromTimeValue(*copy.date));
   return age > maxAge;
 }
 
@@ -197,27 +207,79 @@ HttpRequest StorebagService::makeRequest(const std::string& name,
   return request;
 }
 
-std::shared_ptr<ReportingSessionConnectivityHelper> StorebagService::connectivityHelper() {
+std::shared_ptr<ReportingSessionConnectivityHelper> StorebagService::makeTransport() const {
+  const PropertyDictionary userInfo{{kVelkReportingUserInfoClientName, "storebag"},
+                                    {kVelkReportingUserInfoServiceName, "shared"}};
+  auto transport = ReportingSessionConnectivityHelper::initWithDelegate(
+      _platform, {}, ReportingSessionConnectivityHelper::GETRequestMode(), userInfo);
+  transport->activate(kHelperReleaseTimeout);
+  return transport;
+}
+
+void StorebagService::pull(const std::string& name, HttpRequest request, bool isUrgent, HttpCompletion answer) {
+  const auto url = request.url;
+  // Held until the due time has been stored, so that the pull cannot end first.
   Guard guard(_storebagLock);
-  // One that was made after `stop` would be invalidated by nobody.
-  if (isStopped()) return nullptr;
-  if (!_connectivityHelper) {
-    const PropertyDictionary userInfo{{kVelkReportingUserInfoClientName, "storebag"},
-                                      {kVelkReportingUserInfoServiceName, "shared"}};
-    _connectivityHelper = ReportingSessionConnectivityHelper::initWithDelegate(
-        _platform, {}, ReportingSessionConnectivityHelper::GETRequestMode(), userInfo);
-    _connectivityHelper->activate(kHelperReleaseTimeout);
+  // A transport that was made after `stop` would be invalidated by nobody.
+  if (isStopped()) return;
+  if (const auto pending = _pulls.find(url); pending != _pulls.end()) {
+    const auto& transport = pending->second.transport;
+    if (pending->second.isUrgent || !isUrgent) {
+      // It has been asked for this address: it logs the duplicate and drops it.
+      transport->getURLRequestWithCompletionHandler(std::move(request), isUrgent, std::move(answer));
+      return;
+    }
+    transport->invalidate();
   }
-  return _connectivityHelper;
+  const auto number = ++_lastPull;
+  const auto transport = makeTransport();
+  _pulls[url] = {number, isUrgent, transport};
+  HttpCompletion completion(
+      [weak = weak_from_this(), name, url, number, answer = std::move(answer)](
+          ByteData data, std::shared_ptr<const HttpResponse> response, std::optional<Error> error) mutable {
+        if (const auto service = weak.lock()) service->pullEnded(name, url, number, data, response.get(), error);
+        answer(std::move(data), std::move(response), std::move(error));
+      },
+      [weak = weak_from_this(), url, number] {
+        if (const auto service = weak.lock()) service->pullDropped(url, number);
+      });
+  const auto now = _platform.clock.wallTime();
+  const auto left = isUrgent ? std::nullopt : _metrics.secondsUntilPullDue(name, now);
+  const auto delay =
+      transport->getURLRequestWithCompletionHandler(std::move(request), isUrgent, std::move(completion), left);
+  if (!isUrgent && !left && delay) _metrics.savePullDue(name, now, *delay);
+}
+
+// On the transport's queue.
+void StorebagService::pullEnded(const std::string& name, const std::string& url, std::uint64_t number,
+                                const ByteData& data, const HttpResponse* response, const std::optional<Error>& error) {
+  Guard guard(_storebagLock);
+  networkAnsweredLocked(name, data, response, error);
+  const bool wasLetGo = !forgetPullLocked(url, number);
+  // One whose transport was let go before its time has not been made, and stays due.
+  if (!wasLetGo || response != nullptr) _metrics.removePullDue(name);
+}
+
+void StorebagService::pullDropped(const std::string& url, std::uint64_t number) {
+  Guard guard(_storebagLock);
+  forgetPullLocked(url, number);
+}
+
+bool StorebagService::forgetPullLocked(const std::string& url, std::uint64_t number) {
+  const auto found = _pulls.find(url);
+  if (found == _pulls.end() || found->second.number != number) return false;
+  found->second.transport->invalidate();
+  _pulls.erase(found);
+  return true;
 }
 
 void StorebagService::startAfresh() {
-  std::shared_ptr<ReportingSessionConnectivityHelper> helper;
+  Pulls pulls;
   {
     Guard guard(_storebagLock);
-    helper.swap(_connectivityHelper);
+    pulls.swap(_pulls);
   }
-  if (helper) helper->invalidate();
+  for (const auto& [url, pull] : pulls) pull.transport->invalidate();
 }
 
 void StorebagService::stop() {
@@ -253,23 +315,10 @@ void StorebagService::endWaiting(const std::shared_ptr<PendingFetch>& pending) {
   std::erase(_waiting, pending);
 }
 
-void StorebagService::refreshInBackground(const std::string& name, const std::optional<std::string>& lastModified) {
-  HttpCompletion completion([weak = weak_from_this(), name](ByteData data, std::shared_ptr<const HttpResponse> response,
-                                                            std::optional<Error> error) {
-    if (const auto service = weak.lock()) service->networkAnswered(name, data, response.get(), error);
-  });
-  auto request = makeRequest(name, lastModified);
-  if (const auto helper = connectivityHelper()) {
-    helper->getURLRequestWithCompletionHandler(std::move(request), false, std::move(completion));
-  }
-}
-
 std::optional<ByteData> StorebagService::fetchSynchronously(const std::string& name) {
   const auto pending = std::make_shared<PendingFetch>();
-  HttpCompletion completion(
-      [weak = weak_from_this(), pending, name](ByteData data, std::shared_ptr<const HttpResponse> response,
-                                               std::optional<Error> error) {
-        if (const auto service = weak.lock()) service->networkAnswered(name, data, response.get(), error);
+  HttpCompletion answer(
+      [pending](ByteData data, std::shared_ptr<const HttpResponse> response, std::optional<Error> error) {
         pending->answer(response ? response->statusCode : 0, std::move(data), std::move(error));
       },
       // The transport ignored or dropped the request: no answer can come, so the wait ends here.
@@ -280,12 +329,12 @@ std::optional<ByteData> StorebagService::fetchSynchronously(const std::string& n
   auto request = makeRequest(name, std::nullopt);
   const auto url = request.url;
   if (startWaiting(pending)) {
-    if (const auto helper = connectivityHelper()) {
-      helper->getURLRequestWithCompletionHandler(std::move(request), true, std::move(completion));
-    } else {
-      pending->answer(0, {}, errorObject(kStoppingError, -1));
+    pull(name, std::move(request), true, std::move(answer));
+    if (!pending->answered.waitFor(_answerLimit)) {
+      pending->answer(0, {}, errorObject(kLateError, -1));
+      // An answer of the same moment may have been the first one.
+      pending->answered.wait();
     }
-    pending->answered.wait();
     endWaiting(pending);
   }
   if (!pending->error && pending->statusCode == kStatusOk) return std::move(pending->data);
@@ -296,14 +345,12 @@ std::optional<ByteData> StorebagService::fetchSynchronously(const std::string& n
   return fallbackStorebag();
 }
 
-// On the transport's queue.
-void StorebagService::networkAnswered(const std::string& name, const ByteData& data, const HttpResponse* response,
-                                      const std::optional<Error>& error) {
+void StorebagService::networkAnsweredLocked(const std::string& name, const ByteData& data, const HttpResponse* response,
+                                            const std::optional<Error>& error) {
   if (error || response == nullptr || response->statusCode != kStatusOk) {
     log::standard(daemontexts::kNotChanged, name);
     return;
   }
-  Guard guard(_storebagLock);
   // Before the verification: an answer that fails it has still told the server's wishes.
   _metrics.save(name, *response);
   if (data.empty()) {

@@ -24,7 +24,8 @@ class ReportingServer {
     PropertyDictionary body;
   };
 
-  ReportingServer();
+  /// `listens` false: connections are refused until its `tls().startListening()`.
+  explicit ReportingServer(bool listens = true);
 
   [[nodiscard]] TlsTestServer& tls() { return _server; }
   [[nodiscard]] std::string url(std::string_view path) const { return _server.url(path); }

@@ -17,7 +17,7 @@ std::string textOf(const ByteData& bytes) { return {bytes.begin(), bytes.end()};
 
 }  // namespace
 
-ReportingServer::ReportingServer() {
+ReportingServer::ReportingServer(bool listens) : _server(true, listens) {
   auto pair = generateRsaKeyPair(2048);
   if (!pair) throw std::runtime_error(pair.error().description);
   _privateKey = pair->privateKeyPem;

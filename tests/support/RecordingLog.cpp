@@ -9,9 +9,11 @@ class RecordingLog::Recorder : public log::Sink {
   void write(log::Level level, std::string_view line) override {
     Guard guard(lock);
     lines.push_back(Line{level, std::string(line)});
+    added.notifyAll();
   }
 
   mutable Lock lock;
+  Condition added;
   std::vector<Line> lines VELK_GUARDED_BY(lock);
 };
 
@@ -39,6 +41,19 @@ bool RecordingLog::contains(std::string_view part) const {
   const auto all = lines();
   return std::any_of(all.begin(), all.end(),
                      [&](const Line& line) { return line.text.find(part) != std::string::npos; });
+}
+
+bool RecordingLog::waitFor(std::string_view part, int count, Duration limit) const {
+  const auto deadline = std::chrono::steady_clock::now() + limit;
+  Guard guard(_recorder->lock);
+  const auto isThere = [&](const std::vector<Line>& all) {
+    return std::count_if(all.begin(), all.end(),
+                         [&](const Line& line) { return line.text.find(part) != std::string::npos; }) >= count;
+  };
+  while (!isThere(_recorder->lines)) {
+    if (!_recorder->added.waitUntil(_recorder->lock, deadline)) return isThere(_recorder->lines);
+  }
+  return true;
 }
 
 void RecordingLog::clear() {

@@ -6,6 +6,7 @@
 #include <string_view>
 #include <vector>
 
+#include "foundation/TimeValue.h"
 #include "platform/Lock.h"
 #include "platform/Log.h"
 
@@ -30,6 +31,8 @@ class RecordingLog {
   [[nodiscard]] int count(std::string_view text) const;
   [[nodiscard]] int count(log::Level level, std::string_view text) const;
   [[nodiscard]] bool contains(std::string_view part) const;
+  /// Waits until `count` lines hold `part`, in tests on real queues. False when they do not come in time.
+  [[nodiscard]] bool waitFor(std::string_view part, int count = 1, Duration limit = std::chrono::seconds(20)) const;
   void clear();
 
  private:

@@ -167,10 +167,10 @@ const std::string* TlsTestServer::Request::header(std::string_view name) const {
 
 class TlsTestServer::Implementation {
  public:
-  explicit Implementation(bool encrypted) {
+  Implementation(bool encrypted, bool listens) {
     if (encrypted) makeContext();
-    listen();
-    _acceptor = std::thread([this] { acceptConnections(); });
+    bind();
+    if (listens) startListening();
   }
 
   ~Implementation() {
@@ -180,10 +180,15 @@ class TlsTestServer::Implementation {
     }
     changed.notifyAll();
     ::shutdown(_listener.get(), SHUT_RDWR);
-    _acceptor.join();
+    if (_acceptor.joinable()) _acceptor.join();
     closeConnections();
     for (auto& thread : _threads) thread.join();
     if (!caFile.empty()) ::unlink(caFile.c_str());
+  }
+
+  void startListening() {
+    require(::listen(_listener.get(), 128) == 0, "listening");
+    _acceptor = std::thread([this] { acceptConnections(); });
   }
 
   void closeConnections() {
@@ -213,14 +218,14 @@ class TlsTestServer::Implementation {
     SSL_CTX_use_PrivateKey(_context.get(), key.get());
   }
 
-  void listen() {
+  void bind() {
     _listener = FileDescriptor(::socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0));
     sockaddr_in address{};
     address.sin_family = AF_INET;
     address.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
     socklen_t size = sizeof address;
     auto* generic = reinterpret_cast<sockaddr*>(&address);
-    require(::bind(_listener.get(), generic, size) == 0 && ::listen(_listener.get(), 128) == 0, "listening");
+    require(::bind(_listener.get(), generic, size) == 0, "taking a port");
     ::getsockname(_listener.get(), generic, &size);
     port = ntohs(address.sin_port);
   }
@@ -297,8 +302,11 @@ class TlsTestServer::Implementation {
   bool _stopping VELK_GUARDED_BY(lock) = false;
 };
 
-TlsTestServer::TlsTestServer(bool encrypted) : _implementation(std::make_unique<Implementation>(encrypted)) {}
+TlsTestServer::TlsTestServer(bool encrypted, bool listens)
+    : _implementation(std::make_unique<Implementation>(encrypted, listens)) {}
 TlsTestServer::~TlsTestServer() = default;
+
+void TlsTestServer::startListening() { _implementation->startListening(); }
 
 int TlsTestServer::port() const { return _implementation->port; }
 

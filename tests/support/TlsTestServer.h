@@ -47,11 +47,14 @@ class TlsTestServer {
   /// Runs on the connection's thread; may block for a while.
   using Handler = std::function<Response(const Request&)>;
 
-  /// Answers 200 without a body until a handler is set. `encrypted` false: plain http.
-  explicit TlsTestServer(bool encrypted = true);
+  /// Answers 200 without a body until a handler is set. `encrypted` false: plain http. `listens` false: connections are
+  /// refused until `startListening`, while the port is the server's already.
+  explicit TlsTestServer(bool encrypted = true, bool listens = true);
   ~TlsTestServer();
   TlsTestServer(const TlsTestServer&) = delete;
   TlsTestServer& operator=(const TlsTestServer&) = delete;
+
+  void startListening();
 
   [[nodiscard]] int port() const;
   /// "https://127.0.0.1:PORT" and the path, which begins with a slash. The certificate also names "localhost".

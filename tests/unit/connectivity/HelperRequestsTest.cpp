@@ -132,6 +132,7 @@ TEST_F(HelperRequestsTest, AnUrgentPullStartsAtOnce) {
   ASSERT_EQ(http.startedTasks().size(), 1u);
   EXPECT_EQ(logged(texts::kGetUrgent, {"https://example.net/bag"}), 1);
   EXPECT_TRUE(fakes.random.bounds().empty());
+  EXPECT_TRUE(lastTask()->request().isUrgent);
   lastTask()->respond(200, "bag");
   scheduler().runUntilIdle();
   EXPECT_EQ(answer.calls, 1);
@@ -143,7 +144,7 @@ TEST_F(HelperRequestsTest, APullThatIsNotUrgentWaitsARandomWholeNumberOfSeconds)
   const auto helper = makeActive(8);
   fakes.random.push(7199);
   const auto now = fakes.clock().wallTime().seconds;
-  helper->getURLRequestWithCompletionHandler(request(), false, nullptr);
+  EXPECT_EQ(helper->getURLRequestWithCompletionHandler(request(), false, nullptr), 7199u);
   scheduler().runUntilIdle();
   EXPECT_EQ(fakes.random.bounds(), (std::vector<std::uint32_t>{7200}));
   EXPECT_EQ(logged(texts::kGetDelayed, {"https://example.net/bag", 7199, now, now + 7199}), 1);
@@ -151,7 +152,23 @@ TEST_F(HelperRequestsTest, APullThatIsNotUrgentWaitsARandomWholeNumberOfSeconds)
   EXPECT_TRUE(http.startedTasks().empty());
   scheduler().advance(1s);
   ASSERT_EQ(http.startedTasks().size(), 1u);
+  EXPECT_FALSE(lastTask()->request().isUrgent);
   lastTask()->respond(304);
+}
+
+TEST_F(HelperRequestsTest, APullWithAGivenDelayWaitsThatLong) {
+  const auto helper = makeActive(8);
+  const auto now = fakes.clock().wallTime().seconds;
+  EXPECT_EQ(helper->getURLRequestWithCompletionHandler(request(), false, nullptr, 40), 40u);
+  EXPECT_EQ(helper->getURLRequestWithCompletionHandler(request(), false, nullptr, 50), std::nullopt);
+  EXPECT_EQ(helper->getURLRequestWithCompletionHandler(request("https://a/"), false, nullptr, 0), 0u);
+  scheduler().advance(0s);
+  EXPECT_EQ(http.startedTasks().size(), 1u);
+  EXPECT_TRUE(fakes.random.bounds().empty());
+  EXPECT_EQ(logged(texts::kGetDelayed, {"https://example.net/bag", 40, now, now + 40}), 1);
+  scheduler().advance(40s);
+  ASSERT_EQ(http.startedTasks().size(), 2u);
+  for (const auto& task : http.startedTasks()) task->respond(304);
 }
 
 TEST_F(HelperRequestsTest, ASecondPullOfAnAddressIsIgnored) {

@@ -64,6 +64,11 @@ void MemoryStorebagFiles::remove(const std::string& name) {
   _files.erase(name);
 }
 
+void MemoryStorebagFiles::setUnreadable(bool unreadable) {
+  Guard guard(_lock);
+  _unreadable = unreadable;
+}
+
 int MemoryStorebagFiles::loads() const {
   Guard guard(_lock);
   return _loads;
@@ -91,6 +96,7 @@ class MemoryStorebagDiskCache : public StorebagDiskCache {
     {
       Guard guard(_files._lock);
       ++_files._loads;
+      if (_files._unreadable) return std::nullopt;
     }
     return _files.bytes(name);
   }

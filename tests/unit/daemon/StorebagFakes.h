@@ -47,6 +47,8 @@ class MemoryStorebagFiles {
   [[nodiscard]] std::optional<ByteData> bytes(const std::string& name) const;
   [[nodiscard]] std::optional<TimeValue> modificationDate(const std::string& name) const;
   void remove(const std::string& name);
+  /// While true no file can be loaded.
+  void setUnreadable(bool unreadable);
   [[nodiscard]] int loads() const;
   [[nodiscard]] std::set<std::string> setAside() const;
   [[nodiscard]] std::set<std::string> unprotected() const;
@@ -64,6 +66,7 @@ class MemoryStorebagFiles {
   std::map<std::string, File> _files VELK_GUARDED_BY(_lock);
   std::set<std::string> _setAside VELK_GUARDED_BY(_lock);
   std::set<std::string> _unprotected VELK_GUARDED_BY(_lock);
+  bool _unreadable VELK_GUARDED_BY(_lock) = false;
   int _loads VELK_GUARDED_BY(_lock) = 0;
 };
 

@@ -45,6 +45,8 @@ class StorebagFixture : public ::testing::Test {
 
   [[nodiscard]] std::size_t requestCount() { return http.startedTasks().size(); }
   [[nodiscard]] HttpRequest request(std::size_t number) { return http.waitForTask(number)->request(); }
+  /// Waits until that many pulls have been answered, and what came with them has been dealt with.
+  [[nodiscard]] bool waitForPulls(int count) { return log.waitFor("has been completed with error", count); }
   void setEnvironment(std::uint32_t type) { fakes.defaults.put("environmentType", type); }
   void advanceSeconds(double seconds) {
     fakes.clock().advance(std::chrono::duration_cast<Duration>(std::chrono::duration<double>(seconds)));
@@ -52,6 +54,20 @@ class StorebagFixture : public ::testing::Test {
   void putOnDisk(const std::string& name, const PropertyValue& bag, std::int32_t maxAge) {
     files.put(name, key.envelope(bag));
     fakes.defaults.put("CACHED_" + name + "_max-age", maxAge);
+  }
+
+  [[nodiscard]] std::optional<PropertyValue> pullDue(const std::string& name) const {
+    return fakes.defaults.value("CACHED_" + name + "_pull-due");
+  }
+  void setPullDue(const std::string& name, std::int64_t secondsFromNow) {
+    fakes.defaults.put("CACHED_" + name + "_pull-due", fakes.clock().wallTime().seconds + secondsFromNow);
+  }
+  /// The delays of the pulls that were asked for, as the log tells them.
+  [[nodiscard]] int pullsDelayedBy(int seconds) const {
+    const auto delay = formatText("' delayed by %d seconds has been initiated", {seconds});
+    int count = 0;
+    for (const auto& line : log.lines()) count += line.text.find(delay) != std::string::npos ? 1 : 0;
+    return count;
   }
 
   template <class... Arguments>

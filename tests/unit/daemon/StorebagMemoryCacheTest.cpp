@@ -66,13 +66,60 @@ TEST_F(StorebagMemoryCacheTest, WaitsAQuarterOfAnHourBetweenAttemptsThatFail) {
   EXPECT_EQ(logged(daemontexts::kStorebagMustWait, kBramble, 900), 1);
   EXPECT_EQ(logged(daemontexts::kFetchingStorebag, kBramble), 1);
   advanceSeconds(0.1);
-  // This attempt is ignored by the transport and counts as one more that failed.
+  serveStatus(404);
   EXPECT_EQ(storebag(), std::nullopt);
-  EXPECT_EQ(logged(daemontexts::kFetchingStorebag, kBramble), 2);
-  EXPECT_EQ(requestCount(), 1U);
-  advanceSeconds(1);
-  storebag();
+  EXPECT_EQ(requestCount(), 2U);
+  advanceSeconds(899);
+  serveBag(bagWithSections("1"));
+  EXPECT_EQ(storebag(), std::nullopt);
   EXPECT_EQ(logged(daemontexts::kStorebagMustWait, kBramble, 900), 2);
+  advanceSeconds(1);
+  EXPECT_EQ(sectionName(storebag()), "release");
+  EXPECT_EQ(version(), "1");
+  EXPECT_EQ(requestCount(), 3U);
+}
+
+TEST_F(StorebagMemoryCacheTest, PicksUpANewStorebagWithoutARestart) {
+  serveBag(bagWithSections("1"), {{"Cache-Control", "max-age=600"}});
+  storebag();
+  for (const auto* next : {"2", "3"}) {
+    advanceSeconds(601);
+    serveBag(bagWithSections(next), {{"Cache-Control", "max-age=600"}});
+    storebag();
+    EXPECT_NE(version(), next) << "nobody waits for the refresh";
+    ASSERT_TRUE(log.waitFor("has been completed with error", next[0] - '0'));
+    // The refresh was so quick that its file is no younger than the fetch that started it.
+    EXPECT_EQ(sectionName(storebag()), "release");
+    EXPECT_EQ(version(), next);
+  }
+  EXPECT_EQ(requestCount(), 3U);
+  storebag();
+  EXPECT_EQ(logged(daemontexts::kCachedStorebagFound, kBramble), 1);
+}
+
+TEST_F(StorebagMemoryCacheTest, AnUnchangedStorebagIsAskedForAgainWhenItHasAgedAgain) {
+  putOnDisk("bramble", bagWithSections("1"), 600);
+  serveStatus(304);
+  for (int round = 1; round <= 3; ++round) {
+    advanceSeconds(601);
+    EXPECT_EQ(sectionName(storebag()), "release");
+    ASSERT_TRUE(waitForPulls(round));
+  }
+  EXPECT_EQ(version(), "1");
+  EXPECT_EQ(requestCount(), 3U);
+}
+
+TEST_F(StorebagMemoryCacheTest, ACopyThatCannotBeReadIsTriedAgainAfterAQuarterOfAnHourAsWell) {
+  putOnDisk("bramble", bagWithSections(), 600);
+  files.setUnreadable(true);
+  serveNothing();
+  EXPECT_EQ(storebag(), std::nullopt);
+  EXPECT_EQ(storebag(), std::nullopt);
+  EXPECT_EQ(logged(daemontexts::kStorebagMustWait, kBramble, 900), 1);
+  files.setUnreadable(false);
+  advanceSeconds(900);
+  serveStatus(304);
+  EXPECT_EQ(sectionName(storebag()), "release");
 }
 
 TEST_F(StorebagMemoryCacheTest, ServesTheLastGoodSectionWhileFetchesFail) {

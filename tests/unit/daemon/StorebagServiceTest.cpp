@@ -177,31 +177,108 @@ TEST_F(StorebagServiceTest, AnUnchangedAnswerNeverRenewsTheAge) {
   EXPECT_EQ(logged(daemontexts::kNotChanged, "bramble"), 1);
 }
 
-TEST_F(StorebagServiceTest, ADelayedRefreshBlocksAnImmediateFetchOfTheSameStorebag) {
+TEST_F(StorebagServiceTest, ADelayedRefreshGivesWayToAnImmediateFetch) {
+  putOnDisk("bramble", bagWithSections("old"), 600);
+  advanceSeconds(601);
+  fakes.random.setRest(7199);
+  serveBag(bagWithSections("new"));
+  fetch();
+  EXPECT_EQ(requestCount(), 0U);
+  files.remove("bramble");
+  EXPECT_EQ(fetch().version, "new");
+  EXPECT_TRUE(request(0).isUrgent);
+  EXPECT_EQ(pullDue("bramble"), std::nullopt);
+}
+
+TEST_F(StorebagServiceTest, ARefreshThatIsPendingIsNotAskedForTwice) {
   putOnDisk("bramble", bagWithSections(), 600);
   advanceSeconds(601);
   fakes.random.setRest(7199);
-  serveBag(bagWithSections());
   fetch();
-  files.remove("bramble");
-  const auto blocked = fetch();
-  EXPECT_EQ(blocked.section, std::nullopt);
-  EXPECT_EQ(requestCount(), 0U);
-  EXPECT_EQ(loggedAsError(daemontexts::kCouldNotFetch, kBramble), 1);
-  EXPECT_TRUE(log.contains("fetchNetworkStorebag: Error resolving with lookup server " + defaultUrl()));
-  // A new transport has been asked for nothing yet.
-  service->startAfresh();
-  EXPECT_EQ(sectionName(fetch().section), "release");
+  fetch();
+  EXPECT_EQ(pullsDelayedBy(7199), 1);
+  EXPECT_EQ(
+      log.count("getURLRequestWithCompletionHandler: ignored duplicate request for storebag '" + defaultUrl() + "'"),
+      1);
+  EXPECT_EQ(http.sessions().size(), 1U);
 }
 
-TEST_F(StorebagServiceTest, ASecondFetchOfAStorebagThatWasFetchedIsIgnoredAndFailsAtOnce) {
-  serveStatus(500);
-  EXPECT_EQ(fetch().section, std::nullopt);
-  EXPECT_EQ(logged(daemontexts::kErrorResolving, defaultUrl(), "status 500"), 1);
-  serveBag(bagWithSections());
-  EXPECT_EQ(fetch().section, std::nullopt);
+TEST_F(StorebagServiceTest, ARefreshThatRunsIsNotAskedForTwice) {
+  putOnDisk("bramble", bagWithSections(), 600);
+  advanceSeconds(601);
+  fetch();
+  const auto task = http.waitForTask(0);
+  EXPECT_FALSE(task->request().isUrgent);
+  fetch();
   EXPECT_EQ(requestCount(), 1U);
-  EXPECT_EQ(logged(daemontexts::kNotChanged, "bramble"), 2);
+  task->respond(304);
+  ASSERT_TRUE(waitForPulls(1));
+  fetch();
+  ASSERT_NE(http.waitForTask(1), nullptr) << "an unchanged copy stays expired, and is asked for again";
+  http.waitForTask(1)->respond(304);
+}
+
+TEST_F(StorebagServiceTest, AnImmediateFetchGoesBesideARefreshThatRuns) {
+  putOnDisk("bramble", bagWithSections("old"), 600);
+  advanceSeconds(601);
+  fetch();
+  const auto refresh = http.waitForTask(0);
+  files.remove("bramble");
+  serveBag(bagWithSections("new"));
+  EXPECT_EQ(fetch().version, "new");
+  refresh->respond(304);
+  ASSERT_TRUE(waitForPulls(2));
+  EXPECT_EQ(files.bytes("bramble"), key.envelope(bagWithSections("new")));
+}
+
+TEST_F(StorebagServiceTest, APullLeavesThoseOfOtherNamesAlone) {
+  putOnDisk("bramble", bagWithSections(), 600);
+  putOnDisk("clover", bagWithSections(), 600);
+  advanceSeconds(601);
+  fetch();
+  fetch(6);
+  const auto bramble = http.waitForTask(0);
+  const auto clover = http.waitForTask(1);
+  bramble->respond(304);
+  ASSERT_TRUE(waitForPulls(1));
+  fetch();
+  http.waitForTask(2)->respond(304);
+  clover->respond(200, test::textOf(key.envelope(bagWithSections("new"))));
+  ASSERT_TRUE(waitForPulls(3));
+  EXPECT_EQ(files.bytes("clover"), key.envelope(bagWithSections("new")));
+}
+
+TEST_F(StorebagServiceTest, AFetchThatFailedIsMadeAgain) {
+  serveStatus(404);
+  EXPECT_EQ(fetch().section, std::nullopt);
+  EXPECT_EQ(logged(daemontexts::kErrorResolving, defaultUrl(), "status 404"), 1);
+  serveNothing();
+  EXPECT_EQ(fetch().section, std::nullopt);
+  http.failTaskCreation(Error{"HttpErrorDomain", 27, "Too many open files"});
+  EXPECT_EQ(fetch().section, std::nullopt);
+  http.failTaskCreation(std::nullopt);
+  serveBag(bagWithSections());
+  EXPECT_EQ(sectionName(fetch().section), "release");
+  EXPECT_EQ(requestCount(), 3U);
+}
+
+TEST_F(StorebagServiceTest, LetsGoOfEveryTransportBehindItsPull) {
+  serveStatus(404);
+  fetch();
+  fetch();
+  pool->stop();
+  ASSERT_EQ(http.sessions().size(), 2U);
+  for (const auto& session : http.sessions()) EXPECT_FALSE(session->hasDelegate());
+}
+
+TEST_F(StorebagServiceTest, AnAnswerThatDoesNotComeIsWaitedForWithinBounds) {
+  const auto impatient = StorebagService::make(platform(), environment, files.cache(), key.source(), 20ms);
+  EXPECT_EQ(impatient->fetchStorebagForEnvironmentAndClientType(kBramble).section, std::nullopt);
+  EXPECT_EQ(logged(daemontexts::kErrorResolving, defaultUrl(), "no answer came in time"), 1);
+  // It is worth keeping all the same.
+  http.waitForTask(0)->respond(200, test::textOf(key.envelope(bagWithSections("late"))));
+  ASSERT_TRUE(waitForPulls(1));
+  EXPECT_EQ(impatient->fetchStorebagForEnvironmentAndClientType(kBramble).version, "late");
 }
 
 TEST_F(StorebagServiceTest, ATransportThatCannotMakeATaskFailsTheFetchAtOnce) {
@@ -300,7 +377,122 @@ TEST_F(StorebagServiceTest, KeepsACopyThatOnlyLacksAKeyToVerifyItWith) {
   EXPECT_EQ(keyless->fetchStorebagForEnvironmentAndClientType(kBramble).section, std::nullopt);
   EXPECT_TRUE(files.setAside().empty());
   EXPECT_TRUE(files.bytes("bramble").has_value());
+  EXPECT_EQ(requestCount(), 0U) << "nothing that comes could be verified";
+  advanceSeconds(601);
+  EXPECT_EQ(keyless->fetchStorebagForEnvironmentAndClientType(kBramble).section, std::nullopt);
   keyless->startAfresh();
+  EXPECT_TRUE(http.sessions().empty());
+}
+
+class PullDueTest : public StorebagServiceTest {
+ protected:
+  /// A copy that has expired.
+  PullDueTest() {
+    putOnDisk("bramble", bagWithSections("old"), 600);
+    advanceSeconds(601);
+    fakes.random.setRest(7199);
+  }
+  /// The next daemon, with the same files and settings.
+  void restart() {
+    service->stop();
+    next = StorebagService::make(platform(), environment, files.cache(), key.source());
+  }
+  ~PullDueTest() override {
+    if (next) next->startAfresh();
+  }
+  StorebagSection fetchAgain() { return next->fetchStorebagForEnvironmentAndClientType(kBramble); }
+
+  std::shared_ptr<StorebagService> next;
+};
+
+TEST_F(PullDueTest, IsKeptWhileThePullWaits) {
+  fetch();
+  EXPECT_EQ(pullDue("bramble"), PropertyValue(fakes.clock().wallTime().seconds + 7199));
+}
+
+TEST_F(PullDueTest, IsTakenOverByTheNextDaemon) {
+  fetch();
+  const auto due = pullDue("bramble");
+  restart();
+  EXPECT_EQ(pullDue("bramble"), due);
+  advanceSeconds(7000);
+  EXPECT_EQ(fetchAgain().version, "old");
+  EXPECT_EQ(pullsDelayedBy(199), 1);
+  EXPECT_EQ(pullDue("bramble"), due);
+}
+
+TEST_F(PullDueTest, ThatHasPassedPullsAtOnceButNobodyWaits) {
+  fetch();
+  restart();
+  advanceSeconds(100'000);
+  EXPECT_EQ(fetchAgain().version, "old");
+  const auto task = http.waitForTask(0);
+  EXPECT_FALSE(task->request().isUrgent);
+  EXPECT_EQ(pullsDelayedBy(0), 1);
+  EXPECT_TRUE(pullDue("bramble").has_value());
+  task->respond(200, test::textOf(key.envelope(bagWithSections("new"))));
+  ASSERT_TRUE(waitForPulls(1));
+  EXPECT_EQ(pullDue("bramble"), std::nullopt);
+  EXPECT_EQ(fetchAgain().version, "new");
+}
+
+TEST_F(PullDueTest, IsOverWhateverThePullBrought) {
+  for (const auto& answer : {test::FakeAnswer{304, "", {}, std::nullopt}, test::FakeAnswer{500, "", {}, std::nullopt},
+                             test::FakeAnswer{0, "", {}, Error{"HttpErrorDomain", 7, "could not connect"}}}) {
+    setPullDue("bramble", -1);
+    serve(answer);
+    fetch();
+    ASSERT_TRUE(waitForPulls(1));
+    EXPECT_EQ(pullDue("bramble"), std::nullopt);
+    log.clear();
+  }
+  EXPECT_EQ(requestCount(), 3U);
+  setPullDue("bramble", -1);
+  http.failTaskCreation(Error{"HttpErrorDomain", 27, "Too many open files"});
+  fetch();
+  ASSERT_TRUE(log.waitFor("has been cancelled as NetSession data task creation has failed"));
+  EXPECT_EQ(pullDue("bramble"), std::nullopt);
+}
+
+TEST_F(PullDueTest, StaysWhenStorebagsAreFetchedAfresh) {
+  fetch();
+  const auto due = pullDue("bramble");
+  service->startAfresh();
+  advanceSeconds(99);
+  fetch();
+  EXPECT_EQ(pullsDelayedBy(7100), 1);
+  EXPECT_EQ(pullDue("bramble"), due);
+}
+
+TEST_F(PullDueTest, OfAPullThatTheEndOfTheDaemonCutsOffStays) {
+  setPullDue("bramble", 0);
+  fetch();
+  const auto task = http.waitForTask(0);
+  service->stop();
+  task->fail(42, "the HTTP session service has ended");
+  ASSERT_TRUE(waitForPulls(1));
+  EXPECT_TRUE(pullDue("bramble").has_value());
+}
+
+TEST_F(PullDueTest, ThatNoDelayExplainsCountsAsNone) {
+  const auto now = fakes.clock().wallTime().seconds;
+  for (const PropertyValue& absurd : {PropertyValue(now + 7201), PropertyValue(INT64_MAX), PropertyValue(UINT64_MAX),
+                                      PropertyValue("soon"), PropertyValue(true), PropertyValue(Date{5})}) {
+    fakes.defaults.put("CACHED_bramble_pull-due", absurd);
+    fetch();
+    EXPECT_EQ(pullDue("bramble"), PropertyValue(now + 7199));
+    service->startAfresh();
+  }
+  setPullDue("bramble", 7200);
+  fetch();
+  EXPECT_EQ(pullsDelayedBy(7200), 1);
+}
+
+TEST_F(PullDueTest, IsTheBusinessOfNoFreshCopy) {
+  setPullDue("bramble", 50);
+  putOnDisk("bramble", bagWithSections("new"), 600);
+  fetch();
+  EXPECT_TRUE(http.sessions().empty());
 }
 
 }  // namespace
