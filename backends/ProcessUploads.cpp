@@ -4,13 +4,18 @@
 
 namespace velk {
 
-void ProcessUploads::enter() {
+bool ProcessUploads::enter(User user) {
   Guard guard(_lock);
+  const auto own = _places.find(user);
+  if ((own == _places.end() ? 0 : own->second) >= kMaximumUploads - _count) return false;
+  ++_places[user];
   ++_count;
+  return true;
 }
 
-void ProcessUploads::leave() {
+void ProcessUploads::leave(User user) {
   Guard guard(_lock);
+  if (const auto own = _places.find(user); --own->second == 0) _places.erase(own);
   --_count;
   _changed.notifyAll();
 }

@@ -5,7 +5,9 @@
 
 #include <atomic>
 #include <cstddef>
+#include <cstdint>
 #include <deque>
+#include <map>
 
 #include "foundation/TimeValue.h"
 #include "platform/Lock.h"
@@ -17,14 +19,18 @@ class ProcessUploads {
  public:
   /// Uploads that are under way or wait: what sessions have taken outlives them, and a client may open another.
   static constexpr std::size_t kMaximumUploads = 64;
+
+  /// The user (a uid) whose process handed an upload over.
+  using User = std::uint32_t;
   /// Large files that are being compressed at the same moment: each keeps a processor busy, which everything else in
   /// the process needs as well.
   static constexpr std::size_t kMaximumCompressions = 2;
 
-  void enter();
-  void leave();
+  /// Takes a place. False when the user has its share: it may hold as many places as are then left for others. One
+  /// user alone gets half of them; several come to equal shares, with one share to spare for the next user.
+  [[nodiscard]] bool enter(User user);
+  void leave(User user);
   [[nodiscard]] std::size_t count() const;
-  [[nodiscard]] bool isFull() const { return count() >= kMaximumUploads; }
 
   /// The process is about to end: no upload begins any more, and what is being compressed is given up. Uploads that
   /// wait for a server go on until somebody ends their requests.
@@ -58,6 +64,8 @@ class ProcessUploads {
   mutable Lock _lock;
   Condition _changed;
   std::size_t _count VELK_GUARDED_BY(_lock) = 0;
+  /// Of users that hold any.
+  std::map<User, std::size_t> _places VELK_GUARDED_BY(_lock);
   std::size_t _turns VELK_GUARDED_BY(_lock) = 0;
   /// Who waits for a turn, each until it is handed one.
   std::deque<Semaphore*> _line VELK_GUARDED_BY(_lock);

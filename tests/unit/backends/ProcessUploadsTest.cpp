@@ -2,6 +2,7 @@
 
 #include <gtest/gtest.h>
 
+#include <map>
 #include <memory>
 #include <optional>
 #include <thread>
@@ -15,23 +16,57 @@ namespace {
 using Turn = ProcessUploads::CompressionTurn;
 constexpr auto kPatience = std::chrono::seconds(60);
 
+/// Takes what the user can get.
+std::size_t takeAll(ProcessUploads& uploads, ProcessUploads::User user) {
+  std::size_t taken = 0;
+  while (uploads.enter(user)) ++taken;
+  return taken;
+}
+
 TEST(ProcessUploads, CountsWhatIsUnderWay) {
   ProcessUploads uploads;
   EXPECT_TRUE(uploads.waitUntilNone(std::chrono::seconds(0)));
-  for (std::size_t number = 0; number < ProcessUploads::kMaximumUploads; ++number) {
-    EXPECT_FALSE(uploads.isFull());
-    uploads.enter();
-  }
-  EXPECT_TRUE(uploads.isFull());
+  EXPECT_TRUE(uploads.enter(1));
+  EXPECT_TRUE(uploads.enter(2));
+  EXPECT_EQ(uploads.count(), 2U);
   EXPECT_FALSE(uploads.waitUntilNone(std::chrono::milliseconds(1)));
-  uploads.leave();
-  EXPECT_FALSE(uploads.isFull());
+  uploads.leave(1);
+  uploads.leave(2);
+  EXPECT_TRUE(uploads.waitUntilNone(std::chrono::seconds(0)));
+}
+
+TEST(ProcessUploads, EveryUserLeavesAsManyPlacesAsItHolds) {
+  ProcessUploads uploads;
+  EXPECT_EQ(takeAll(uploads, 1), ProcessUploads::kMaximumUploads / 2);
+  EXPECT_EQ(takeAll(uploads, 2), ProcessUploads::kMaximumUploads / 4);
+  EXPECT_EQ(takeAll(uploads, 3), ProcessUploads::kMaximumUploads / 8);
+  EXPECT_FALSE(uploads.enter(1));
+  uploads.leave(1);
+  EXPECT_FALSE(uploads.enter(1)) << "it still has more than its share";
+  EXPECT_TRUE(uploads.enter(3));
+}
+
+TEST(ProcessUploads, UsersComeToEqualSharesWithOneToSpare) {
+  ProcessUploads uploads;
+  std::map<ProcessUploads::User, std::size_t> held;
+  held[1] = takeAll(uploads, 1);
+  held[2] = takeAll(uploads, 2);
+  // Whose upload ends, the first user's, tries to take another at once; so does the other.
+  for (int round = 0; round < 100; ++round) {
+    uploads.leave(1);
+    held[1] -= 1;
+    held[2] += takeAll(uploads, 2);
+    held[1] += takeAll(uploads, 1);
+  }
+  EXPECT_EQ(held[1], ProcessUploads::kMaximumUploads / 3);
+  EXPECT_EQ(held[2], ProcessUploads::kMaximumUploads / 3 + 1);
+  EXPECT_TRUE(uploads.enter(3));
 }
 
 TEST(ProcessUploads, TheLastOneThatLeavesIsWaitedFor) {
   ProcessUploads uploads;
-  uploads.enter();
-  std::thread last([&] { uploads.leave(); });
+  ASSERT_TRUE(uploads.enter(1));
+  std::thread last([&] { uploads.leave(1); });
   EXPECT_TRUE(uploads.waitUntilNone(kPatience));
   last.join();
 }
