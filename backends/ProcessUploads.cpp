@@ -1,5 +1,8 @@
 #include "backends/ProcessUploads.h"
 
+#include <algorithm>
+#include <utility>
+
 #include "platform/BlockingScope.h"
 
 namespace velk {
@@ -37,7 +40,34 @@ bool ProcessUploads::waitUntilNone(Duration limit) {
   return true;
 }
 
-ProcessUploads::CompressionTurn::CompressionTurn(ProcessUploads& uploads) : _uploads(uploads) {
+void ProcessUploads::waitInLineLocked(User user, Semaphore& handed) {
+  const auto own =
+      std::find_if(_line.begin(), _line.end(), [user](const WaitingUser& each) { return each.user == user; });
+  if (own == _line.end()) {
+    _line.push_back({user, {&handed}});
+  } else {
+    own->files.push_back(&handed);
+  }
+}
+
+Semaphore* ProcessUploads::takeNextLocked() {
+  if (_line.empty()) return nullptr;
+  WaitingUser served = std::move(_line.front());
+  _line.pop_front();
+  auto* const next = served.files.front();
+  served.files.pop_front();
+  if (!served.files.empty()) _line.push_back(std::move(served));
+  return next;
+}
+
+std::size_t ProcessUploads::waitingForTurns() const {
+  Guard guard(_lock);
+  std::size_t waiting = 0;
+  for (const auto& each : _line) waiting += each.files.size();
+  return waiting;
+}
+
+ProcessUploads::CompressionTurn::CompressionTurn(ProcessUploads& uploads, User user) : _uploads(uploads) {
   Semaphore handed;
   {
     Guard guard(_uploads._lock);
@@ -45,7 +75,7 @@ ProcessUploads::CompressionTurn::CompressionTurn(ProcessUploads& uploads) : _upl
       ++_uploads._turns;
       return;
     }
-    _uploads._line.push_back(&handed);
+    _uploads.waitInLineLocked(user, handed);
   }
   handed.wait();
 }
@@ -53,13 +83,11 @@ ProcessUploads::CompressionTurn::CompressionTurn(ProcessUploads& uploads) : _upl
 // The turn goes to the next in line, if there is one.
 ProcessUploads::CompressionTurn::~CompressionTurn() {
   Guard guard(_uploads._lock);
-  if (_uploads._line.empty()) {
+  if (auto* const next = _uploads.takeNextLocked()) {
+    next->signal();
+  } else {
     --_uploads._turns;
-    return;
   }
-  auto* const next = _uploads._line.front();
-  _uploads._line.pop_front();
-  next->signal();
 }
 
 }  // namespace velk

@@ -1,4 +1,4 @@
-// What the uploads of all sessions share: how many there are, whose turn it is to compress a large file, and whether
+// What the uploads of all sessions share: how many there are, whose turn it is to compress, and whether
 // the process is about to end. One a process, made with what backends are handed (`BackendContext`) and shared with the
 // uploads, which may outlive their sessions. Any thread.
 #pragma once
@@ -22,8 +22,8 @@ class ProcessUploads {
 
   /// The user (a uid) whose process handed an upload over.
   using User = std::uint32_t;
-  /// Large files that are being compressed at the same moment: each keeps a processor busy, which everything else in
-  /// the process needs as well.
+  /// Files that are being compressed at the same moment: each keeps a processor busy, which everything else in the
+  /// process needs as well.
   static constexpr std::size_t kMaximumCompressions = 2;
 
   /// Takes a place. False when the user has its share: it may hold as many places as are then left for others. One
@@ -42,12 +42,13 @@ class ProcessUploads {
   void noteLeftBehind() noexcept { ++_leftBehind; }
   [[nodiscard]] std::size_t leftBehind() const noexcept { return _leftBehind; }
 
-  /// Waits until fewer than `kMaximumCompressions` others have a turn, in the order of arrival, and has one while it
-  /// lives. For a piece of a file at a time, and for nothing that waits: a file that cannot be read (it may lie on a
-  /// disk of its owner's making) would hold all others up. Counts as blocked while it waits.
+  /// Waits until fewer than `kMaximumCompressions` others have a turn, and has one while it lives. Users are served in
+  /// turn, the files of one user in the order of arrival. For a piece of a file at a time, and for nothing that waits:
+  /// a file that cannot be read (it may lie on a disk of its owner's making) would hold all others up. Counts as
+  /// blocked while it waits.
   class CompressionTurn {
    public:
-    explicit CompressionTurn(ProcessUploads& uploads);
+    CompressionTurn(ProcessUploads& uploads, User user);
     ~CompressionTurn();
     CompressionTurn(const CompressionTurn&) = delete;
     CompressionTurn& operator=(const CompressionTurn&) = delete;
@@ -56,7 +57,19 @@ class ProcessUploads {
     ProcessUploads& _uploads;
   };
 
+  /// How many wait for a turn. For tests.
+  [[nodiscard]] std::size_t waitingForTurns() const;
+
  private:
+  struct WaitingUser {
+    User user;
+    std::deque<Semaphore*> files;  ///< never empty
+  };
+
+  void waitInLineLocked(User user, Semaphore& handed) VELK_REQUIRES(_lock);
+  /// Null when there is none.
+  [[nodiscard]] Semaphore* takeNextLocked() VELK_REQUIRES(_lock);
+
   // Self-synchronised.
   std::atomic<bool> _isStopping{false};
   std::atomic<std::size_t> _leftBehind{0};
@@ -67,8 +80,8 @@ class ProcessUploads {
   /// Of users that hold any.
   std::map<User, std::size_t> _places VELK_GUARDED_BY(_lock);
   std::size_t _turns VELK_GUARDED_BY(_lock) = 0;
-  /// Who waits for a turn, each until it is handed one.
-  std::deque<Semaphore*> _line VELK_GUARDED_BY(_lock);
+  /// Who waits for a turn, each until it is handed one. A user who was served goes to the end.
+  std::deque<WaitingUser> _line VELK_GUARDED_BY(_lock);
 };
 
 }  // namespace velk

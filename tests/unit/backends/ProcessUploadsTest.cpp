@@ -5,6 +5,7 @@
 #include <map>
 #include <memory>
 #include <optional>
+#include <string>
 #include <thread>
 #include <vector>
 
@@ -71,39 +72,73 @@ TEST(ProcessUploads, TheLastOneThatLeavesIsWaitedFor) {
   last.join();
 }
 
+/// Threads that each want one turn, and say so when they have it.
+class Line {
+ public:
+  explicit Line(ProcessUploads& uploads) : _uploads(uploads) {}
+  ~Line() {
+    for (auto& thread : _threads) thread.join();
+  }
+
+  /// Returns when that one stands in line behind all that came before.
+  void come(ProcessUploads::User user, std::string name) {
+    const std::size_t before = _uploads.waitingForTurns();
+    _threads.emplace_back([this, user, name = std::move(name)] {
+      const Turn turn(_uploads, user);
+      {
+        Guard guard(_lock);
+        _served.push_back(name);
+      }
+      _hasBegun.signal();
+      EXPECT_TRUE(_mayEnd.waitFor(kPatience));
+    });
+    while (_uploads.waitingForTurns() == before) std::this_thread::yield();
+  }
+  /// Waits until one more has a turn.
+  [[nodiscard]] bool waitForOne() { return _hasBegun.waitFor(kPatience); }
+  void letOneEnd() { _mayEnd.signal(); }
+  [[nodiscard]] std::vector<std::string> served() {
+    Guard guard(_lock);
+    return _served;
+  }
+
+ private:
+  ProcessUploads& _uploads;
+  Semaphore _hasBegun;
+  Semaphore _mayEnd;
+  Lock _lock;
+  std::vector<std::string> _served VELK_GUARDED_BY(_lock);
+  std::vector<std::thread> _threads;
+};
+
+/// Serves all of them one after the other: who was served, in order.
+std::vector<std::string> serveAll(Line& line, std::optional<Turn>& turn, std::size_t count) {
+  turn.reset();
+  for (std::size_t number = 0; number < count; ++number) {
+    EXPECT_TRUE(line.waitForOne());
+    line.letOneEnd();
+  }
+  return line.served();
+}
+
 TEST(ProcessUploads, TwoCompressAtOnceAndTheOthersInOrder) {
   ProcessUploads uploads;
-  std::optional<Turn> first(std::in_place, uploads);
-  std::optional<Turn> second(std::in_place, uploads);
-  // Each of those who wait stands in line before the next one comes: who comes later cannot be served before.
-  Lock lock;
-  std::vector<int> served;
-  Semaphore mayEnd;
-  Semaphore hasBegun;
-  std::vector<std::thread> others;
-  const auto come = [&](int number) {
-    others.emplace_back([&, number] {
-      const Turn turn(uploads);
-      {
-        Guard guard(lock);
-        served.push_back(number);
-      }
-      hasBegun.signal();
-      EXPECT_TRUE(mayEnd.waitFor(kPatience));
-    });
-  };
-  come(0);
-  come(1);
-  EXPECT_FALSE(hasBegun.waitFor(std::chrono::milliseconds(50))) << "two are at it";
-  first.reset();
-  ASSERT_TRUE(hasBegun.waitFor(kPatience));
-  EXPECT_FALSE(hasBegun.waitFor(std::chrono::milliseconds(50))) << "one has taken the place of one";
-  second.reset();
-  ASSERT_TRUE(hasBegun.waitFor(kPatience));
-  mayEnd.signal();
-  mayEnd.signal();
-  for (auto& other : others) other.join();
-  EXPECT_EQ(served.size(), 2U);
+  std::optional<Turn> first(std::in_place, uploads, 1);
+  const Turn second(uploads, 1);
+  Line line(uploads);
+  for (const char* name : {"a", "b", "c"}) line.come(1, name);
+  EXPECT_TRUE(line.served().empty()) << "two are at it";
+  EXPECT_EQ(serveAll(line, first, 3), (std::vector<std::string>{"a", "b", "c"}));
+}
+
+TEST(ProcessUploads, UsersCompressInTurn) {
+  ProcessUploads uploads;
+  std::optional<Turn> first(std::in_place, uploads, 1);
+  const Turn second(uploads, 1);
+  Line line(uploads);
+  for (const char* name : {"a", "b", "c"}) line.come(1, name);
+  for (const char* name : {"x", "y"}) line.come(2, name);
+  EXPECT_EQ(serveAll(line, first, 5), (std::vector<std::string>{"a", "x", "b", "y", "c"}));
 }
 
 TEST(ProcessUploads, RemembersWhatTheEndLeftBehind) {
