@@ -60,7 +60,8 @@ class GzipStream {
         log::standard(backend_texts::kCompressError, deflateErrorText(result), _stream.msg);
         return false;
       }
-      if (!_keep(std::span(_piece).first(_piece.size() - _stream.avail_out))) return false;
+      const std::size_t made = _piece.size() - _stream.avail_out;
+      if (made > 0 && !_keep(std::span(_piece).first(made))) return false;
     } while (flush == Z_FINISH ? result != Z_STREAM_END : _stream.avail_out == 0);
     return true;
   }
@@ -110,29 +111,44 @@ CompressedFile inMemory(const FileUpload& upload, std::uint64_t size, ProcessUpl
   return {outcome, outcome == Outcome::compressed ? body : nullptr, nullptr};
 }
 
+/// A compressed file, and the room that it takes.
+struct KeptFile {
+  KeptFile(std::unique_ptr<UnnamedFile> made, std::shared_ptr<ProcessUploads> uploads, ProcessUploads::User user)
+      : room(std::move(uploads), user), file(std::move(made)) {}
+
+  [[nodiscard]] Result<void> append(std::span<const std::uint8_t> bytes) {
+    if (auto fits = room.grow(bytes.size(), file->availableSpace()); !fits) return fits;
+    return file->append(bytes);
+  }
+
+  ProcessUploads::DiskRoom room;  // given back behind the file
+  const std::unique_ptr<UnnamedFile> file;
+};
+
 CompressedFile onDisk(const FileUpload& upload, std::uint64_t size, const std::string& directory,
-                      ProcessUploads& uploads) {
-  auto output = UnnamedFile::make(directory);
-  if (!output) {
-    log::error(backend_texts::kUploadNotKept, output.error());
+                      const std::shared_ptr<ProcessUploads>& uploads) {
+  auto made = UnnamedFile::make(directory);
+  if (!made) {
+    log::error(backend_texts::kUploadNotKept, upload.path, made.error());
     return {};
   }
-  const auto keep = [&output](std::span<const std::uint8_t> bytes) {
-    const auto kept = (*output)->append(bytes);
-    if (!kept) log::error(backend_texts::kUploadNotKept, kept.error());
+  const auto output = std::make_shared<KeptFile>(std::move(*made), uploads, upload.user);
+  const auto keep = [&](std::span<const std::uint8_t> bytes) {
+    const auto kept = output->append(bytes);
+    if (!kept) log::error(backend_texts::kUploadNotKept, upload.path, kept.error());
     return kept.has_value();
   };
-  const auto outcome = compress(upload, size, uploads, keep, [&output] { return (*output)->size(); });
+  const auto outcome = compress(upload, size, *uploads, keep, [&output] { return output->file->size(); });
   if (outcome != Outcome::compressed) return {outcome, nullptr, nullptr};
-  return {outcome, nullptr, std::move(*output)};
+  return {outcome, nullptr, std::shared_ptr<const UnnamedFile>(output, output->file.get())};
 }
 
 }  // namespace
 
 CompressedFile gzipFile(const FileUpload& upload, std::uint64_t size, const std::string& directory,
-                        ProcessUploads& uploads) {
+                        const std::shared_ptr<ProcessUploads>& uploads) {
   if (size == 0) return {Outcome::nothingToRead, nullptr, nullptr};
-  return size <= kMaximumSizeInMemory ? inMemory(upload, size, uploads) : onDisk(upload, size, directory, uploads);
+  return size <= kMaximumSizeInMemory ? inMemory(upload, size, *uploads) : onDisk(upload, size, directory, uploads);
 }
 
 }  // namespace velk

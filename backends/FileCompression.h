@@ -35,8 +35,9 @@ struct CompressedFile {
 
 /// Reads at most `size` bytes from the file's beginning, whatever becomes of the file meanwhile. It is compressed piece
 /// by piece, in turns with others, and given up when `uploads` stops. What is too large for memory is kept in a file
-/// without a name in the file system of `directory`.
+/// without a name in the file system of `directory`, as long as its user's share of the disk lasts; that is given back
+/// with the file.
 [[nodiscard]] CompressedFile gzipFile(const FileUpload& upload, std::uint64_t size, const std::string& directory,
-                                      ProcessUploads& uploads);
+                                      const std::shared_ptr<ProcessUploads>& uploads);
 
 }  // namespace velk

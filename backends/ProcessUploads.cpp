@@ -1,8 +1,10 @@
 #include "backends/ProcessUploads.h"
 
 #include <algorithm>
+#include <cerrno>
 #include <utility>
 
+#include "foundation/Format.h"
 #include "platform/BlockingScope.h"
 
 namespace velk {
@@ -26,6 +28,38 @@ void ProcessUploads::leave(User user) {
 std::size_t ProcessUploads::count() const {
   Guard guard(_lock);
   return _count;
+}
+
+ProcessUploads::DiskRoom::~DiskRoom() {
+  if (_bytes == 0) return;
+  Guard guard(_uploads->_lock);
+  _uploads->_diskBytes -= _bytes;
+  const auto own = _uploads->_diskBytesOfUsers.find(_user);
+  if ((own->second -= _bytes) == 0) _uploads->_diskBytesOfUsers.erase(own);
+}
+
+Result<void> ProcessUploads::DiskRoom::grow(std::uint64_t bytes, std::uint64_t available) {
+  if (available < kSpareDiskBytes || available - kSpareDiskBytes < bytes) {
+    return failure("ProcessUploads", ENOSPC,
+                   formatText("only %llu bytes are free on the disk, and %llu of them are kept free",
+                              {available, kSpareDiskBytes}));
+  }
+  std::uint64_t most = 0;
+  {
+    Guard guard(_uploads->_lock);
+    auto& total = _uploads->_diskBytes;
+    most = available / 2 < kMaximumDiskBytes - total / 2 ? available / 2 + total / 2 : kMaximumDiskBytes;
+    const auto found = _uploads->_diskBytesOfUsers.find(_user);
+    const std::uint64_t own = found == _uploads->_diskBytesOfUsers.end() ? 0 : found->second;
+    if (bytes <= most && own + bytes + total + bytes <= most) {
+      total += bytes;
+      _uploads->_diskBytesOfUsers[_user] += bytes;
+      _bytes += bytes;
+      return {};
+    }
+  }
+  return failure("ProcessUploads", ENOSPC,
+                 formatText("its user has its share of the %llu bytes that uploads may take of the disk", {most}));
 }
 
 void ProcessUploads::stop() { _isStopping = true; }

@@ -1,6 +1,6 @@
-// What the uploads of all sessions share: how many there are, whose turn it is to compress, and whether
-// the process is about to end. One a process, made with what backends are handed (`BackendContext`) and shared with the
-// uploads, which may outlive their sessions. Any thread.
+// What the uploads of all sessions share: how many there are, how much of the disk they take, whose turn it is to
+// compress, and whether the process is about to end. One a process, made with what backends are handed
+// (`BackendContext`) and shared with the uploads, which may outlive their sessions. Any thread.
 #pragma once
 
 #include <atomic>
@@ -8,7 +8,10 @@
 #include <cstdint>
 #include <deque>
 #include <map>
+#include <memory>
+#include <utility>
 
+#include "foundation/Error.h"
 #include "foundation/TimeValue.h"
 #include "platform/Lock.h"
 #include "platform/Semaphore.h"
@@ -19,6 +22,12 @@ class ProcessUploads {
  public:
   /// Uploads that are under way or wait: what sessions have taken outlives them, and a client may open another.
   static constexpr std::size_t kMaximumUploads = 64;
+
+  /// What compressed files may take of the disk, all together, on a file system of any size; of a smaller one, half of
+  /// what they find free.
+  static constexpr std::uint64_t kMaximumDiskBytes = std::uint64_t{1} << 30U;
+  /// What they leave free on the file system, which storebags need as well.
+  static constexpr std::uint64_t kSpareDiskBytes = std::uint64_t{64} << 20U;
 
   /// The user (a uid) whose process handed an upload over.
   using User = std::uint32_t;
@@ -31,6 +40,24 @@ class ProcessUploads {
   [[nodiscard]] bool enter(User user);
   void leave(User user);
   [[nodiscard]] std::size_t count() const;
+
+  /// The room on the disk that one compressed file takes; given back with it.
+  class DiskRoom {
+   public:
+    DiskRoom(std::shared_ptr<ProcessUploads> uploads, User user) : _uploads(std::move(uploads)), _user(user) {}
+    ~DiskRoom();
+    DiskRoom(const DiskRoom&) = delete;
+    DiskRoom& operator=(const DiskRoom&) = delete;
+
+    /// Before these bytes are written where `available` bytes are free. The error says what they do not fit into. As
+    /// with the places, a user may take as much as it leaves for others.
+    [[nodiscard]] Result<void> grow(std::uint64_t bytes, std::uint64_t available);
+
+   private:
+    const std::shared_ptr<ProcessUploads> _uploads;
+    const User _user;
+    std::uint64_t _bytes = 0;
+  };
 
   /// The process is about to end: no upload begins any more, and what is being compressed is given up. Uploads that
   /// wait for a server go on until somebody ends their requests.
@@ -79,6 +106,9 @@ class ProcessUploads {
   std::size_t _count VELK_GUARDED_BY(_lock) = 0;
   /// Of users that hold any.
   std::map<User, std::size_t> _places VELK_GUARDED_BY(_lock);
+  std::uint64_t _diskBytes VELK_GUARDED_BY(_lock) = 0;
+  /// Of users that have files on the disk.
+  std::map<User, std::uint64_t> _diskBytesOfUsers VELK_GUARDED_BY(_lock);
   std::size_t _turns VELK_GUARDED_BY(_lock) = 0;
   /// Who waits for a turn, each until it is handed one. A user who was served goes to the end.
   std::deque<WaitingUser> _line VELK_GUARDED_BY(_lock);

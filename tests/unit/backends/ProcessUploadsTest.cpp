@@ -141,6 +141,47 @@ TEST(ProcessUploads, UsersCompressInTurn) {
   EXPECT_EQ(serveAll(line, first, 5), (std::vector<std::string>{"a", "x", "b", "y", "c"}));
 }
 
+using DiskRoom = ProcessUploads::DiskRoom;
+constexpr std::uint64_t kMost = ProcessUploads::kMaximumDiskBytes;
+constexpr std::uint64_t kSpare = ProcessUploads::kSpareDiskBytes;
+
+TEST(ProcessUploads, EveryUserLeavesAsMuchOfTheDiskAsItTakes) {
+  const auto uploads = std::make_shared<ProcessUploads>();
+  DiskRoom first(uploads, 1);
+  EXPECT_TRUE(first.grow(kMost / 4, UINT64_MAX));
+  EXPECT_TRUE(first.grow(kMost / 4, UINT64_MAX));
+  EXPECT_FALSE(first.grow(1, UINT64_MAX));
+  {
+    DiskRoom more(uploads, 1);
+    EXPECT_FALSE(more.grow(1, UINT64_MAX)) << "it is the user's share, not the file's";
+    DiskRoom second(uploads, 2);
+    EXPECT_TRUE(second.grow(kMost / 4, UINT64_MAX));
+    EXPECT_FALSE(second.grow(1, UINT64_MAX));
+    EXPECT_FALSE(second.grow(UINT64_MAX, UINT64_MAX));
+  }
+  DiskRoom third(uploads, 3);
+  EXPECT_TRUE(third.grow(kMost / 4, UINT64_MAX)) << "given back";
+}
+
+TEST(ProcessUploads, SmallDisksAreSharedWithOthers) {
+  const auto uploads = std::make_shared<ProcessUploads>();
+  constexpr std::uint64_t kFree = 4 * kSpare;
+  DiskRoom room(uploads, 1);
+  EXPECT_TRUE(room.grow(kFree / 4, kFree));
+  EXPECT_FALSE(room.grow(1, kFree - kFree / 4)) << "what it took itself counts as found free";
+  DiskRoom other(uploads, 2);
+  EXPECT_TRUE(other.grow(1, kFree - kFree / 4));
+}
+
+TEST(ProcessUploads, SomeOfTheDiskIsKeptFree) {
+  const auto uploads = std::make_shared<ProcessUploads>();
+  DiskRoom room(uploads, 1);
+  EXPECT_TRUE(room.grow(100, kSpare + 100));
+  EXPECT_FALSE(room.grow(101, kSpare + 100));
+  EXPECT_FALSE(room.grow(1, kSpare));
+  EXPECT_FALSE(room.grow(1, 0));
+}
+
 TEST(ProcessUploads, RemembersWhatTheEndLeftBehind) {
   ProcessUploads uploads;
   EXPECT_FALSE(uploads.isStopping());

@@ -8,6 +8,7 @@
 #include <cstdlib>
 #include <filesystem>
 #include <optional>
+#include <random>
 #include <thread>
 
 #include "connectivity/ReportingSessionConnectivityHelper.h"
@@ -270,8 +271,52 @@ TEST_F(UploadBackendTest, LargeFileWithoutRoomForItStays) {
   context.largeFilesDirectory = directory.write("file", "") + "/below";
   const auto cramped = makeUpload(section);
   EXPECT_FALSE(upload(directory.write("log", std::string(kMaximumSizeInMemory + 1, 'a')), *cramped));
-  EXPECT_TRUE(log.contains("UploadBackend(uploadFileAtPath): the compressed file is lost: "));
+  EXPECT_TRUE(log.contains("UploadBackend(uploadFileAtPath): there is no room for " + (directory / "log") + ", "));
   EXPECT_TRUE(server->requests.empty());
+}
+
+/// Bytes that do not become fewer.
+std::string noise(std::size_t size) {
+  std::minstd_rand random(1);
+  std::string bytes(size, '\0');
+  for (auto& byte : bytes) byte = static_cast<char>(random() >> 8U);
+  return bytes;
+}
+
+TEST_F(UploadBackendTest, LargeFileBeyondItsUsersShareOfTheDiskStays) {
+  constexpr std::uint64_t kSize = kMaximumSizeInMemory + 1'000'000;
+  const auto path = directory.write("log", noise(kSize));
+  ProcessUploads::DiskRoom others(context.uploads, 2);
+  ASSERT_TRUE(others.grow(ProcessUploads::kMaximumDiskBytes / 2 - 1'000'000, UINT64_MAX));
+  {
+    ProcessUploads::DiskRoom own(context.uploads, 1);
+    ASSERT_TRUE(own.grow(ProcessUploads::kMaximumDiskBytes / 4 - 1'000'000, UINT64_MAX));
+    log.clear();
+    EXPECT_EQ(gzipFile(openFile(path, 1), kSize, directory.path(), context.uploads).outcome,
+              CompressedFile::Outcome::failed);
+    ASSERT_EQ(log.lines().size(), 1U);
+    EXPECT_EQ(log.lines()[0].level, log::Level::error);
+    EXPECT_TRUE(log.contains("UploadBackend(uploadFileAtPath): there is no room for " + path +
+                             ", compressed: its user has its share of the "));
+  }
+  EXPECT_EQ(gzipFile(openFile(path, 1), kSize, directory.path(), context.uploads).outcome,
+            CompressedFile::Outcome::compressed);
+}
+
+TEST_F(UploadBackendTest, RoomOnTheDiskIsTakenAsLongAsTheFileIsThere) {
+  constexpr std::uint64_t kSize = kMaximumSizeInMemory + 1'000'000;
+  const auto path = directory.write("log", noise(kSize));
+  const auto takeAll = [this] {
+    ProcessUploads::DiskRoom room(context.uploads, 1);
+    return room.grow(ProcessUploads::kMaximumDiskBytes / 2, UINT64_MAX).has_value();
+  };
+  EXPECT_TRUE(takeAll());
+  {
+    const auto compressed = gzipFile(openFile(path, 1), kSize, directory.path(), context.uploads);
+    ASSERT_NE(compressed.onDisk, nullptr);
+    EXPECT_FALSE(takeAll());
+  }
+  EXPECT_TRUE(takeAll());
 }
 
 TEST_F(UploadBackendTest, FilesOfAnySizeButTheLargestAreTaken) {
@@ -287,16 +332,16 @@ TEST_F(UploadBackendTest, LargeFilesAreGivenUpWhenTheProcessEnds) {
   context.uploads->stop();
   EXPECT_FALSE(upload(path));
   EXPECT_TRUE(server->requests.empty());
-  EXPECT_EQ(gzipFile(openFile(path), kMaximumSizeInMemory + 1, directory.path(), *context.uploads).outcome,
+  EXPECT_EQ(gzipFile(openFile(path), kMaximumSizeInMemory + 1, directory.path(), context.uploads).outcome,
             CompressedFile::Outcome::abandoned);
 }
 
 /// A file that is being compressed on a thread of its own.
 class Compressing {
  public:
-  Compressing(std::string path, std::uint64_t size, const std::string& directory, ProcessUploads& uploads,
-              ProcessUploads::User user)
-      : _thread([this, path = std::move(path), size, directory, &uploads, user] {
+  Compressing(std::string path, std::uint64_t size, const std::string& directory,
+              const std::shared_ptr<ProcessUploads>& uploads, ProcessUploads::User user)
+      : _thread([this, path = std::move(path), size, directory, uploads, user] {
           _compressed = gzipFile(openFile(path, user), size, directory, uploads);
           _isDone = true;
         }) {}
@@ -320,8 +365,8 @@ TEST_F(UploadBackendTest, FilesOfAnySizeTakeTurns) {
   auto& uploads = *context.uploads;
   std::optional<ProcessUploads::CompressionTurn> first(std::in_place, uploads, 1);
   const ProcessUploads::CompressionTurn second(uploads, 1);
-  Compressing ofLarge(large, kMaximumSizeInMemory + 1, directory.path(), uploads, 1);
-  Compressing ofSmall(directory.write("small", "text"), 4, directory.path(), uploads, 1);
+  Compressing ofLarge(large, kMaximumSizeInMemory + 1, directory.path(), context.uploads, 1);
+  Compressing ofSmall(directory.write("small", "text"), 4, directory.path(), context.uploads, 1);
   while (uploads.waitingForTurns() < 2 && !ofLarge.isDone() && !ofSmall.isDone()) std::this_thread::yield();
   EXPECT_EQ(uploads.waitingForTurns(), 2U) << "both wait";
   first.reset();
@@ -339,9 +384,9 @@ TEST_F(UploadBackendTest, SmallFilesGetTheirTurnsWhileAHugeOneIsCompressed) {
   const auto small = directory.write("small", std::string(kFitsIntoMemory, 'x'));
   auto& uploads = *context.uploads;
   const ProcessUploads::CompressionTurn second(uploads, 1);
-  Compressing ofHuge(huge, kHuge, directory.path(), uploads, 1);
+  Compressing ofHuge(huge, kHuge, directory.path(), context.uploads, 1);
   for (const ProcessUploads::User user : {1, 2}) {
-    Compressing ofSmall(small, kFitsIntoMemory, directory.path(), uploads, user);
+    Compressing ofSmall(small, kFitsIntoMemory, directory.path(), context.uploads, user);
     EXPECT_EQ(inflated(*ofSmall.join().inMemory), std::string(kFitsIntoMemory, 'x'));
   }
   EXPECT_FALSE(ofHuge.isDone());
@@ -391,7 +436,7 @@ TEST_F(UploadBackendTest, AServerThatNeverAnswersHoldsAnUploadForAMinute) {
 TEST_F(UploadBackendTest, ReadsNoMoreThanTheSizeItSaw) {
   const auto path = directory.write("log", "0123456789");
   const auto file = openFile(path);
-  ProcessUploads uploads;
+  const auto uploads = std::make_shared<ProcessUploads>();
   EXPECT_EQ(inflated(*gzipFile(file, 4, directory.path(), uploads).inMemory), "0123");
   EXPECT_EQ(inflated(*gzipFile(file, 100, directory.path(), uploads).inMemory), "0123456789")
       << "it has become shorter";
