@@ -3,6 +3,7 @@
 #include <zlib.h>
 
 #include <algorithm>
+#include <functional>
 #include <utility>
 #include <vector>
 
@@ -21,10 +22,14 @@ constexpr std::size_t kPieceBytes = 256 * 1024;
 constexpr int kGzipWindowBits = 31;
 constexpr int kMemoryLevel = 8;
 
+/// Takes compressed bytes; false, and a line in the log, when they cannot be kept.
+using Keep = std::function<bool(std::span<const std::uint8_t>)>;
+
 /// A stream that is fed piece by piece. Its own counters may be 32 bits wide, so nobody looks at them.
 class GzipStream {
  public:
-  GzipStream(UnnamedFile& output, ProcessUploads& uploads) : _output(output), _uploads(uploads), _piece(kPieceBytes) {}
+  GzipStream(ProcessUploads& uploads, ProcessUploads::User user, Keep keep)
+      : _uploads(uploads), _user(user), _keep(std::move(keep)), _piece(kPieceBytes) {}
   ~GzipStream() {
     if (_isSetUp) deflateEnd(&_stream);
   }
@@ -55,70 +60,95 @@ class GzipStream {
         log::standard(backend_texts::kCompressError, deflateErrorText(result), _stream.msg);
         return false;
       }
-      if (!keep(_piece.size() - _stream.avail_out)) return false;
+      const std::size_t made = _piece.size() - _stream.avail_out;
+      if (made > 0 && !_keep(std::span(_piece).first(made))) return false;
     } while (flush == Z_FINISH ? result != Z_STREAM_END : _stream.avail_out == 0);
     return true;
   }
 
   int compressPiece(int flush) {
-    const ProcessUploads::CompressionTurn turn(_uploads);
+    const ProcessUploads::CompressionTurn turn(_uploads, _user);
     return deflate(&_stream, flush);
   }
 
-  bool keep(std::size_t bytes) {
-    const auto kept = _output.append(std::span(_piece).first(bytes));
-    if (!kept) log::error(backend_texts::kUploadNotKept, kept.error());
-    return kept.has_value();
-  }
-
-  UnnamedFile& _output;
   ProcessUploads& _uploads;
+  const ProcessUploads::User _user;
+  const Keep _keep;
   std::vector<std::uint8_t> _piece;
   z_stream _stream{};
   bool _isSetUp = false;
 };
 
-CompressedFile inMemory(const FileDescriptor& file, std::uint64_t size) {
-  std::vector<std::uint8_t> bytes(size);
-  const auto read = readAt(file, 0, bytes);
-  if (!read || *read == 0) return {Outcome::nothingToRead, nullptr, nullptr};
-  auto compressed = gzipDeflate(std::span(bytes).first(*read));
-  if (!compressed) return {};
-  return {Outcome::compressed, std::make_shared<const std::string>(std::move(*compressed)), nullptr};
-}
-
-CompressedFile onDisk(const FileDescriptor& file, std::uint64_t size, const std::string& directory,
-                      ProcessUploads& uploads) {
-  auto output = UnnamedFile::make(directory);
-  if (!output) {
-    log::error(backend_texts::kUploadNotKept, output.error());
-    return {};
-  }
-  GzipStream stream(**output, uploads);
-  if (!stream.setUp()) return {};
-  std::vector<std::uint8_t> piece(kPieceBytes);
+/// Reads and compresses in turns; `compressedBytes` answers for the log how much has been kept.
+Outcome compress(const FileUpload& upload, std::uint64_t size, ProcessUploads& uploads, Keep keep,
+                 const std::function<std::uint64_t()>& compressedBytes) {
+  GzipStream stream(uploads, upload.user, std::move(keep));
+  if (!stream.setUp()) return Outcome::failed;
+  std::vector<std::uint8_t> piece(static_cast<std::size_t>(std::min<std::uint64_t>(size, kPieceBytes)));
   std::uint64_t done = 0;
   while (done < size) {
-    if (uploads.isStopping()) return {Outcome::abandoned, nullptr, nullptr};
+    if (uploads.isStopping()) return Outcome::abandoned;
     const auto wanted = static_cast<std::size_t>(std::min<std::uint64_t>(size - done, piece.size()));
-    const auto read = readAt(file, done, std::span(piece).first(wanted));
-    if (!read) return {Outcome::nothingToRead, nullptr, nullptr};
+    const auto read = readAt(upload.file, done, std::span(piece).first(wanted));
+    if (!read) return Outcome::nothingToRead;
     if (*read == 0) break;
     done += *read;
-    if (!stream.add(std::span(piece).first(*read))) return {};
+    if (!stream.add(std::span(piece).first(*read))) return Outcome::failed;
   }
-  if (done == 0) return {Outcome::nothingToRead, nullptr, nullptr};
-  if (!stream.finish()) return {};
-  log::standard(backend_texts::kCompressed, done, (*output)->size());
-  return {Outcome::compressed, nullptr, std::move(*output)};
+  if (done == 0) return Outcome::nothingToRead;
+  if (!stream.finish()) return Outcome::failed;
+  log::standard(backend_texts::kCompressed, done, compressedBytes());
+  return Outcome::compressed;
+}
+
+CompressedFile inMemory(const FileUpload& upload, std::uint64_t size, ProcessUploads& uploads) {
+  const auto body = std::make_shared<std::string>();
+  const auto keep = [&body](std::span<const std::uint8_t> bytes) {
+    body->append(reinterpret_cast<const char*>(bytes.data()), bytes.size());
+    return true;
+  };
+  const auto outcome = compress(upload, size, uploads, keep, [&body] { return body->size(); });
+  return {outcome, outcome == Outcome::compressed ? body : nullptr, nullptr};
+}
+
+/// A compressed file, and the room that it takes.
+struct KeptFile {
+  KeptFile(std::unique_ptr<UnnamedFile> made, std::shared_ptr<ProcessUploads> uploads, ProcessUploads::User user)
+      : room(std::move(uploads), user), file(std::move(made)) {}
+
+  [[nodiscard]] Result<void> append(std::span<const std::uint8_t> bytes) {
+    if (auto fits = room.grow(bytes.size(), file->availableSpace()); !fits) return fits;
+    return file->append(bytes);
+  }
+
+  ProcessUploads::DiskRoom room;  // given back behind the file
+  const std::unique_ptr<UnnamedFile> file;
+};
+
+CompressedFile onDisk(const FileUpload& upload, std::uint64_t size, const std::string& directory,
+                      const std::shared_ptr<ProcessUploads>& uploads) {
+  auto made = UnnamedFile::make(directory);
+  if (!made) {
+    log::error(backend_texts::kUploadNotKept, upload.path, made.error());
+    return {};
+  }
+  const auto output = std::make_shared<KeptFile>(std::move(*made), uploads, upload.user);
+  const auto keep = [&](std::span<const std::uint8_t> bytes) {
+    const auto kept = output->append(bytes);
+    if (!kept) log::error(backend_texts::kUploadNotKept, upload.path, kept.error());
+    return kept.has_value();
+  };
+  const auto outcome = compress(upload, size, *uploads, keep, [&output] { return output->file->size(); });
+  if (outcome != Outcome::compressed) return {outcome, nullptr, nullptr};
+  return {outcome, nullptr, std::shared_ptr<const UnnamedFile>(output, output->file.get())};
 }
 
 }  // namespace
 
-CompressedFile gzipFile(const FileDescriptor& file, std::uint64_t size, const std::string& directory,
-                        ProcessUploads& uploads) {
+CompressedFile gzipFile(const FileUpload& upload, std::uint64_t size, const std::string& directory,
+                        const std::shared_ptr<ProcessUploads>& uploads) {
   if (size == 0) return {Outcome::nothingToRead, nullptr, nullptr};
-  return size <= kMaximumSizeInMemory ? inMemory(file, size) : onDisk(file, size, directory, uploads);
+  return size <= kMaximumSizeInMemory ? inMemory(upload, size, *uploads) : onDisk(upload, size, directory, uploads);
 }
 
 }  // namespace velk

@@ -7,7 +7,7 @@
 #include <string>
 
 #include "backends/ProcessUploads.h"
-#include "platform/FileDescriptor.h"
+#include "backends/VelkReportingBackend.h"
 #include "platform/UnnamedFile.h"
 
 namespace velk {
@@ -33,10 +33,11 @@ struct CompressedFile {
   }
 };
 
-/// Reads at most `size` bytes from the file's beginning, whatever becomes of the file meanwhile. What is too large for
-/// memory is kept in a file without a name in the file system of `directory`; it is compressed in turns with others of
-/// its kind, and given up when `uploads` stops.
-[[nodiscard]] CompressedFile gzipFile(const FileDescriptor& file, std::uint64_t size, const std::string& directory,
-                                      ProcessUploads& uploads);
+/// Reads at most `size` bytes from the file's beginning, whatever becomes of the file meanwhile. It is compressed piece
+/// by piece, in turns with others, and given up when `uploads` stops. What is too large for memory is kept in a file
+/// without a name in the file system of `directory`, as long as its user's share of the disk lasts; that is given back
+/// with the file.
+[[nodiscard]] CompressedFile gzipFile(const FileUpload& upload, std::uint64_t size, const std::string& directory,
+                                      const std::shared_ptr<ProcessUploads>& uploads);
 
 }  // namespace velk

@@ -125,7 +125,8 @@ inline constexpr const char* kUploadPostFailed = "UploadBackend(uploadFileAtPath
 inline constexpr const char* kUploadAnswered = "UploadBackend(uploadFileAtPath): sending to |%s|, Json output: %s";
 inline constexpr const char* kUploadTooLarge =
     "UploadBackend(uploadFileAtPath): a file of %llu bytes is larger than the %llu that are taken";
-inline constexpr const char* kUploadNotKept = "UploadBackend(uploadFileAtPath): the compressed file is lost: %s";
+inline constexpr const char* kUploadNotKept =
+    "UploadBackend(uploadFileAtPath): there is no room for %s, compressed: %s";
 
 // Macro expansion.
 inline constexpr const char* kExpandingMacro = "expandMacroForDataSet: Expanding macro '%@' into '%@'";

@@ -104,7 +104,7 @@ bool UploadBackend::uploadFileAtPath(FileUpload& upload) {
       log::error(backend_texts::kUploadTooLarge, *size, kMaximumFileBytes);
       return false;
     }
-    body = gzipFile(upload.file, *size, _context.largeFilesDirectory, *_context.uploads);
+    body = gzipFile(upload, *size, _context.largeFilesDirectory, _context.uploads);
   }
   if (body.outcome == CompressedFile::Outcome::nothingToRead) log::standard(backend_texts::kInputFileIsEmpty);
   if (body.outcome != CompressedFile::Outcome::compressed) return false;

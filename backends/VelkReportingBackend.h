@@ -62,6 +62,7 @@ struct FileUpload {
   FileDescriptor file;         ///< opened by the client; none when it gave none
   /// Set when a server has said that it has the file, which its owner may then remove.
   bool isDelivered = false;
+  ProcessUploads::User user = 0;  ///< whose upload it is
 };
 
 class VelkReportingBackend : public std::enable_shared_from_this<VelkReportingBackend> {

@@ -32,6 +32,7 @@ class IpcIncomingConnection : public IncomingConnection {
   }
 
   std::string description() const override { return _connection->description(); }
+  std::uint32_t user() const override { return _connection->peer().uid; }
 
  private:
   const std::shared_ptr<Connection> _connection;

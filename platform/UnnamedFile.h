@@ -23,6 +23,9 @@ class UnnamedFile {
   /// Fails when there is no room.
   [[nodiscard]] Result<void> append(std::span<const std::uint8_t> bytes);
 
+  /// What its file system has left for this process; all there can be where the system does not say.
+  [[nodiscard]] std::uint64_t availableSpace() const;
+
   [[nodiscard]] const FileDescriptor& file() const noexcept { return _file; }
   [[nodiscard]] std::uint64_t size() const noexcept { return _size; }
 

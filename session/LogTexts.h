@@ -101,7 +101,8 @@ inline constexpr std::string_view kMessageLogUpload = "[uploadFileWithURL] Uploa
 inline constexpr std::string_view kUploadFailed = "uploadFileWithURL: File upload failed for %s";
 inline constexpr std::string_view kLogDataFailed = "uploadLogData: Log data array upload failed";
 inline constexpr std::string_view kTooManyUploads =
-    "uploadFileAtPath: session %u takes no more: %d uploads of its own, or %d of all sessions, are under way";
+    "uploadFileAtPath: session %u takes no more: %d uploads of its own, or its user's share of the %d places, are "
+    "under way";
 
 // What clients are told.
 inline constexpr std::string_view kReplyNoDisplayURL = "URL not available";

@@ -24,7 +24,7 @@ ClientSession::ClientSession(ReportingdSessionDelegate& delegate, std::shared_pt
       _services(services),
       _sessionIDString(base64Encoded(randomUuid())),
       _connectivityHelperReleaseTimeout(kDefaultReleaseTimeout),
-      _uploads(services.backends.platform.scheduler, services.backends.uploads),
+      _uploads(services.backends.platform.scheduler, services.backends.uploads, connection->user()),
       _connection(std::move(connection)) {
   log::standard(session_texts::kSessionInit, _delegate.description());
   readDeviceIdentifier();

@@ -26,6 +26,8 @@ class SessionConnection {
                                                          double timestamp, std::uint16_t category, std::uint16_t type,
                                                          const std::optional<PropertyDictionary>& payload) = 0;
   [[nodiscard]] virtual std::string description() const = 0;
+  /// The user (a uid) that the peer runs as. Constant.
+  [[nodiscard]] virtual std::uint32_t user() const = 0;
 };
 
 /// The record of what the daemon did with messages.

@@ -19,23 +19,30 @@ class UploadQueue {
   /// descriptor, or a megabyte of log data.
   static constexpr std::size_t kMaximumUploads = 16;
 
-  UploadQueue(Scheduler& scheduler, std::shared_ptr<ProcessUploads> ofAll)
-      : _scheduler(scheduler), _ofAll(std::move(ofAll)) {}
+  /// A place among the uploads of the session, of its user and of the process; given back with the last reference.
+  using Place = std::shared_ptr<const void>;
 
-  [[nodiscard]] bool isFull() const { return _underWay->load() >= kMaximumUploads || _ofAll->isFull(); }
+  /// `user`: whose process the session's client is.
+  UploadQueue(Scheduler& scheduler, std::shared_ptr<ProcessUploads> ofAll, ProcessUploads::User user)
+      : _scheduler(scheduler), _ofAll(std::move(ofAll)), _user(user) {}
+
+  [[nodiscard]] ProcessUploads::User user() const noexcept { return _user; }
+
+  /// Null when the session, or its user, has its share already.
+  [[nodiscard]] Place takePlace() {
+    if (_underWay->load() >= kMaximumUploads || !_ofAll->enter(_user)) return nullptr;
+    ++*_underWay;
+    return Place(_ofAll.get(), [underWay = _underWay, ofAll = _ofAll, user = _user](const void*) {
+      --*underWay;
+      ofAll->leave(user);
+    });
+  }
 
   /// Runs the upload behind those that were taken before. It is told whether it may begin: when the process is about to
   /// end it may not, and only answers. It says whether what was to be uploaded has been delivered.
   template <class Upload>
-  void run(Upload upload) {
+  void run(Place place, Upload upload) {
     if (!_queue) _queue = _scheduler.makeSerialQueue("com.tavrin.velkreportingd.uploads");
-    ++*_underWay;
-    _ofAll->enter();
-    // Run or dropped, it leaves once.
-    std::shared_ptr<void> place(nullptr, [underWay = _underWay, ofAll = _ofAll](void*) {
-      --*underWay;
-      ofAll->leave();
-    });
     _queue->async([upload = std::move(upload), place = std::move(place), ofAll = _ofAll]() mutable {
       const bool isDelivered = upload(!ofAll->isStopping());
       if (!isDelivered && ofAll->isStopping()) ofAll->noteLeftBehind();
@@ -55,6 +62,7 @@ class UploadQueue {
  private:
   Scheduler& _scheduler;
   const std::shared_ptr<ProcessUploads> _ofAll;
+  const ProcessUploads::User _user;
   std::shared_ptr<Queue> _queue;
   const std::shared_ptr<std::atomic<std::size_t>> _underWay = std::make_shared<std::atomic<std::size_t>>(0);
 };

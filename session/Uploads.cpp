@@ -74,15 +74,17 @@ void ClientSession::uploadFileAtPath(std::string url, std::string extensionToken
 void ClientSession::uploadFileWithURL(std::string url, std::string extensionToken, FileDescriptor file,
                                       UploadReply reply) {
   FileUpload upload{fileSystemPath(url), std::move(extensionToken), std::move(file)};
-  if (_uploads.isFull()) {
+  upload.user = _uploads.user();
+  auto place = _uploads.takePlace();
+  if (!place) {
     log::error(session_texts::kTooManyUploads, sessionID(), UploadQueue::kMaximumUploads,
                ProcessUploads::kMaximumUploads);
     finishFileUpload(_services.messageLog, url, upload, false, reply);
     return;
   }
   // Nothing of the session: the upload may outlive it.
-  _uploads.run([backends = ownBackends(), &messageLog = _services.messageLog, url = std::move(url),
-                upload = std::move(upload), reply = std::move(reply)](bool mayBegin) mutable {
+  _uploads.run(std::move(place), [backends = ownBackends(), &messageLog = _services.messageLog, url = std::move(url),
+                                  upload = std::move(upload), reply = std::move(reply)](bool mayBegin) mutable {
     const bool taken =
         mayBegin && offer(backends.get(), [&](VelkReportingBackend& each) { return each.uploadFileAtPath(upload); });
     finishFileUpload(messageLog, url, upload, taken, reply);
@@ -91,19 +93,20 @@ void ClientSession::uploadFileWithURL(std::string url, std::string extensionToke
 }
 
 void ClientSession::uploadLogData(PropertyArray logData, LogDataReply reply) {
-  if (_uploads.isFull()) {
+  auto place = _uploads.takePlace();
+  if (!place) {
     log::error(session_texts::kTooManyUploads, sessionID(), UploadQueue::kMaximumUploads,
                ProcessUploads::kMaximumUploads);
     finishLogData(false, reply);
     return;
   }
-  _uploads.run(
-      [backends = ownBackends(), logData = std::move(logData), reply = std::move(reply)](bool mayBegin) mutable {
-        const bool taken =
-            mayBegin && offer(backends.get(), [&](VelkReportingBackend& each) { return each.uploadLogData(logData); });
-        finishLogData(taken, reply);
-        return taken;
-      });
+  _uploads.run(std::move(place), [backends = ownBackends(), logData = std::move(logData),
+                                  reply = std::move(reply)](bool mayBegin) mutable {
+    const bool taken =
+        mayBegin && offer(backends.get(), [&](VelkReportingBackend& each) { return each.uploadLogData(logData); });
+    finishLogData(taken, reply);
+    return taken;
+  });
 }
 
 }  // namespace velk

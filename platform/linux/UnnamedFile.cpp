@@ -2,9 +2,11 @@
 
 #include <fcntl.h>
 #include <stdlib.h>
+#include <sys/statvfs.h>
 #include <unistd.h>
 
 #include <cerrno>
+#include <limits>
 #include <system_error>
 
 #include "platform/Files.h"
@@ -48,6 +50,13 @@ Result<void> UnnamedFile::append(std::span<const std::uint8_t> bytes) {
     bytes = bytes.subspan(static_cast<std::size_t>(written));
   }
   return {};
+}
+
+std::uint64_t UnnamedFile::availableSpace() const {
+  struct statvfs system {};
+  // File systems without a size of their own say that they have no blocks.
+  if (::fstatvfs(_file.get(), &system) != 0 || system.f_blocks == 0) return std::numeric_limits<std::uint64_t>::max();
+  return static_cast<std::uint64_t>(system.f_bavail) * system.f_frsize;
 }
 
 }  // namespace velk

@@ -8,6 +8,7 @@
 #include <cstdlib>
 #include <filesystem>
 #include <optional>
+#include <random>
 #include <thread>
 
 #include "connectivity/ReportingSessionConnectivityHelper.h"
@@ -22,6 +23,12 @@ namespace {
 using namespace backend_texts;
 
 constexpr char kUdid[] = "0123456789abcdef0123456789abcdef01234567";
+
+FileUpload openFile(const std::string& path, ProcessUploads::User user = 0) {
+  FileUpload upload{path, "token", FileDescriptor(::open(path.c_str(), O_RDONLY | O_NONBLOCK | O_CLOEXEC))};
+  upload.user = user;
+  return upload;
+}
 
 /// Answers every post at once.
 class AnsweringTransport : public ReportingSessionConnectivityInterface {
@@ -57,7 +64,7 @@ class UploadBackendTest : public BackendTest {
     return made;
   }
   bool upload(const std::string& path, UploadBackend& to) {
-    FileUpload each{path, "token", FileDescriptor(::open(path.c_str(), O_RDONLY | O_NONBLOCK | O_CLOEXEC))};
+    FileUpload each = openFile(path);
     const bool taken = to.uploadFileAtPath(each);
     delivered = each.isDelivered;
     return taken;
@@ -267,8 +274,52 @@ TEST_F(UploadBackendTest, LargeFileWithoutRoomForItStays) {
   context.largeFilesDirectory = directory.write("file", "") + "/below";
   const auto cramped = makeUpload(section);
   EXPECT_FALSE(upload(directory.write("log", std::string(kMaximumSizeInMemory + 1, 'a')), *cramped));
-  EXPECT_TRUE(log.contains("UploadBackend(uploadFileAtPath): the compressed file is lost: "));
+  EXPECT_TRUE(log.contains("UploadBackend(uploadFileAtPath): there is no room for " + (directory / "log") + ", "));
   EXPECT_TRUE(server->requests.empty());
+}
+
+/// Bytes that do not become fewer.
+std::string noise(std::size_t size) {
+  std::minstd_rand random(1);
+  std::string bytes(size, '\0');
+  for (auto& byte : bytes) byte = static_cast<char>(random() >> 8U);
+  return bytes;
+}
+
+TEST_F(UploadBackendTest, LargeFileBeyondItsUsersShareOfTheDiskStays) {
+  constexpr std::uint64_t kSize = kMaximumSizeInMemory + 1'000'000;
+  const auto path = directory.write("log", noise(kSize));
+  ProcessUploads::DiskRoom others(context.uploads, 2);
+  ASSERT_TRUE(others.grow(ProcessUploads::kMaximumDiskBytes / 2 - 1'000'000, UINT64_MAX));
+  {
+    ProcessUploads::DiskRoom own(context.uploads, 1);
+    ASSERT_TRUE(own.grow(ProcessUploads::kMaximumDiskBytes / 4 - 1'000'000, UINT64_MAX));
+    log.clear();
+    EXPECT_EQ(gzipFile(openFile(path, 1), kSize, directory.path(), context.uploads).outcome,
+              CompressedFile::Outcome::failed);
+    ASSERT_EQ(log.lines().size(), 1U);
+    EXPECT_EQ(log.lines()[0].level, log::Level::error);
+    EXPECT_TRUE(log.contains("UploadBackend(uploadFileAtPath): there is no room for " + path +
+                             ", compressed: its user has its share of the "));
+  }
+  EXPECT_EQ(gzipFile(openFile(path, 1), kSize, directory.path(), context.uploads).outcome,
+            CompressedFile::Outcome::compressed);
+}
+
+TEST_F(UploadBackendTest, RoomOnTheDiskIsTakenAsLongAsTheFileIsThere) {
+  constexpr std::uint64_t kSize = kMaximumSizeInMemory + 1'000'000;
+  const auto path = directory.write("log", noise(kSize));
+  const auto takeAll = [this] {
+    ProcessUploads::DiskRoom room(context.uploads, 1);
+    return room.grow(ProcessUploads::kMaximumDiskBytes / 2, UINT64_MAX).has_value();
+  };
+  EXPECT_TRUE(takeAll());
+  {
+    const auto compressed = gzipFile(openFile(path, 1), kSize, directory.path(), context.uploads);
+    ASSERT_NE(compressed.onDisk, nullptr);
+    EXPECT_FALSE(takeAll());
+  }
+  EXPECT_TRUE(takeAll());
 }
 
 TEST_F(UploadBackendTest, FilesOfAnySizeButTheLargestAreTaken) {
@@ -284,29 +335,66 @@ TEST_F(UploadBackendTest, LargeFilesAreGivenUpWhenTheProcessEnds) {
   context.uploads->stop();
   EXPECT_FALSE(upload(path));
   EXPECT_TRUE(server->requests.empty());
-  const FileDescriptor file(::open(path.c_str(), O_RDONLY | O_CLOEXEC));
-  EXPECT_EQ(gzipFile(file, kMaximumSizeInMemory + 1, directory.path(), *context.uploads).outcome,
+  EXPECT_EQ(gzipFile(openFile(path), kMaximumSizeInMemory + 1, directory.path(), context.uploads).outcome,
             CompressedFile::Outcome::abandoned);
 }
 
-// A turn is for a piece: while all turns are taken a large file waits, and a small one goes past it.
-TEST_F(UploadBackendTest, LargeFilesTakeTurnsAndSmallOnesNone) {
+/// A file that is being compressed on a thread of its own.
+class Compressing {
+ public:
+  Compressing(std::string path, std::uint64_t size, const std::string& directory,
+              const std::shared_ptr<ProcessUploads>& uploads, ProcessUploads::User user)
+      : _thread([this, path = std::move(path), size, directory, uploads, user] {
+          _compressed = gzipFile(openFile(path, user), size, directory, uploads);
+          _isDone = true;
+        }) {}
+  ~Compressing() { join(); }
+
+  [[nodiscard]] bool isDone() const { return _isDone; }
+  const CompressedFile& join() {
+    if (_thread.joinable()) _thread.join();
+    return _compressed;
+  }
+
+ private:
+  std::atomic<bool> _isDone{false};
+  CompressedFile _compressed;
+  std::thread _thread;
+};
+
+TEST_F(UploadBackendTest, FilesOfAnySizeTakeTurns) {
   const auto large = directory.write("large", "text");
   std::filesystem::resize_file(large, kMaximumSizeInMemory + 1);
-  std::optional<ProcessUploads::CompressionTurn> first(std::in_place, *context.uploads);
-  std::optional<ProcessUploads::CompressionTurn> second(std::in_place, *context.uploads);
-  std::atomic<bool> done{false};
-  CompressedFile compressed;
-  std::thread compressing([&] {
-    const FileDescriptor file(::open(large.c_str(), O_RDONLY | O_CLOEXEC));
-    compressed = gzipFile(file, kMaximumSizeInMemory + 1, directory.path(), *context.uploads);
-    done = true;
-  });
-  EXPECT_TRUE(upload(directory.write("small", "text")));
-  EXPECT_FALSE(done);
+  auto& uploads = *context.uploads;
+  std::optional<ProcessUploads::CompressionTurn> first(std::in_place, uploads, 1);
+  const ProcessUploads::CompressionTurn second(uploads, 1);
+  Compressing ofLarge(large, kMaximumSizeInMemory + 1, directory.path(), context.uploads, 1);
+  Compressing ofSmall(directory.write("small", "text"), 4, directory.path(), context.uploads, 1);
+  while (uploads.waitingForTurns() < 2 && !ofLarge.isDone() && !ofSmall.isDone()) std::this_thread::yield();
+  EXPECT_EQ(uploads.waitingForTurns(), 2U) << "both wait";
   first.reset();
-  compressing.join();
-  EXPECT_EQ(compressed.outcome, CompressedFile::Outcome::compressed);
+  EXPECT_EQ(ofLarge.join().outcome, CompressedFile::Outcome::compressed);
+  EXPECT_EQ(ofSmall.join().outcome, CompressedFile::Outcome::compressed);
+  EXPECT_EQ(inflated(*ofSmall.join().inMemory), "text");
+}
+
+// A turn is for a piece, so that whoever comes later does not wait for the end of a file.
+TEST_F(UploadBackendTest, SmallFilesGetTheirTurnsWhileAHugeOneIsCompressed) {
+  constexpr std::uint64_t kHuge = std::uint64_t{8} << 30U;
+  constexpr std::size_t kFitsIntoMemory = 1'000'000;
+  const auto huge = directory.write("huge", "text");
+  std::filesystem::resize_file(huge, kHuge);
+  const auto small = directory.write("small", std::string(kFitsIntoMemory, 'x'));
+  auto& uploads = *context.uploads;
+  const ProcessUploads::CompressionTurn second(uploads, 1);
+  Compressing ofHuge(huge, kHuge, directory.path(), context.uploads, 1);
+  for (const ProcessUploads::User user : {1, 2}) {
+    Compressing ofSmall(small, kFitsIntoMemory, directory.path(), context.uploads, user);
+    EXPECT_EQ(inflated(*ofSmall.join().inMemory), std::string(kFitsIntoMemory, 'x'));
+  }
+  EXPECT_FALSE(ofHuge.isDone());
+  uploads.stop();
+  EXPECT_EQ(ofHuge.join().outcome, CompressedFile::Outcome::abandoned);
 }
 
 TEST_F(UploadBackendTest, LogsALongAnswerUpToAWholeCharacter) {
@@ -350,8 +438,8 @@ TEST_F(UploadBackendTest, AServerThatNeverAnswersHoldsAnUploadForAMinute) {
 
 TEST_F(UploadBackendTest, ReadsNoMoreThanTheSizeItSaw) {
   const auto path = directory.write("log", "0123456789");
-  const FileDescriptor file(::open(path.c_str(), O_RDONLY | O_CLOEXEC));
-  ProcessUploads uploads;
+  const auto file = openFile(path);
+  const auto uploads = std::make_shared<ProcessUploads>();
   EXPECT_EQ(inflated(*gzipFile(file, 4, directory.path(), uploads).inMemory), "0123");
   EXPECT_EQ(inflated(*gzipFile(file, 100, directory.path(), uploads).inMemory), "0123456789")
       << "it has become shorter";

@@ -29,6 +29,7 @@ class FakeIncomingConnection : public IncomingConnection {
     return {};
   }
   std::string description() const override { return "<connection>"; }
+  std::uint32_t user() const override { return 1000; }
 
   void interrupt() { _interruption(); }
   /// What the IPC layer does at the end: the handler runs once, then everything is let go.

@@ -69,6 +69,7 @@ std::optional<std::string> FakeBackend::flushMessagesWithCompletion(BackendFlush
 
 bool FakeBackend::uploadFileAtPath(FileUpload& upload) {
   journal.note(formatText("upload %@ %@ %@", {name(), upload.path, upload.extensionToken}));
+  uploadsUser = upload.user;
   if (deliversUploads) upload.isDelivered = true;
   return takesUploads;
 }

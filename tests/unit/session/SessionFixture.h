@@ -57,6 +57,7 @@ class FakeConnection : public SessionConnection {
                                                  std::uint16_t category, std::uint16_t type,
                                                  const std::optional<PropertyDictionary>& payload) override;
   [[nodiscard]] std::string description() const override { return "<connection>"; }
+  [[nodiscard]] std::uint32_t user() const override { return 1000; }
 
   [[nodiscard]] std::vector<Call> calls() const;
 
@@ -123,6 +124,7 @@ class FakeBackend : public VelkReportingBackend {
   bool isPost = false;
   bool takesUploads = false;
   bool deliversUploads = false;
+  ProcessUploads::User uploadsUser = 0;
 };
 
 /// The agent. Tables and answers are the test's.

@@ -134,7 +134,8 @@ TEST_F(UploadsTest, MoreThanItTakesIsRefusedAtOnce) {
   EXPECT_EQ(recordedLog.count(log::Level::error, "uploadFileWithURL: File upload failed for /tmp/b"), 1);
   EXPECT_EQ(
       recordedLog.count(
-          "uploadFileAtPath: session 7 takes no more: 16 uploads of its own, or 64 of all sessions, are under way"),
+          "uploadFileAtPath: session 7 takes no more: 16 uploads of its own, or its user's share of the 64 places, are "
+          "under way"),
       2);
   fakes.scheduler.runUntilIdle();
   EXPECT_EQ(answers, static_cast<int>(UploadQueue::kMaximumUploads));
@@ -150,11 +151,27 @@ TEST_F(UploadsTest, WhatEndedSessionsLeftBehindCountsForAll) {
   EXPECT_EQ(ofAll.count(), 2U);
   fakes.scheduler.runUntilIdle();
   EXPECT_EQ(ofAll.count(), 0U);
-  while (!ofAll.isFull()) ofAll.enter();
+  while (ofAll.enter(connection->user())) {
+  }
   start({"splunk"});
   EXPECT_EQ(uploadFile("file:///tmp/b"), false);
-  ofAll.leave();
+  ofAll.leave(connection->user());
   EXPECT_EQ(uploadFile("file:///tmp/b"), true);
+}
+
+TEST_F(UploadsTest, OtherUsersTakeNoPlacesOfThisOne) {
+  prepareBackend = [](FakeBackend& each) { each.takesUploads = true; };
+  start({"splunk"});
+  auto& ofAll = *services.backends.uploads;
+  while (ofAll.enter(connection->user() + 1)) {
+  }
+  EXPECT_EQ(uploadFile("file:///tmp/b"), true);
+}
+
+TEST_F(UploadsTest, BackendsHearWhoseUploadItIs) {
+  start({"splunk"});
+  EXPECT_EQ(uploadFile("file:///tmp/b"), false);
+  EXPECT_EQ(backend("splunk").uploadsUser, connection->user());
 }
 
 TEST_F(UploadsTest, WhatWaitsAtTheEndOfTheProcessIsNotBegunAndStaysWithItsClient) {
@@ -176,8 +193,8 @@ TEST_F(UploadsTest, WhatWaitsAtTheEndOfTheProcessIsNotBegunAndStaysWithItsClient
 TEST_F(UploadsTest, WhatIsDeliveredWhileTheProcessEndsIsNotLeftBehind) {
   prepareBackend = [](FakeBackend& each) { each.takesUploads = each.deliversUploads = true; };
   start({"splunk"});
-  UploadQueue queue(fakes.scheduler, services.backends.uploads);
-  queue.run([this](bool mayBegin) {
+  UploadQueue queue(fakes.scheduler, services.backends.uploads, connection->user());
+  queue.run(queue.takePlace(), [this](bool mayBegin) {
     services.backends.uploads->stop();
     return mayBegin;
   });
