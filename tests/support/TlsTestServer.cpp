@@ -1,6 +1,7 @@
 #include "tests/support/TlsTestServer.h"
 
 #include <arpa/inet.h>
+#include <netinet/in.h>
 #include <openssl/pem.h>
 #include <openssl/ssl.h>
 #include <openssl/x509v3.h>
@@ -63,7 +64,7 @@ Certificate makeCertificate(const char* name, EVP_PKEY* key, X509* issuer, EVP_P
     addExtension(certificate.get(), signer, NID_basic_constraints, "critical,CA:TRUE");
     addExtension(certificate.get(), signer, NID_key_usage, "critical,keyCertSign,cRLSign");
   } else {
-    addExtension(certificate.get(), signer, NID_subject_alt_name, "DNS:localhost,IP:127.0.0.1,IP:::1");
+    addExtension(certificate.get(), signer, NID_subject_alt_name, "DNS:localhost,IP:127.0.0.1,IP:::1,IP:192.0.2.1");
   }
   require(X509_sign(certificate.get(), issuerKey, EVP_sha256()) > 0, "signing");
   return certificate;
@@ -167,7 +168,7 @@ const std::string* TlsTestServer::Request::header(std::string_view name) const {
 
 class TlsTestServer::Implementation {
  public:
-  explicit Implementation(bool encrypted) {
+  Implementation(bool encrypted, std::string at) : address(std::move(at)) {
     if (encrypted) makeContext();
     listen();
     _acceptor = std::thread([this] { acceptConnections(); });
@@ -193,6 +194,7 @@ class TlsTestServer::Implementation {
 
   [[nodiscard]] bool isEncrypted() const { return _context != nullptr; }
 
+  const std::string address;
   int port = 0;
   std::string caFile;
   mutable Lock lock;
@@ -215,14 +217,16 @@ class TlsTestServer::Implementation {
 
   void listen() {
     _listener = FileDescriptor(::socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0));
-    sockaddr_in address{};
-    address.sin_family = AF_INET;
-    address.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
-    socklen_t size = sizeof address;
-    auto* generic = reinterpret_cast<sockaddr*>(&address);
+    sockaddr_in name{};
+    name.sin_family = AF_INET;
+    ::inet_pton(AF_INET, address.c_str(), &name.sin_addr);
+    socklen_t size = sizeof name;
+    auto* generic = reinterpret_cast<sockaddr*>(&name);
+    const int allowed = 1;
+    ::setsockopt(_listener.get(), IPPROTO_IP, IP_FREEBIND, &allowed, sizeof allowed);
     require(::bind(_listener.get(), generic, size) == 0 && ::listen(_listener.get(), 128) == 0, "listening");
     ::getsockname(_listener.get(), generic, &size);
-    port = ntohs(address.sin_port);
+    port = ntohs(name.sin_port);
   }
 
   void acceptConnections() {
@@ -297,14 +301,15 @@ class TlsTestServer::Implementation {
   bool _stopping VELK_GUARDED_BY(lock) = false;
 };
 
-TlsTestServer::TlsTestServer(bool encrypted) : _implementation(std::make_unique<Implementation>(encrypted)) {}
+TlsTestServer::TlsTestServer(bool encrypted, std::string address)
+    : _implementation(std::make_unique<Implementation>(encrypted, std::move(address))) {}
 TlsTestServer::~TlsTestServer() = default;
 
 int TlsTestServer::port() const { return _implementation->port; }
 
 std::string TlsTestServer::url(std::string_view path) const {
   std::string url = _implementation->isEncrypted() ? "https" : "http";
-  url.append("://127.0.0.1:").append(std::to_string(port())).append(path);
+  url.append("://").append(_implementation->address).append(":").append(std::to_string(port())).append(path);
   return url;
 }
 
