@@ -82,6 +82,7 @@ HttpRequest makePostRequest(const PostDescription& post) {
   request.body = post.body;
   request.allowsCellularAccess = !post.wifiOnly;
   request.requiresHttps = !post.isInternal;
+  request.discardsResponseBody = true;
   Headers headers(request);
   addIdentity(post, headers);
   addContent(post, headers);

@@ -26,6 +26,9 @@ class ReportingSessionConnectivityInterface {
   /// For senders of events, before they build the next request: waits while too many of `sender` are under way. Never
   /// call it with the agent's lock held.
   virtual void waitForRoom(std::uint64_t /*sender*/) {}
+  /// The sender's client has gone: its waiters go on, and `waitForRoom(sender)` returns at once from now on. Any
+  /// thread; never blocks.
+  virtual void stopWaiting(std::uint64_t /*sender*/) {}
 };
 
 /// The agent, as the transport knows it.

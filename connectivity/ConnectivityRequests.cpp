@@ -30,62 +30,57 @@ std::string nextTaskDescription() {
 
 Lock ReportingSessionConnectivityHelper::classLock;
 
-void ReportingSessionConnectivityHelper::waitForRoom(std::uint64_t /*sender*/) { _window->waitForRoom(); }
+void ReportingSessionConnectivityHelper::waitForRoom(std::uint64_t sender) { _window->waitForRoom(sender); }
+
+void ReportingSessionConnectivityHelper::stopWaiting(std::uint64_t sender) { _window->stopWaiting(sender); }
 
 void ReportingSessionConnectivityHelper::postURLRequestWithCompletionHandler(HttpRequest request,
                                                                              HttpCompletion completion) {
   // Called or dropped, and by whatever path, it leaves the window once. Bulk has a line of its own and bounds of its
   // own: events need not wait for it.
-  std::shared_ptr<void> underWay;
-  if (!request.isBulk) {
-    _window->enter();
-    underWay = std::shared_ptr<void>(nullptr, [window = _window](void*) { window->leave(); });
-  }
-  _stateQueue->async([self = shared_from_this(), request = std::move(request), underWay,
+  Place place;
+  if (!request.isBulk) place = std::make_shared<PlaceInWindow>(_window, request.sender);
+  _stateQueue->async([self = shared_from_this(), request = std::move(request), place = std::move(place),
                       completion = std::move(completion)]() mutable {
-    self->post(std::move(request),
-               [underWay, completion = std::move(completion)](
-                   ByteData data, std::shared_ptr<const HttpResponse> response, std::optional<Error> error) mutable {
-                 completion(std::move(data), std::move(response), std::move(error));
-               });
+    self->post(std::move(request), std::move(completion), std::move(place));
   });
 }
 
-void ReportingSessionConnectivityHelper::post(HttpRequest request, HttpCompletion completion) {
+void ReportingSessionConnectivityHelper::post(HttpRequest request, HttpCompletion completion, Place place) {
   if (!_isActive) return;
   if (_mode == POSTRequestMode()) {
-    postData(std::move(request), std::move(completion));
+    postData(std::move(request), std::move(completion), std::move(place));
   } else if (_mode == kBackgroundUploadMode) {
-    postFile(std::move(request), std::move(completion));
+    postFile(std::move(request), std::move(completion), std::move(place));
   } else {
     log::error(texts::kPostWrongMode, _mode);
   }
 }
 
-void ReportingSessionConnectivityHelper::postData(HttpRequest request, HttpCompletion completion) {
-  const auto task = _privateURLSession->makeDataTask(std::move(request));
-  if (!task) {
-    log::error(texts::kPostSessionInvalidated, task.error());
-    return;
-  }
-  if (!*task) return;
-  createHelperForTask(**task, std::move(completion));
-  (*task)->resume();
+void ReportingSessionConnectivityHelper::postData(HttpRequest request, HttpCompletion completion, Place place) {
+  startPost(_privateURLSession->makeDataTask(std::move(request)), std::move(completion), std::move(place));
 }
 
-void ReportingSessionConnectivityHelper::postFile(HttpRequest request, HttpCompletion completion) {
+void ReportingSessionConnectivityHelper::postFile(HttpRequest request, HttpCompletion completion, Place place) {
   const auto container = composeUniqueContainerURL();
   const auto body = std::exchange(request.body, nullptr);
   const auto* bytes = body ? reinterpret_cast<const std::uint8_t*>(body->data()) : nullptr;
   if (!files::writeAtomically(container, {bytes, body ? body->size() : 0})) return;
-  const auto task = _privateURLSession->makeUploadTask(std::move(request), container);
-  if (!task) {
+  startPost(_privateURLSession->makeUploadTask(std::move(request), container), std::move(completion), std::move(place));
+  deleteContainerAtURL(container);
+}
+
+// A request that no session could make fails as one that was sent would: the requester hears why.
+void ReportingSessionConnectivityHelper::startPost(const Result<std::shared_ptr<HttpTask>>& task,
+                                                   HttpCompletion completion, Place place) {
+  if (!task && task.error().code == kHttpSessionInvalidatedCode) {
     log::error(texts::kPostSessionInvalidated, task.error());
+  } else if (!task) {
+    if (completion) completion({}, nullptr, task.error());
   } else if (*task) {
-    createHelperForTask(**task, std::move(completion));
+    createHelperForTask(**task, std::move(completion), std::move(place));
     (*task)->resume();
   }
-  deleteContainerAtURL(container);
 }
 
 std::optional<std::uint32_t> ReportingSessionConnectivityHelper::getURLRequestWithCompletionHandler(
@@ -171,10 +166,10 @@ HttpCompletion ReportingSessionConnectivityHelper::pullWrapper(std::string url, 
   };
 }
 
-void ReportingSessionConnectivityHelper::createHelperForTask(HttpTask& task, HttpCompletion completion) {
+void ReportingSessionConnectivityHelper::createHelperForTask(HttpTask& task, HttpCompletion completion, Place place) {
   auto description = nextTaskDescription();
   task.setTaskDescription(description);
-  _tasks[description] = std::make_unique<ConnectivityHelperTask>(description, std::move(completion));
+  _tasks[description] = std::make_unique<ConnectivityHelperTask>(description, std::move(completion), std::move(place));
   _runningTasks = static_cast<std::uint32_t>(_tasks.size());
   log::standard(texts::kHelperTaskCreated, description);
 }
@@ -213,6 +208,14 @@ void ReportingSessionConnectivityHelper::didSendBodyData(HttpSession& session, H
 
 void ReportingSessionConnectivityHelper::didBecomeDownloadTask(HttpSession& session, HttpTask&) {
   log::error(texts::kDidBecomeDownloadTask, session.sessionDescription());
+}
+
+// Without a network nobody waits for room: the HTTP service bounds what waits for a route.
+void ReportingSessionConnectivityHelper::taskIsWaitingForConnectivity(HttpSession&, HttpTask& task) {
+  _stateQueue->async([self = shared_from_this(), description = task.taskDescription()] {
+    const auto found = self->_tasks.find(description);
+    if (found != self->_tasks.end()) found->second->waitsForConnectivity();
+  });
 }
 
 void ReportingSessionConnectivityHelper::didBecomeInvalidWithError(HttpSession& session,

@@ -79,10 +79,11 @@ class ReportingSessionConnectivityHelper : public ReportingSessionConnectivityIn
   /// Gives the keep-alive references back. Takes the agent's lock.
   void releaseAllIPCTransactions();
 
-  /// Dropped, completion uncalled: on an inactive helper, in a mode for pulls, when no task could be made.
+  /// Dropped, completion uncalled: on an inactive helper, in a mode for pulls, on a session that was invalidated.
   void postURLRequestWithCompletionHandler(HttpRequest request, HttpCompletion completion) override;
-  /// Waits while RequestWindow::kMaximumRequests are under way; not once the helper has been invalidated.
+  /// Waits while RequestWindow::kMaximumRequests of the sender are under way; not once the helper has been invalidated.
   void waitForRoom(std::uint64_t sender) override;
+  void stopWaiting(std::uint64_t sender) override;
   /// Dropped, completion uncalled: an address that this helper has been asked for before, finished or not.
   /// Urgent pulls start at once, others after `delay` seconds; without one, after a random delay below kPullDelayBound.
   /// Returns the delay of a pull that will be made, nothing for one that will not.
@@ -102,6 +103,7 @@ class ReportingSessionConnectivityHelper : public ReportingSessionConnectivityIn
   void didSendBodyData(HttpSession& session, HttpTask& task, std::int64_t sent, std::int64_t expected) override;
   void didBecomeDownloadTask(HttpSession& session, HttpTask& task) override;
   void didCompleteWithError(HttpSession& session, HttpTask& task, const std::optional<Error>& error) override;
+  void taskIsWaitingForConnectivity(HttpSession& session, HttpTask& task) override;
   void didBecomeInvalidWithError(HttpSession& session, const std::optional<Error>& error) override;
 
  private:
@@ -118,13 +120,15 @@ class ReportingSessionConnectivityHelper : public ReportingSessionConnectivityIn
   void releaseTimerFired();
   void cancelReleaseTimer();
   void callOwner(ReleaseBlock block, std::shared_ptr<Queue> queue, std::uint32_t usageCount);
-  void post(HttpRequest request, HttpCompletion completion);
-  void postData(HttpRequest request, HttpCompletion completion);
-  void postFile(HttpRequest request, HttpCompletion completion);
+  using Place = std::shared_ptr<PlaceInWindow>;
+  void post(HttpRequest request, HttpCompletion completion, Place place);
+  void postData(HttpRequest request, HttpCompletion completion, Place place);
+  void postFile(HttpRequest request, HttpCompletion completion, Place place);
+  void startPost(const Result<std::shared_ptr<HttpTask>>& task, HttpCompletion completion, Place place);
   void pull(HttpRequest request, HttpCompletion completion);
   void cancelPull(const std::string& url, HttpCompletion completion, const char* error, const char* logText);
   [[nodiscard]] HttpCompletion pullWrapper(std::string url, HttpCompletion completion);
-  void createHelperForTask(HttpTask& task, HttpCompletion completion);
+  void createHelperForTask(HttpTask& task, HttpCompletion completion, Place place = nullptr);
 
   void schedulePull(HttpRequest request, bool isUrgent, std::uint32_t delay, HttpCompletion completion);
   void setRequestInProgress(const std::string& url, bool inProgress);

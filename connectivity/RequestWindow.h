@@ -1,60 +1,68 @@
-// How many requests of one transport may be under way. Without a bound a slow server would let finished batches pile up
-// in memory; with it the senders are made to wait, their sockets are no longer read, and it is felt at last in the
-// clients' bounded outboxes. Owned by a connectivity helper, shared with the completions of its requests. Any thread.
+// How many requests of one sender may be under way in a transport. Without a bound a slow server would let finished
+// batches pile up in memory; with it the sender is made to wait, its socket is no longer read, and it is felt at last
+// in its client's bounded outbox. Each sender has a share of its own, so that none waits for another's requests. Owned
+// by a connectivity helper, shared with the completions of its requests. Any thread.
 #pragma once
 
+#include <atomic>
 #include <cstddef>
+#include <cstdint>
+#include <deque>
+#include <memory>
+#include <unordered_map>
 
-#include "platform/BlockingScope.h"
 #include "platform/Lock.h"
 
 namespace velk {
 
 class RequestWindow {
  public:
-  /// Several times what the HTTP service sends at once to one host, and a few megabytes at the worst.
-  static constexpr std::size_t kMaximumRequests = 64;
+  /// Twice what the HTTP service sends at once to one host: its line does not run dry while a sender builds its next
+  /// request.
+  static constexpr std::size_t kMaximumRequests = 16;
 
-  /// Waits until one more request may be made. At the latest that is when the oldest one has timed out. Never under
-  /// the agent's lock, and never on a queue that completions need.
-  void waitForRoom() {
-    {
-      Guard guard(_lock);
-      if (_underWay < kMaximumRequests || _isClosed) return;
-    }
-    BlockingScope blocking;
-    Guard guard(_lock);
-    while (_underWay >= kMaximumRequests && !_isClosed) _changed.wait(_lock);
-  }
+  /// Waits until the sender may make one more request. A request that waits for a route does not count. Never under the
+  /// agent's lock, and never on a queue that completions need.
+  void waitForRoom(std::uint64_t sender);
+  void enter(std::uint64_t sender);
+  /// A request has been answered, has failed, was dropped, or waits for a route.
+  void leave(std::uint64_t sender);
 
-  void enter() {
-    Guard guard(_lock);
-    ++_underWay;
-  }
-
-  /// A request has been answered, has failed, or was dropped.
-  void leave() {
-    Guard guard(_lock);
-    --_underWay;
-    _changed.notifyOne();
-  }
-
+  /// The sender's client has gone: it waits no more.
+  void stopWaiting(std::uint64_t sender);
   /// The transport takes no more requests: nobody has to wait for it.
-  void close() {
-    Guard guard(_lock);
-    _isClosed = true;
-    _changed.notifyAll();
-  }
-  void open() {
-    Guard guard(_lock);
-    _isClosed = false;
-  }
+  void close();
+  void open();
+
+  /// Senders with requests under way.
+  [[nodiscard]] std::size_t senderCount();
 
  private:
+  [[nodiscard]] bool isFullLocked(std::uint64_t sender) const VELK_REQUIRES(_lock);
+
   Lock _lock;
   Condition _changed;
-  std::size_t _underWay VELK_GUARDED_BY(_lock) = 0;
+  /// Requests under way, for senders that have any.
+  std::unordered_map<std::uint64_t, std::size_t> _underWay VELK_GUARDED_BY(_lock);
+  /// The last senders whose clients have gone: many more than have calls left behind at once.
+  std::deque<std::uint64_t> _stopped VELK_GUARDED_BY(_lock);
   bool _isClosed VELK_GUARDED_BY(_lock) = false;
+};
+
+/// A request's place in its window: given up once, by whatever path the request ends or begins to wait. Any thread.
+class PlaceInWindow {
+ public:
+  PlaceInWindow(std::shared_ptr<RequestWindow> window, std::uint64_t sender);
+  ~PlaceInWindow() { leave(); }
+  PlaceInWindow(const PlaceInWindow&) = delete;
+  PlaceInWindow& operator=(const PlaceInWindow&) = delete;
+
+  void leave();
+
+ private:
+  const std::shared_ptr<RequestWindow> _window;
+  const std::uint64_t _sender;
+  std::atomic<bool> _hasLeft{false};
 };
 
 }  // namespace velk

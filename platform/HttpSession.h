@@ -28,7 +28,8 @@ struct HttpRequest {
   std::shared_ptr<const std::string> body;
   /// A body that is too large for memory, read piece by piece while it is sent. At most one of the two is given.
   std::shared_ptr<const UnnamedFile> bodyFile;
-  /// From `resume` to the end of the answer, waiting for a network included.
+  /// From the start of an attempt to the end of the answer: time in a line or without a route does not count. For an
+  /// urgent request: from `resume`, waiting included.
   Duration timeout = std::chrono::seconds(60);
   bool ignoresLocalCache = false;
   /// False: the request never leaves over a metered mobile interface.
@@ -37,12 +38,15 @@ struct HttpRequest {
   bool requiresHttps = true;
   /// Large and patient: it stands in a line of its own, so that small requests to the same server go on beside it.
   bool isBulk = false;
-  /// Stands in no line: a thread waits for the answer.
+  /// Stands in no line, and waits for a route within its timeout only: a thread waits for the answer.
   bool isUrgent = false;
   /// The session that sends it. Requests of different senders to one server take turns. 0: no particular sender.
   std::uint64_t sender = 0;
   /// Where this is less than what the session's configuration says, it is the bound for the answer.
   std::optional<std::size_t> maximumResponseBytes;
+  /// The status is all that matters. No data is delivered, and once the status is there the task has succeeded: after
+  /// 64 KiB the rest is not even read.
+  bool discardsResponseBody = false;
 
   void setHeader(std::string_view name, std::string_view value);
 };
@@ -70,7 +74,7 @@ class HttpTask {
 class HttpSession;
 
 /// Hears what becomes of a session's tasks, on the session's delegate queue, one call at a time. For one task:
-/// response, data (any number of times), completion (exactly once, always).
+/// perhaps that it waits, response, data (any number of times), completion (exactly once, always).
 class HttpSessionDelegate {
  public:
   virtual ~HttpSessionDelegate() = default;
@@ -79,6 +83,8 @@ class HttpSessionDelegate {
   virtual void didSendBodyData(HttpSession& session, HttpTask& task, std::int64_t sent, std::int64_t expected) = 0;
   virtual void didBecomeDownloadTask(HttpSession& session, HttpTask& task) = 0;
   virtual void didCompleteWithError(HttpSession& session, HttpTask& task, const std::optional<Error>& error) = 0;
+  /// There is no route that the task may use, and it waits for one. Once a task: attempts in vain do not end the waiting.
+  virtual void taskIsWaitingForConnectivity(HttpSession& /*session*/, HttpTask& /*task*/) {}
   /// The last call of a session. It holds no reference to its delegate from then on.
   virtual void didBecomeInvalidWithError(HttpSession& session, const std::optional<Error>& error) = 0;
 };
@@ -91,7 +97,8 @@ struct HttpSessionConfiguration {
   bool requiresExternalPower = false;
   std::string sourceApplicationBundleIdentifier;
   std::string sourceApplicationSecondaryIdentifier;
-  /// A request made without a route waits for one, within its own timeout.
+  /// A request made without a route that it may use waits for one as long as the service runs. All that wait, in lines
+  /// or for a route, share 16 MiB of bodies: beyond, the oldest ends with an error.
   bool waitsForConnectivity = false;
   /// Answers longer than this end the task with an error.
   std::size_t maximumResponseBytes = 16 * 1024 * 1024;
@@ -146,5 +153,7 @@ struct HttpTrust {
 [[nodiscard]] std::unique_ptr<HttpSessionService> makeHttpSessionService(HttpTrust trust = httpTrustFromEnvironment());
 
 inline constexpr const char* kHttpErrorDomain = "HttpErrorDomain";
+/// The code with which an invalidated session refuses to make a task. With any other the request is at fault.
+inline constexpr int kHttpSessionInvalidatedCode = 42;
 
 }  // namespace velk

@@ -6,8 +6,9 @@
 
 #include <atomic>
 #include <cstdint>
-#include <deque>
+#include <map>
 #include <memory>
+#include <optional>
 #include <string>
 #include <thread>
 #include <unordered_map>
@@ -16,6 +17,8 @@
 #include "platform/Clock.h"
 #include "platform/HttpSession.h"
 #include "platform/Lock.h"
+#include "platform/linux/RequestLine.h"
+#include "platform/linux/RouteLookup.h"
 #include "platform/linux/RouteMonitor.h"
 
 namespace velk {
@@ -26,9 +29,19 @@ class CurlTransfer;
 /// The thread is started by the first task and sleeps in one system call while there is nothing to do; connections
 /// that nobody used for a minute are closed. It runs no delegates and waits for nobody. `submit` and `unpause` may
 /// be called from any thread and never block.
+///
+/// A task stands in its server's line, then an attempt is made, then it is complete. One that finds no route that it
+/// may use waits for a change of the routes and goes back to its place in the line. What stands in lines or waits is
+/// bounded in bytes for the whole engine; beyond the bound the oldest task ends with an error.
 class CurlEngine {
  public:
-  explicit CurlEngine(HttpTrust trust);
+  struct Options {
+    RouteLookup::Look look = defaultRoutes;
+    std::size_t maximumStandingBytes = std::size_t{16} * 1024 * 1024;
+  };
+
+  explicit CurlEngine(HttpTrust trust) : CurlEngine(std::move(trust), Options()) {}
+  CurlEngine(HttpTrust trust, Options options);
   ~CurlEngine();
   CurlEngine(const CurlEngine&) = delete;
   CurlEngine& operator=(const CurlEngine&) = delete;
@@ -56,60 +69,97 @@ class CurlEngine {
   using Easy = std::unique_ptr<CURL, EasyFreer>;
   using Multi = std::unique_ptr<CURLM, MultiFreer>;
 
-  struct InLine {
-    /// The smaller, the longer it has waited.
-    std::uint64_t number;
-    std::shared_ptr<CurlTask> task;
-  };
   /// What goes to one server: so much is sent at once, the rest stands in line.
   struct Server {
     bool isBulk = false;
     std::size_t running = 0;
-    std::deque<InLine> line;
+    RequestLine line;
+  };
+  using Tasks = RequestLine::Tasks;
+  struct RoutesAnswer {
+    std::uint64_t generation = 0;
+    DefaultRoutes routes;
   };
 
-  /// Hands a command to the thread; gives it back when the thread is (or cannot be) there no more.
-  [[nodiscard]] bool handOver(Command command);
-  bool startThreadLocked() VELK_REQUIRES(_lock);
+  /// Hands a command to the thread. The error says why that failed: the thread is there no more, or could not be
+  /// started, which the next command tries again.
+  [[nodiscard]] std::optional<Error> handOver(Command command);
+  /// Why there is none; nothing on success.
+  [[nodiscard]] std::optional<std::string> startThreadLocked() VELK_REQUIRES(_lock);
+  void routesWereLookedUp(std::uint64_t generation, const DefaultRoutes& routes);
 
   // On the thread.
   void run();
-  [[nodiscard]] bool takeCommands(std::vector<Command>& into);
+  [[nodiscard]] bool takeCommands(std::vector<Command>& into, std::optional<RoutesAnswer>& answer);
   void start(std::shared_ptr<CurlTask> task);
   void enter(std::shared_ptr<CurlTask> task);
   [[nodiscard]] Server& serverOf(const CurlTask& task);
   [[nodiscard]] bool hasRoom(const Server& server) const;
   void serveLines();
   [[nodiscard]] Server* nextToServe();
-  void expireLines();
-  void attempt(std::shared_ptr<CurlTask> task);
+  void attempt(const std::shared_ptr<CurlTask>& task);
+  void transfer(const std::shared_ptr<CurlTask>& task, long families);
+  [[nodiscard]] bool avoidOldConnections(CURL* easy) const;
   void countRunning(const CurlTask& task, bool starts);
   void resumePaused(const CurlTask& task);
   void collectFinished();
   void finished(CURL* easy, CURLcode code);
-  void retryWaiting();
+
+  // Routes.
+  void listenForRoutes();
+  void routesHaveChanged();
+  void askForRoutes();
+  void useLookup(const RoutesAnswer& answer);
+  void judgeFailure(const std::shared_ptr<CurlTask>& task);
+  void lacksRoute(const std::shared_ptr<CurlTask>& task, Error error);
+  void waitForRoute(const std::shared_ptr<CurlTask>& task);
+  void waitForLookup(const std::shared_ptr<CurlTask>& task);
   void expireWaiting();
+
+  // What stands in lines or waits.
+  void putAside(const std::shared_ptr<CurlTask>& task);
+  [[nodiscard]] Tasks takeWaiting(bool awaitsLookup);
+  [[nodiscard]] bool mayStand(CurlTask& task);
+  void stands(const CurlTask& task);
+  void standsNoMore(const CurlTask& task);
+  [[nodiscard]] std::shared_ptr<CurlTask> takeOldest();
+  void drop(CurlTask& task);
+  void reportDropped(bool atOnce);
+
   void dropEndedBulk();
   void endAll();
   void sleep();
   [[nodiscard]] int sleepMilliseconds() const;
-  void forgetConnections();
+  [[nodiscard]] bool forgetConnections();
   [[nodiscard]] Easy takeEasy();
   void giveEasyBack(Easy easy);
 
   // Constant after construction.
   const HttpTrust _trust;
+  const std::size_t _maximumStandingBytes;
 
   // The thread's own.
   std::unordered_map<CURL*, std::unique_ptr<CurlTransfer>> _running;
   std::size_t _bulkRunning = 0;
-  /// By the server's name, for bulk with a word behind it. When the first of those in line may have to leave it.
+  std::size_t _urgentRunning = 0;
+  /// By the server's name, for bulk with a word behind it.
   std::unordered_map<std::string, Server> _servers;
-  std::uint64_t _lastInLine = 0;
-  SteadyTime _lineExpires = SteadyTime::max();
-  /// Tasks that wait for a network; while there are any, the monitor is open.
-  std::vector<std::shared_ptr<CurlTask>> _waiting;
-  std::unique_ptr<RouteMonitor> _routes;
+  std::uint64_t _lastNumber = 0;
+  /// Tasks that wait for a route, or for a look-up of the routes.
+  Tasks _waiting;
+  std::size_t _urgentWaiting = 0;
+  std::size_t _standingBytes = 0;
+  std::size_t _dropped = 0;
+  SteadyTime _droppedReported = SteadyTime::min();
+  /// Open while there are requests, so that no change is missed between an attempt and its failure.
+  std::unique_ptr<RouteMonitor> _routeMonitor;
+  /// Counts the changes, and the times when some may have been missed.
+  std::uint64_t _routeGeneration = 0;
+  /// The routes of the present generation, once they have been looked up.
+  std::optional<DefaultRoutes> _routes;
+  /// The generation of the question that is being answered.
+  std::optional<std::uint64_t> _routesAsked;
+  SteadyTime _routesChanged = SteadyTime::min();
   std::vector<Easy> _spare;
   bool _mayHaveConnections = false;
   bool _bulkDropped = false;
@@ -121,9 +171,12 @@ class CurlEngine {
   Lock _lock;
   Multi _multi;
   std::vector<Command> _inbox VELK_GUARDED_BY(_lock);
+  std::optional<RoutesAnswer> _routesAnswer VELK_GUARDED_BY(_lock);
   bool _started VELK_GUARDED_BY(_lock) = false;
   bool _stopping VELK_GUARDED_BY(_lock) = false;
   std::thread _thread;
+  // Last: its thread uses what stands above.
+  RouteLookup _lookup;
 };
 
 }  // namespace velk

@@ -19,12 +19,30 @@ namespace {
 /// How far a delegate may be behind before its transfer is held up.
 constexpr std::size_t kMaximumUndelivered = 256 * 1024;
 
+static_assert(kHttpSessionInvalidatedCode == CURLE_ABORTED_BY_CALLBACK);
+
+Duration boundedTimeout(const HttpRequest& request) {
+  constexpr Duration kLongest = std::chrono::hours(24);
+  return std::clamp(request.timeout, Duration::zero(), kLongest);
+}
+
 std::string urlPart(CURLU* url, CURLUPart part, unsigned flags = 0) {
   char* text = nullptr;
   if (curl_url_get(url, part, &text, flags) != CURLUE_OK) return {};
   std::string copy(text);
   curl_free(text);
   return copy;
+}
+
+/// The host as an address that cannot be parsed seems to name it: for messages, which hold neither a password nor a
+/// path nor a query.
+std::string hostOf(std::string_view url) {
+  constexpr std::size_t kLongest = 253;
+  constexpr std::string_view kSeparator = "://";
+  if (const auto end = url.find(kSeparator); end != std::string_view::npos) url.remove_prefix(end + kSeparator.size());
+  url = url.substr(0, url.find_first_of("/?#"));
+  if (const auto user = url.rfind('@'); user != std::string_view::npos) url.remove_prefix(user + 1);
+  return url.empty() ? "no host" : std::string(url.substr(0, kLongest));
 }
 
 /// RFC 9110's token: what methods and header names are made of.
@@ -66,14 +84,18 @@ bool HttpAddress::isLoopback() const {
 
 Result<HttpAddress> parseHttpAddress(const std::string& url) {
   const std::unique_ptr<CURLU, void (*)(CURLU*)> handle(curl_url(), curl_url_cleanup);
-  if (url.find('\0') != std::string::npos ||
-      curl_url_set(handle.get(), CURLUPART_URL, url.c_str(), CURLU_NON_SUPPORT_SCHEME) != CURLUE_OK) {
-    return failure(kHttpErrorDomain, CURLE_URL_MALFORMAT, "the address is malformed");
+  if (!handle) return failure(kHttpErrorDomain, CURLE_OUT_OF_MEMORY, hostOf(url) + ": no memory for the address");
+  if (url.find('\0') != std::string::npos) {
+    return failure(kHttpErrorDomain, CURLE_URL_MALFORMAT, hostOf(url) + ": the address is malformed: it holds a zero");
+  }
+  if (const auto code = curl_url_set(handle.get(), CURLUPART_URL, url.c_str(), CURLU_NON_SUPPORT_SCHEME)) {
+    return failure(kHttpErrorDomain, CURLE_URL_MALFORMAT,
+                   hostOf(url) + ": the address is malformed: " + curl_url_strerror(code));
   }
   HttpAddress address{lowerCased(urlPart(handle.get(), CURLUPART_SCHEME)), urlPart(handle.get(), CURLUPART_HOST), {}};
   if (address.scheme != "http" && address.scheme != "https") {
     return failure(kHttpErrorDomain, CURLE_UNSUPPORTED_PROTOCOL,
-                   "addresses of the form \"" + address.scheme + ":\" are not spoken");
+                   hostOf(url) + ": addresses of the form \"" + address.scheme + ":\" are not spoken");
   }
   if (address.host.size() > 2 && address.host.front() == '[') {
     address.host = address.host.substr(1, address.host.size() - 2);
@@ -106,9 +128,12 @@ std::string CurlTask::taskDescription() const {
 
 void CurlTask::resume() {
   if (_resumed.exchange(true)) return;
-  constexpr Duration kLongest = std::chrono::hours(24);
-  _deadline = std::chrono::steady_clock::now() + std::clamp(_request.timeout, Duration::zero(), kLongest);
+  if (_request.isUrgent) _deadline = std::chrono::steady_clock::now() + boundedTimeout(_request);
   _session->_engine->submit(shared_from_this());
+}
+
+Duration CurlTask::timeLeft(SteadyTime now) const noexcept {
+  return _request.isUrgent ? std::max<Duration>(_deadline - now, Duration::zero()) : boundedTimeout(_request);
 }
 
 std::shared_ptr<const HttpResponse> CurlTask::response() const {
@@ -174,6 +199,12 @@ void CurlTask::dataWasConsumed(std::size_t size) {
   _session->_engine->unpause(shared_from_this());
 }
 
+void CurlTask::announceWaiting() {
+  post([](HttpSessionDelegate& delegate, HttpSession& session, HttpTask& task) {
+    delegate.taskIsWaitingForConnectivity(session, task);
+  });
+}
+
 void CurlTask::reportBodyDataSent(std::int64_t sent, std::int64_t expected) {
   post([sent, expected](HttpSessionDelegate& delegate, HttpSession& session, HttpTask& task) {
     delegate.didSendBodyData(session, task, sent, expected);
@@ -232,7 +263,7 @@ Result<std::shared_ptr<HttpTask>> CurlSession::makeTask(HttpRequest request) {
   {
     Guard guard(_lock);
     if (_invalidated) {
-      return failure(kHttpErrorDomain, CURLE_ABORTED_BY_CALLBACK, "the HTTP session has been invalidated");
+      return failure(kHttpErrorDomain, kHttpSessionInvalidatedCode, "the HTTP session has been invalidated");
     }
     ++_tasks;
   }

@@ -43,6 +43,7 @@ class CurlTask : public HttpTask, public std::enable_shared_from_this<CurlTask> 
   void announceResponse(HttpResponse response);
   /// False when the delegate is too far behind: the engine holds the data back and hears `unpause` later.
   [[nodiscard]] bool deliverData(std::span<const std::uint8_t> data);
+  void announceWaiting();
   void reportBodyDataSent(std::int64_t sent, std::int64_t expected);
   /// The first call counts.
   void complete(std::optional<Error> error);
@@ -54,7 +55,26 @@ class CurlTask : public HttpTask, public std::enable_shared_from_this<CurlTask> 
   [[nodiscard]] int bodyFile() const noexcept;
   [[nodiscard]] std::int64_t bodyFileSize() const noexcept;
   [[nodiscard]] std::size_t maximumResponseBytes() const noexcept;
+  /// When an urgent task ends wherever it is; of others the attempts are bounded, not the waiting.
   [[nodiscard]] SteadyTime deadline() const noexcept { return _deadline; }
+  /// For an attempt that begins now.
+  [[nodiscard]] Duration timeLeft(SteadyTime now) const noexcept;
+
+  /// Where the engine has the task. The engine's thread alone.
+  struct Place {
+    /// The smaller, the earlier it came.
+    std::uint64_t number = 0;
+    /// What was known of the routes when the last attempt began.
+    std::uint64_t routeGeneration = 0;
+    /// The delegate has heard that it waits for a route.
+    bool hasWaited = false;
+    /// It waits for a look-up of the routes, not for another route.
+    bool awaitsLookup = false;
+    /// How the last attempt failed, until the routes tell whether that was for want of one.
+    std::optional<Error> failure;
+  };
+  [[nodiscard]] Place& place() noexcept { return _place; }
+  [[nodiscard]] const Place& place() const noexcept { return _place; }
 
  private:
   void post(std::function<void(HttpSessionDelegate&, HttpSession&, HttpTask&)> call);
@@ -64,7 +84,9 @@ class CurlTask : public HttpTask, public std::enable_shared_from_this<CurlTask> 
   const std::shared_ptr<CurlSession> _session;
   const HttpRequest _request;
   const HttpAddress _address;
-  SteadyTime _deadline;
+  SteadyTime _deadline = SteadyTime::max();
+  // The engine's.
+  Place _place;
   // Self-synchronised.
   std::atomic<bool> _resumed{false};
   std::atomic<bool> _completed{false};

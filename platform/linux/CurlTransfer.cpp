@@ -9,9 +9,9 @@
 #include <cerrno>
 #include <cstring>
 #include <limits>
+#include <system_error>
 
 #include "foundation/Text.h"
-#include "platform/linux/RouteMonitor.h"
 
 namespace velk {
 namespace {
@@ -21,11 +21,16 @@ constexpr std::size_t kMaximumHeaders = 512;
 constexpr long kConnectionAgeSeconds = 60;
 constexpr curl_off_t kProgressStep = 1024 * 1024;
 constexpr int kBackgroundServiceType = 3;
+/// No callback takes this many bytes: the library ends the transfer.
+constexpr std::size_t kEndTransfer = std::numeric_limits<std::size_t>::max();
 /// The class of traffic that gives way to all other (RFC 8622's predecessor, CS1).
 constexpr int kBackgroundTypeOfService = 0x20;
 
-long remainingMilliseconds(SteadyTime deadline, SteadyTime now) {
-  const auto left = std::chrono::ceil<std::chrono::milliseconds>(deadline - now).count();
+/// So much of an answer that is discarded is read, which keeps its connection for the next request.
+constexpr std::size_t kMaximumDiscardedBytes = 64 * 1024;
+
+long milliseconds(Duration duration) {
+  const auto left = std::chrono::ceil<std::chrono::milliseconds>(duration).count();
   return static_cast<long>(std::clamp<std::int64_t>(left, 1, std::numeric_limits<int>::max()));
 }
 
@@ -45,6 +50,9 @@ bool isFraming(std::string_view name) {
   return equalsIgnoringCase(name, "Content-Length") || equalsIgnoringCase(name, "Transfer-Encoding") ||
          equalsIgnoringCase(name, "Expect");
 }
+
+/// The system has no more to give; a family of addresses that it does not know is another matter.
+bool isScarcity(int error) { return error == EMFILE || error == ENFILE || error == ENOMEM || error == ENOBUFS; }
 
 std::string_view trimmed(std::string_view text) {
   constexpr std::string_view kBlanks = " \t\r\n";
@@ -89,10 +97,11 @@ void CurlTransfer::configureConnection(const HttpTrust& trust, SteadyTime now) {
   // A name server that does not answer must not hold the thread up when its request ends.
   set(CURLOPT_QUICK_EXIT, 1L);
   set(CURLOPT_MAXAGE_CONN, kConnectionAgeSeconds);
-  const long timeout = remainingMilliseconds(_task->deadline(), now);
+  const long timeout = milliseconds(_task->timeLeft(now));
   set(CURLOPT_TIMEOUT_MS, timeout);
   set(CURLOPT_CONNECTTIMEOUT_MS, timeout);
-  set(CURLOPT_MAXFILESIZE_LARGE, static_cast<curl_off_t>(_task->maximumResponseBytes()));
+  if (!request.discardsResponseBody)
+    set(CURLOPT_MAXFILESIZE_LARGE, static_cast<curl_off_t>(_task->maximumResponseBytes()));
 }
 
 void CurlTransfer::configureCallbacks() {
@@ -102,6 +111,8 @@ void CurlTransfer::configureCallbacks() {
   set(CURLOPT_HEADERDATA, static_cast<void*>(this));
   set(CURLOPT_WRITEFUNCTION, &CurlTransfer::onData);
   set(CURLOPT_WRITEDATA, static_cast<void*>(this));
+  set(CURLOPT_OPENSOCKETFUNCTION, &CurlTransfer::onOpenSocket);
+  set(CURLOPT_OPENSOCKETDATA, static_cast<void*>(this));
   if (_task->configuration().networkServiceType == kBackgroundServiceType) {
     set(CURLOPT_SOCKOPTFUNCTION, &CurlTransfer::onSocket);
     set(CURLOPT_FRESH_CONNECT, 1L);
@@ -194,6 +205,10 @@ void CurlTransfer::headEnded() {
 }
 
 std::size_t CurlTransfer::dataReceived(std::span<const std::uint8_t> data) {
+  if (_task->request().discardsResponseBody) {
+    _bodyBytes += data.size();
+    return _bodyBytes <= kMaximumDiscardedBytes ? data.size() : kEndTransfer;
+  }
   if (_bodyBytes + data.size() > _task->maximumResponseBytes()) {
     return refuse(CURLE_FILESIZE_EXCEEDED, "the answer is longer than allowed");
   }
@@ -202,10 +217,9 @@ std::size_t CurlTransfer::dataReceived(std::span<const std::uint8_t> data) {
   return data.size();
 }
 
-// No callback takes this many bytes: the library ends the transfer.
 std::size_t CurlTransfer::refuse(CURLcode code, const char* why) {
   _refusal = Error{kHttpErrorDomain, code, _task->address().host + ": " + why};
-  return std::numeric_limits<std::size_t>::max();
+  return kEndTransfer;
 }
 
 std::size_t CurlTransfer::onRead(char* buffer, std::size_t size, std::size_t count, void* self) {
@@ -234,6 +248,12 @@ int CurlTransfer::onProgress(void* self, curl_off_t, curl_off_t, curl_off_t toSe
   return 0;
 }
 
+curl_socket_t CurlTransfer::onOpenSocket(void* self, curlsocktype, curl_sockaddr* address) {
+  const int socket = ::socket(address->family, address->socktype | SOCK_CLOEXEC, address->protocol);
+  if (socket < 0 && isScarcity(errno)) static_cast<CurlTransfer*>(self)->_socketError = errno;
+  return socket < 0 ? CURL_SOCKET_BAD : socket;
+}
+
 // Best effort: a system that refuses sends with the usual class.
 int CurlTransfer::onSocket(void*, curl_socket_t socket, curlsocktype) {
   const int service = kBackgroundTypeOfService;
@@ -242,21 +262,34 @@ int CurlTransfer::onSocket(void*, curl_socket_t socket, curlsocktype) {
   return CURL_SOCKOPT_OK;
 }
 
+// Of an answer that is discarded nothing matters behind the status.
 std::optional<Error> CurlTransfer::error(CURLcode code) const {
   if (_refusal) return _refusal;
-  if (code == CURLE_OK) return std::nullopt;
-  const char* cause = _errorText[0] != '\0' ? _errorText : curl_easy_strerror(code);
-  return Error{kHttpErrorDomain, code, _task->address().host + ": " + cause};
+  if (code == CURLE_OK || (_announced && _task->request().discardsResponseBody)) return std::nullopt;
+  std::string text = _task->address().host + ": " + (_errorText[0] != '\0' ? _errorText : curl_easy_strerror(code));
+  if (_socketError != 0 && code == CURLE_COULDNT_CONNECT)
+    text += ": no socket: " + std::generic_category().message(_socketError);
+  return Error{kHttpErrorDomain, code, std::move(text)};
 }
 
-bool CurlTransfer::failedForLackOfNetwork(CURLcode code) const {
-  if (_announced || _task->address().isLoopback()) return false;
-  if (code == CURLE_COULDNT_RESOLVE_HOST || code == CURLE_COULDNT_RESOLVE_PROXY) return !defaultRoutes().any();
-  if (code != CURLE_COULDNT_CONNECT) return false;
+CurlTransfer::LacksRoute CurlTransfer::lacksRoute(CURLcode code) const {
+  if (_announced || _socketError != 0 || _task->address().isLoopback()) return LacksRoute::no;
+  if (code == CURLE_COULDNT_RESOLVE_HOST || code == CURLE_COULDNT_RESOLVE_PROXY) {
+    return LacksRoute::ifThereIsNoDefaultRoute;
+  }
+  if (code == CURLE_OPERATION_TIMEDOUT) {
+    // No name server answered.
+    curl_off_t nameTime = 0;
+    long sent = 0;
+    curl_easy_getinfo(_easy, CURLINFO_NAMELOOKUP_TIME_T, &nameTime);
+    curl_easy_getinfo(_easy, CURLINFO_REQUEST_SIZE, &sent);
+    return nameTime == 0 && sent == 0 ? LacksRoute::ifThereIsNoDefaultRoute : LacksRoute::no;
+  }
+  if (code != CURLE_COULDNT_CONNECT) return LacksRoute::no;
   long number = 0;
   curl_easy_getinfo(_easy, CURLINFO_OS_ERRNO, &number);
-  if (number == ENETUNREACH || number == ENETDOWN) return true;
-  return number == EHOSTUNREACH && !defaultRoutes().any();
+  if (number == ENETUNREACH || number == ENETDOWN) return LacksRoute::yes;
+  return number == EHOSTUNREACH ? LacksRoute::ifThereIsNoDefaultRoute : LacksRoute::no;
 }
 
 }  // namespace velk

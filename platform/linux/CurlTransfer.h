@@ -24,8 +24,9 @@ class CurlTransfer {
   [[nodiscard]] const std::shared_ptr<CurlTask>& task() const noexcept { return _task; }
   /// Nothing when the attempt succeeded; else host and cause.
   [[nodiscard]] std::optional<Error> error(CURLcode code) const;
-  /// The network was not there, and the server has not said anything yet.
-  [[nodiscard]] bool failedForLackOfNetwork(CURLcode code) const;
+  /// Whether it failed for want of a route, before the server had said anything.
+  enum class LacksRoute { no, yes, ifThereIsNoDefaultRoute };
+  [[nodiscard]] LacksRoute lacksRoute(CURLcode code) const;
 
  private:
   template <class Value>
@@ -43,6 +44,7 @@ class CurlTransfer {
   static std::size_t onRead(char* buffer, std::size_t size, std::size_t count, void* self);
   static int onSeek(void* self, curl_off_t offset, int origin);
   static int onProgress(void* self, curl_off_t, curl_off_t, curl_off_t toSend, curl_off_t sent);
+  static curl_socket_t onOpenSocket(void* self, curlsocktype purpose, curl_sockaddr* address);
   static int onSocket(void* self, curl_socket_t socket, curlsocktype purpose);
 
   std::size_t headerReceived(std::string_view line);
@@ -61,6 +63,8 @@ class CurlTransfer {
   std::size_t _bodyBytes = 0;
   curl_off_t _bodyFileOffset = 0;
   curl_off_t _reportedSent = 0;
+  /// The errno of a socket that the system had none left for, or 0.
+  int _socketError = 0;
   /// Why we ended it ourselves.
   std::optional<Error> _refusal;
 };

@@ -87,17 +87,28 @@ bool readDump(int socket, BestRoute& best) {
   }
 }
 
-std::optional<std::string> defaultRoute(unsigned char family) {
+/// Nothing when the kernel was not asked or did not answer: errno says why.
+std::optional<BestRoute> bestRoute(unsigned char family) {
   const auto socket = openNetlink(0, 0);
   BestRoute best;
   const timeval patience{1, 0};
   if (!socket || ::setsockopt(socket.get(), SOL_SOCKET, SO_RCVTIMEO, &patience, sizeof patience) != 0 ||
       !sendDumpRequest(socket.get(), family) || !readDump(socket.get(), best)) {
-    return "";
+    return std::nullopt;
   }
-  if (!best.found) return std::nullopt;
-  char name[IF_NAMESIZE];
-  return best.interface != 0 && ::if_indextoname(best.interface, name) != nullptr ? std::string(name) : std::string();
+  return best;
+}
+
+void look(unsigned char family, std::optional<std::string>& interface, bool& isMobile, int& failure) {
+  errno = EIO;
+  const auto best = bestRoute(family);
+  if (!best) {
+    failure = errno;
+  } else if (best->found) {
+    char name[IF_NAMESIZE];
+    interface = best->interface != 0 && ::if_indextoname(best->interface, name) != nullptr ? name : "";
+    isMobile = isMobileInterface(*interface);
+  }
 }
 
 }  // namespace
@@ -121,7 +132,12 @@ bool RouteMonitor::drain() {
   }
 }
 
-DefaultRoutes defaultRoutes() { return {defaultRoute(AF_INET), defaultRoute(AF_INET6)}; }
+DefaultRoutes defaultRoutes() {
+  DefaultRoutes routes;
+  look(AF_INET, routes.ipv4, routes.isMobile4, routes.failure);
+  look(AF_INET6, routes.ipv6, routes.isMobile6, routes.failure);
+  return routes;
+}
 
 bool isMobileInterface(const std::string& name, const std::string& sysfs) {
   if (name.empty()) return false;

@@ -1,5 +1,5 @@
 // What the kernel's routing tables say about the way out, and when they change (rtnetlink).
-// Used by the HTTP engine on its own thread.
+// The HTTP engine listens on its own thread and asks on that of its RouteLookup.
 #pragma once
 
 #include <optional>
@@ -9,8 +9,8 @@
 
 namespace velk {
 
-/// Hears of changes to links, addresses and routes while it lives. Opened only while somebody waits for a network:
-/// a process that does not wait is not woken by them. One thread.
+/// Hears of changes to links, addresses and routes while it lives. Opened only while there are requests or connections:
+/// an idle process is not woken by them. One thread.
 class RouteMonitor {
  public:
   RouteMonitor();
@@ -30,11 +30,16 @@ struct DefaultRoutes {
   /// the route names no single interface.
   std::optional<std::string> ipv4;
   std::optional<std::string> ipv6;
+  bool isMobile4 = false;
+  bool isMobile6 = false;
+  /// The errno of a question that could not be asked or was not answered, else 0. Such a kernel counts as one that has
+  /// routes.
+  int failure = 0;
 
-  [[nodiscard]] bool any() const noexcept { return ipv4 || ipv6; }
+  [[nodiscard]] bool any() const noexcept { return ipv4 || ipv6 || failure != 0; }
 };
 
-/// Asks the kernel; a few system calls. A kernel that does not answer counts as one that has routes.
+/// Asks the kernel, which may block for two seconds.
 [[nodiscard]] DefaultRoutes defaultRoutes();
 
 /// A mobile modem, by what the kernel's device model says of the interface.

@@ -78,6 +78,12 @@ void FakeHttpTask::becomeDownloadTask() {
   });
 }
 
+void FakeHttpTask::waitForConnectivity() {
+  post([](HttpSessionDelegate& delegate, HttpSession& session, HttpTask& task) {
+    delegate.taskIsWaitingForConnectivity(session, task);
+  });
+}
+
 void FakeHttpTask::complete(std::optional<Error> error) {
   post([error = std::move(error)](HttpSessionDelegate& delegate, HttpSession& session, HttpTask& task) {
     delegate.didCompleteWithError(session, task, error);
@@ -138,7 +144,7 @@ Result<std::shared_ptr<HttpTask>> FakeHttpSession::make(HttpRequest request) {
     if (_service._makesNoTasks) return std::shared_ptr<HttpTask>();
   }
   Guard guard(_lock);
-  if (_invalidated) return failure("HttpErrorDomain", -999, "the session has been invalidated");
+  if (_invalidated) return failure(kHttpErrorDomain, kHttpSessionInvalidatedCode, "the session has been invalidated");
   auto task = std::make_shared<FakeHttpTask>(shared_from_this(), std::move(request));
   _tasks.push_back(task);
   ++_running;

@@ -47,6 +47,7 @@ class FakeHttpTask : public HttpTask, public std::enable_shared_from_this<FakeHt
   void deliverData(std::string_view data);
   void reportBodyDataSent(std::int64_t sent, std::int64_t expected);
   void becomeDownloadTask();
+  void waitForConnectivity();
   /// The last event of a task: later ones are ignored.
   void complete(std::optional<Error> error = std::nullopt);
 

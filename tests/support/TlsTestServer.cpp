@@ -1,6 +1,7 @@
 #include "tests/support/TlsTestServer.h"
 
 #include <arpa/inet.h>
+#include <netinet/in.h>
 #include <openssl/pem.h>
 #include <openssl/ssl.h>
 #include <openssl/x509v3.h>
@@ -63,7 +64,7 @@ Certificate makeCertificate(const char* name, EVP_PKEY* key, X509* issuer, EVP_P
     addExtension(certificate.get(), signer, NID_basic_constraints, "critical,CA:TRUE");
     addExtension(certificate.get(), signer, NID_key_usage, "critical,keyCertSign,cRLSign");
   } else {
-    addExtension(certificate.get(), signer, NID_subject_alt_name, "DNS:localhost,IP:127.0.0.1,IP:::1");
+    addExtension(certificate.get(), signer, NID_subject_alt_name, "DNS:localhost,IP:127.0.0.1,IP:::1,IP:192.0.2.1");
   }
   require(X509_sign(certificate.get(), issuerKey, EVP_sha256()) > 0, "signing");
   return certificate;
@@ -167,7 +168,7 @@ const std::string* TlsTestServer::Request::header(std::string_view name) const {
 
 class TlsTestServer::Implementation {
  public:
-  Implementation(bool encrypted, bool listens) {
+  Implementation(bool encrypted, bool listens, std::string at) : address(std::move(at)) {
     if (encrypted) makeContext();
     bind();
     if (listens) startListening();
@@ -198,6 +199,7 @@ class TlsTestServer::Implementation {
 
   [[nodiscard]] bool isEncrypted() const { return _context != nullptr; }
 
+  const std::string address;
   int port = 0;
   std::string caFile;
   mutable Lock lock;
@@ -220,14 +222,16 @@ class TlsTestServer::Implementation {
 
   void bind() {
     _listener = FileDescriptor(::socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0));
-    sockaddr_in address{};
-    address.sin_family = AF_INET;
-    address.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
-    socklen_t size = sizeof address;
-    auto* generic = reinterpret_cast<sockaddr*>(&address);
+    sockaddr_in name{};
+    name.sin_family = AF_INET;
+    ::inet_pton(AF_INET, address.c_str(), &name.sin_addr);
+    socklen_t size = sizeof name;
+    auto* generic = reinterpret_cast<sockaddr*>(&name);
+    const int allowed = 1;
+    ::setsockopt(_listener.get(), IPPROTO_IP, IP_FREEBIND, &allowed, sizeof allowed);
     require(::bind(_listener.get(), generic, size) == 0, "taking a port");
     ::getsockname(_listener.get(), generic, &size);
-    port = ntohs(address.sin_port);
+    port = ntohs(name.sin_port);
   }
 
   void acceptConnections() {
@@ -302,8 +306,8 @@ class TlsTestServer::Implementation {
   bool _stopping VELK_GUARDED_BY(lock) = false;
 };
 
-TlsTestServer::TlsTestServer(bool encrypted, bool listens)
-    : _implementation(std::make_unique<Implementation>(encrypted, listens)) {}
+TlsTestServer::TlsTestServer(bool encrypted, bool listens, std::string address)
+    : _implementation(std::make_unique<Implementation>(encrypted, listens, std::move(address))) {}
 TlsTestServer::~TlsTestServer() = default;
 
 void TlsTestServer::startListening() { _implementation->startListening(); }
@@ -312,7 +316,7 @@ int TlsTestServer::port() const { return _implementation->port; }
 
 std::string TlsTestServer::url(std::string_view path) const {
   std::string url = _implementation->isEncrypted() ? "https" : "http";
-  url.append("://127.0.0.1:").append(std::to_string(port())).append(path);
+  url.append("://").append(_implementation->address).append(":").append(std::to_string(port())).append(path);
   return url;
 }
 

@@ -47,9 +47,12 @@ class TlsTestServer {
   /// Runs on the connection's thread; may block for a while.
   using Handler = std::function<Response(const Request&)>;
 
+  /// Where a server in a network namespace of its own may listen: no loopback address, and the certificate names it.
+  static constexpr const char* kOtherAddress = "192.0.2.1";
+
   /// Answers 200 without a body until a handler is set. `encrypted` false: plain http. `listens` false: connections are
-  /// refused until `startListening`, while the port is the server's already.
-  explicit TlsTestServer(bool encrypted = true, bool listens = true);
+  /// refused until `startListening`, while the port is the server's already. `address` need not be there yet.
+  explicit TlsTestServer(bool encrypted = true, bool listens = true, std::string address = "127.0.0.1");
   ~TlsTestServer();
   TlsTestServer(const TlsTestServer&) = delete;
   TlsTestServer& operator=(const TlsTestServer&) = delete;
@@ -57,7 +60,7 @@ class TlsTestServer {
   void startListening();
 
   [[nodiscard]] int port() const;
-  /// "https://127.0.0.1:PORT" and the path, which begins with a slash. The certificate also names "localhost".
+  /// "https://ADDRESS:PORT" and the path, which begins with a slash. The certificate also names "localhost".
   [[nodiscard]] std::string url(std::string_view path = "/") const;
   /// A PEM file with the CA that signed the certificate, for SSL_CERT_FILE and the like. Removed with the server.
   [[nodiscard]] const std::string& caFile() const;

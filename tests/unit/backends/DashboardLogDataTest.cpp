@@ -167,22 +167,14 @@ TEST_F(DashboardLogDataTest, LogsNoAnswerThatIsNoAddress) {
   server->body = std::string(100'000, 'x');
   EXPECT_TRUE(upload());
   EXPECT_LT(log.lines().back().text.size(), 2200U);
-<<<<<<< HEAD
   server->body.assign(3000, 'x').append("\xFF");
-=======
-  server->body = std::string(3000, 'x').append("\xFF");
->>>>>>> uploads
   EXPECT_TRUE(upload());
   EXPECT_EQ(log.lines().back().text, "DashboardBackend(uploadLogData): Log data uploaded to ");
 }
 
 TEST_F(DashboardLogDataTest, CutsALongAnswerBehindAWholeCharacter) {
   start();
-<<<<<<< HEAD
   server->body.assign(2047, 'x').append("\xC3\xA9 and more");
-=======
-  server->body = std::string(2047, 'x').append("\xC3\xA9 and more");
->>>>>>> uploads
   EXPECT_TRUE(upload());
   EXPECT_EQ(log.lines().back().text, "DashboardBackend(uploadLogData): Log data uploaded to " + std::string(2047, 'x'));
 }

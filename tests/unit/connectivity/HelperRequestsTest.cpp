@@ -97,14 +97,29 @@ TEST_F(HelperRequestsTest, APostInAModeForPullsIsAnErrorWithoutCompletion) {
   EXPECT_EQ(loggedError("postURLRequestWithCompletionHandler: wrong mode for POST operation detected %d", {8}), 1);
 }
 
-TEST_F(HelperRequestsTest, APostWhoseTaskCannotBeMadeIsDroppedWithALine) {
+TEST_F(HelperRequestsTest, APostOnASessionThatWasInvalidatedIsDroppedWithALine) {
   const auto helper = makeActive(4);
-  http.failTaskCreation(Error{"d", 1, "gone"});
+  http.failTaskCreation(Error{kHttpErrorDomain, kHttpSessionInvalidatedCode, "gone"});
   Answer answer;
   helper->postURLRequestWithCompletionHandler(request(), answer.completion());
   scheduler().runUntilIdle();
   EXPECT_EQ(answer.abandoned, 1);
   EXPECT_EQ(loggedError(texts::kPostSessionInvalidated, {"gone"}), 1);
+}
+
+TEST_F(HelperRequestsTest, APostToAnAddressThatCannotBeUsedFailsWithTheTransportsError) {
+  const auto helper = makeActive(4);
+  http.failTaskCreation(Error{kHttpErrorDomain, 3, "host: the address is malformed"});
+  log.clear();
+  Answer answer;
+  helper->postURLRequestWithCompletionHandler(request(), answer.completion());
+  scheduler().runUntilIdle();
+  EXPECT_EQ(answer.calls, 1);
+  EXPECT_EQ(answer.abandoned, 0);
+  ASSERT_TRUE(answer.error);
+  EXPECT_EQ(answer.error->description, "host: the address is malformed");
+  EXPECT_EQ(answer.response, nullptr);
+  EXPECT_FALSE(log.contains("invalidated"));
 }
 
 TEST_F(HelperRequestsTest, AFileBackedPostSendsTheFileAndRemovesIt) {

@@ -200,6 +200,36 @@ TEST_F(HttpHostileServerTest, ALongAnswerEndsTheTask) {
   EXPECT_EQ(outcome.error->code, 63);
 }
 
+// The event behind the post has arrived: the rest of the answer is of no use.
+TEST_F(HttpHostileServerTest, AnAnswerThatIsDiscardedEndsWithItsStatusHoweverItGoesOn) {
+  HttpSessionConfiguration configuration;
+  configuration.maximumResponseBytes = 1000;
+  makeSession(configuration);
+  auto post = request();
+  post.method = "POST";
+  post.discardsResponseBody = true;
+  post.timeout = 2s;
+  PlainListener endless([](PlainListener& self, int socket) {
+    self.repeat(socket, "HTTP/1.1 503 No\r\n\r\n" + std::string(100'000, 'x'), 0s);
+  });
+  auto plain = post;
+  plain.url = endless.url();
+  plain.requiresHttps = false;
+  EXPECT_FALSE(fetch(plain).error);
+  EXPECT_EQ(_delegate->outcomes["task"].response->statusCode, 503);
+  for (const auto& answer :
+       {TlsTestServer::Response{.body = std::string(8'000'000, 'x')}, TlsTestServer::Response{.body = "short"},
+        TlsTestServer::Response{.raw = "HTTP/1.1 200 OK\r\nContent-Length: 100\r\n\r\nonly this"}}) {
+    _server.setResponse(answer);
+    const auto& outcome = fetch(post);
+    EXPECT_FALSE(outcome.error) << outcome.error->description;
+    EXPECT_EQ(outcome.response->statusCode, 200);
+    EXPECT_EQ(outcome.body, "") << "nothing of it is copied";
+  }
+  _server.setResponse({.raw = "HTTP/1.1"});
+  EXPECT_TRUE(fetch(post).error) << "without a status nothing has arrived";
+}
+
 TEST_F(HttpHostileServerTest, SurvivesHostileServers) {
   std::string manyHeaders = "HTTP/1.1 200 OK\r\n";
   for (int i = 0; i < 20'000; ++i) manyHeaders += "X-" + std::to_string(i) + ": value\r\n";

@@ -3,15 +3,18 @@
 
 #include <gtest/gtest.h>
 
+#include <algorithm>
 #include <deque>
 #include <functional>
 #include <map>
 #include <string>
+#include <string_view>
 #include <thread>
 #include <vector>
 
 #include "platform/HttpSession.h"
 #include "platform/Lock.h"
+#include "tests/support/RecordingLog.h"
 
 namespace velk {
 
@@ -65,6 +68,13 @@ class PumpedQueue : public Queue {
   std::deque<Task> _tasks VELK_GUARDED_BY(_lock);
 };
 
+/// How many lines of the log hold `part`.
+[[nodiscard]] inline auto linesWith(const test::RecordingLog& log, std::string_view part) {
+  const auto lines = log.lines();
+  return std::count_if(lines.begin(), lines.end(),
+                       [&](const auto& line) { return line.text.find(part) != std::string::npos; });
+}
+
 /// What a session said, in order.
 struct Recorder : HttpSessionDelegate {
   struct Outcome {
@@ -88,6 +98,10 @@ struct Recorder : HttpSessionDelegate {
     toSend = expected;
   }
   void didBecomeDownloadTask(HttpSession&, HttpTask&) override { FAIL(); }
+  void taskIsWaitingForConnectivity(HttpSession&, HttpTask& task) override {
+    note(task, "waits");
+    ++waiting;
+  }
   void didCompleteWithError(HttpSession&, HttpTask& task, const std::optional<Error>& error) override {
     note(task, "completed");
     auto& outcome = outcomes[task.taskDescription()];
@@ -107,6 +121,7 @@ struct Recorder : HttpSessionDelegate {
   std::vector<std::string> events;
   std::map<std::string, Outcome> outcomes;
   int completed = 0;
+  int waiting = 0;
   bool invalid = false;
   std::int64_t sent = 0;
   std::int64_t toSend = 0;
