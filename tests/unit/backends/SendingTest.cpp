@@ -414,6 +414,15 @@ TEST_F(SendingTest, KeepsItsStateOnceEventsHaveLeftInAFlush) {
   EXPECT_EQ(backend->updateState(), kBackendDisabled);
 }
 
+TEST_F(SendingTest, WritesNoStateBackOnceItIsFrozen) {
+  auto backend = makeBatching(openEntry());
+  send(*backend, {{"n", 1}});
+  backend->flushMessagesWithCompletion({});
+  fakes.scheduler.runUntilIdle();
+  EXPECT_EQ(backend->updateState(), kBackendEnabled);
+  EXPECT_EQ(fakes.scheduler.runUntilIdle(), 0U) << "a refusal meanwhile would be undone";
+}
+
 TEST_F(SendingTest, StaysConfigurableAfterAStandaloneEvent) {
   auto backend = makeConfigured(openEntry());
   send(*backend, {{"n", 1}});
