@@ -88,11 +88,12 @@ void ClientSession::sendOneMessageWithSessionInfo(const std::optional<PropertyDi
     return;
   }
   receivedUserInfo(userInfo);
+  waitForRoom();
   const TimeValue now = _services.backends.platform.clock.wallTime();
   const auto message = singleMessage(payload, _services.backends.environment);
   for (const auto& entry : *backends) {
     entry.backend->updateState();
-    entry.backend->setReportingSessionConnectivityDelegate(_connectivityHelper);
+    entry.backend->setReportingSessionConnectivityDelegate(ownHelper());
     if (!passesLists(entry, category)) continue;
     const auto text = entry.backend->sendMessage(message, now, category, type, 0);
     if (!text) continue;

@@ -8,7 +8,18 @@
 
 namespace velk {
 
+void ClientSession::clientHasGone() {
+  _clientHasGone = true;
+  std::shared_ptr<ReportingSessionConnectivityHelper> helper;
+  {
+    Guard guard(_lock);
+    helper = _connectivityHelper;
+  }
+  if (helper) helper->stopWaiting(_sender->number);
+}
+
 void ClientSession::invalidate() {
+  clientHasGone();
   std::shared_ptr<SessionConnection> connection;
   {
     Guard guard(_lock);
@@ -53,9 +64,9 @@ PropertyDictionary ClientSession::makeHealthPayload() {
 }
 
 void ClientSession::returnKeepAlive() {
-  if (_connectivityHelper) {
+  if (ownHelper()) {
     log::standard(session_texts::kIncrementSessionsServed, sessionID());
-    _connectivityHelper->incrementTotalSessionsServedCount();
+    ownHelper()->incrementTotalSessionsServedCount();
     return;
   }
   log::standard(session_texts::kReleaseTransactionWithoutHelper, sessionID());

@@ -106,6 +106,7 @@ class FakeBackend : public VelkReportingBackend {
   [[nodiscard]] const std::optional<PropertyDictionary>& heldUserInfo() const { return _userInfoDict; }
   [[nodiscard]] const std::optional<ByteData>& heldDigestKey() const { return _digestKey; }
   [[nodiscard]] std::int32_t heldDigestAlgorithm() const { return _digestAlgorithm; }
+  [[nodiscard]] PostSender& sender() const { return *_sender; }
   [[nodiscard]] bool nestedDataAllowed() const { return _allowNestedData; }
   using VelkReportingBackend::transport;
   /// Its attributes as one line.
