@@ -130,6 +130,9 @@ class ClientSession final : public ReportingdSession {
   // Uploads (Uploads.cpp).
   void uploadFileWithURL(std::string url, std::string extensionToken, FileDescriptor file, UploadReply reply);
 
+  // Flush (Flush.cpp).
+  void flushBackends(FlushReply reply);
+
   // Teardown (Teardown.cpp).
   [[nodiscard]] PropertyDictionary makeHealthPayload();
   void letGo();
@@ -167,6 +170,8 @@ class ClientSession final : public ReportingdSession {
   std::int32_t _digestAlgorithm = 0;
   std::uint32_t _connectivityHelperReleaseTimeout;
   UploadQueue _uploads;
+  /// Where the texts of flushes are written to the message log, made with the first flush.
+  std::shared_ptr<Queue> _flushLogQueue;
   bool _tornDown = false;
 
   // Self-synchronised.
