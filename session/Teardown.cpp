@@ -31,9 +31,8 @@ void ClientSession::invalidate() {
 void ClientSession::teardown() {
   if (std::exchange(_tornDown, true)) return;
   log::standard(session_texts::kSessionDealloc, sessionID());
-  PropertyDictionary healthPayload = makeHealthPayload();
   if (ownBackends() && ownSessionInfo()) {
-    internalSendMessage(std::move(healthPayload), kInternalCategory, kHealthMessageType);
+    internalSendMessage(makeHealthPayload(), kInternalCategory, kHealthMessageType);
     flushMessagesWithCompletion(FlushReply());
   }
   shutdownSessionAggregation();

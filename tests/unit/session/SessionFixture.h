@@ -147,7 +147,10 @@ class FakeDelegate : public ReportingdSessionDelegate {
   [[nodiscard]] std::optional<PropertyDictionary> sharedDataForSession(ReportingdSession&) override {
     return sharedData;
   }
-  [[nodiscard]] ReportingAgentState copyReportingAgentState() override { return state; }
+  [[nodiscard]] ReportingAgentState copyReportingAgentState() override {
+    ++stateCopies;
+    return state;
+  }
   void releaseIPCTransactions(std::uint32_t count) override;
   [[nodiscard]] std::shared_ptr<ReportingSessionConnectivityHelper> copySharedConnectivityHelperForReportingSession(
       ReportingdSession& session, std::int32_t mode) override;
@@ -169,6 +172,7 @@ class FakeDelegate : public ReportingdSessionDelegate {
   std::shared_ptr<ReportingdSession> parent;
   std::optional<PropertyDictionary> sharedData;
   ReportingAgentState state;
+  int stateCopies = 0;
   bool limitReached = false;
   std::vector<PropertyDictionary> limitQuestions;
 
