@@ -47,13 +47,11 @@ std::vector<PropertyDictionary> EventBatch::take() {
 }
 
 void EventBatch::setSessionID(const std::string& sessionID) {
-  for (auto& event : _events) event.set("_sessionID", sessionID);
-}
-
-std::uint64_t EventBatch::estimatedSize() const {
-  std::uint64_t size = 0;
-  for (const auto& event : _events) size += memoryEstimate(event);
-  return size;
+  for (auto& event : _events) {
+    _bytes -= memoryEstimate(event);
+    event.set("_sessionID", sessionID);
+    _bytes += memoryEstimate(event);
+  }
 }
 
 }  // namespace velk

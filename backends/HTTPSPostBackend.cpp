@@ -113,6 +113,7 @@ std::optional<std::string> HTTPSPostBackend::sendNow(PropertyDictionary event, s
     flushed = flushMessagesWithCompletion({});
   }
   log::standard(backend_texts::kSending, state, _batchEvents, _requireUserInfo);
+  if (isDropped(flag)) return flushed;
   std::vector<PropertyDictionary> events;
   events.push_back(std::move(event));
   auto body = createMessageForPostAndLogging(std::move(events));
@@ -197,6 +198,7 @@ std::vector<PropertyDictionary> HTTPSPostBackend::withoutUnlistedEvents(std::vec
 
 std::optional<std::string> HTTPSPostBackend::postBatch(std::vector<PropertyDictionary> events,
                                                        BackendFlushCompletion completion) {
+  if (!events.empty() && isDropped(0)) return std::nullopt;
   auto body = events.empty() ? std::nullopt : createMessageForPostAndLogging(std::move(events));
   if (!body) {
     completion(std::nullopt, errorObject(backend_texts::kEverythingFiltered, kReportingError));
@@ -249,14 +251,23 @@ bool HTTPSPostBackend::mayLogEvents() const {
   return environment == kEnvironmentDevelopment || environment == kEnvironmentInternal;
 }
 
+const std::optional<std::string>& HTTPSPostBackend::urlFor(std::uint32_t flag) const {
+  return isRealtime(flag) ? _realtimePostURL : _postURL;
+}
+
+bool HTTPSPostBackend::isDropped(std::uint32_t flag) const {
+  if (!urlFor(flag)) return false;
+  const auto poster = transport();
+  return !poster || !poster->takesPosts();
+}
+
 void HTTPSPostBackend::postJSONMessage(std::string json, std::uint32_t flag, std::optional<std::uint16_t> method,
                                        std::optional<std::uint16_t> responseCode, PostCompletion completion) {
-  const auto& url = isRealtime(flag) ? _realtimePostURL : _postURL;
+  const auto& url = urlFor(flag);
   if (!url) {
     completion(errorObject(backend_texts::kPostURLMissing, kReportingError));
     return;
   }
-  if (const auto sender = transport()) sender->waitForRoom(0);
   auto compressed = gzipDeflate(std::string_view(json));
   const bool isCompressed = compressed && !compressed->empty() && compressed->size() < json.size();
   const auto plain = std::make_shared<const std::string>(std::move(json));
@@ -282,9 +293,11 @@ void HTTPSPostBackend::postJSONMessage(std::string json, std::uint32_t flag, std
                                   .digestKey = isDigested ? &*_digestKey : nullptr,
                                   .wifiOnly = _shouldUseWiFiOnly});
   // A transport that has gone, or that drops the request, drops the completion as well: whoever waits learns of it.
-  const auto sender = transport();
-  if (!sender) return;
-  sender->postURLRequestWithCompletionHandler(
+  const auto poster = transport();
+  if (!poster) return;
+  request.sender = _sender->number;
+  _sender->hasPosted = true;
+  poster->postURLRequestWithCompletionHandler(
       std::move(request), [state = _state, name = _name, completion = std::move(completion)](
                               const ByteData&, const std::shared_ptr<const HttpResponse>& response,
                               const std::optional<Error>& error) mutable {

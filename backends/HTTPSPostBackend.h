@@ -108,6 +108,10 @@ class HTTPSPostBackend final : public VelkReportingBackend {
   // Posts.
   [[nodiscard]] std::optional<Body> createMessageForPostAndLogging(std::vector<PropertyDictionary> events);
   [[nodiscard]] bool mayLogEvents() const;
+  [[nodiscard]] const std::optional<std::string>& urlFor(std::uint32_t flag) const;
+  /// True when a post with this flag would end at a transport that has gone or takes none: its events are lost, and
+  /// neither counted nor logged as sent. A missing address is told by the post itself.
+  [[nodiscard]] bool isDropped(std::uint32_t flag) const;
   void postJSONMessage(std::string json, std::uint32_t flag, std::optional<std::uint16_t> method,
                        std::optional<std::uint16_t> responseCode, PostCompletion completion);
 

@@ -86,13 +86,14 @@ HTTPSPostBackend::HTTPSPostBackend(Private, const BackendContext& context, const
 }
 
 std::int32_t HTTPSPostBackend::updateState() {
+  // Nothing is written back: meanwhile a server's refusal may have disabled the backend.
+  if (_immutable) return state();
   const std::int32_t newState = updateBackendState();
   setState(newState);
   return newState;
 }
 
 std::int32_t HTTPSPostBackend::updateBackendState() {
-  if (_immutable) return state();
   const PropertyArray* clients = clientEntries(_profile);
   if (clients == nullptr) return kBackendDisabled;
   const bool hasUserInfo = _userInfoDict && !_userInfoDict->empty();

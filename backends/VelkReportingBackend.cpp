@@ -31,6 +31,14 @@ std::string VelkReportingBackend::convertIntoSHA256(std::string_view text) {
   return hexadecimal(sha256(std::span(bytes, std::min(utf16Length(text), text.size()))));
 }
 
+// The state is written before the transport is read, and `setReportingSessionConnectivityDelegate` goes the other way
+// round: when the two meet on different threads, one of them sees both.
+void VelkReportingBackend::setState(std::int32_t state) {
+  _state.write(state);
+  if (state != kBackendEnabled) return;
+  if (const auto enabled = transport()) enabled->activate();
+}
+
 std::int32_t VelkReportingBackend::updateState() {
   setState(kBackendEnabled);
   return kBackendEnabled;
@@ -79,15 +87,20 @@ std::uint64_t VelkReportingBackend::batchedEventsSize() const { return 0; }
 std::uint64_t VelkReportingBackend::batchedEventsCount() const { return 0; }
 
 void VelkReportingBackend::setReportingSessionConnectivityDelegate(
-    std::weak_ptr<ReportingSessionConnectivityInterface> transport) {
-  Guard guard(_lock);
-  _transport.swap(transport);
+    const std::shared_ptr<ReportingSessionConnectivityInterface>& transport) {
+  {
+    Guard guard(_lock);
+    _transport = transport;
+  }
+  if (transport && state() == kBackendEnabled) transport->activate();
 }
 
 std::shared_ptr<ReportingSessionConnectivityInterface> VelkReportingBackend::transport() const {
   Guard guard(_lock);
   return _transport.lock();
 }
+
+void VelkReportingBackend::setSender(std::shared_ptr<PostSender> sender) { _sender = std::move(sender); }
 
 void VelkReportingBackend::setSelfVersion(std::string_view version) {
   _selfVersion = parseDottedVersion(version);

@@ -65,6 +65,14 @@ struct FileUpload {
   ProcessUploads::User user = 0;  ///< whose upload it is
 };
 
+/// In whose name the backends of one session post. Made by the session; used on its queue alone.
+struct PostSender {
+  /// Unique in the process.
+  std::uint64_t number = 0;
+  /// A post has been handed to the transport since the session last asked it for room.
+  bool hasPosted = false;
+};
+
 class VelkReportingBackend : public std::enable_shared_from_this<VelkReportingBackend> {
  public:
   VelkReportingBackend(const BackendContext& context, std::string name, PropertyValue profile,
@@ -81,7 +89,8 @@ class VelkReportingBackend : public std::enable_shared_from_this<VelkReportingBa
 
   // Any thread. The state is read and written on the state queue: reads wait for it, writes are queued.
   [[nodiscard]] std::int32_t state() const { return _state.read(); }
-  void setState(std::int32_t state) { _state.write(state); }
+  /// A backend that becomes enabled activates its transport: what it posts must not end there.
+  void setState(std::int32_t state);
   /// Reads the configuration again and answers the new state.
   virtual std::int32_t updateState();
 
@@ -110,7 +119,9 @@ class VelkReportingBackend : public std::enable_shared_from_this<VelkReportingBa
   /// How many those are. Any thread; waits for the state queue.
   [[nodiscard]] virtual std::uint64_t batchedEventsCount() const;
 
-  void setReportingSessionConnectivityDelegate(std::weak_ptr<ReportingSessionConnectivityInterface> transport);
+  /// The transport of an enabled backend is activated.
+  void setReportingSessionConnectivityDelegate(const std::shared_ptr<ReportingSessionConnectivityInterface>& transport);
+  void setSender(std::shared_ptr<PostSender> sender);
   /// "major.middle.minor", each cut to 8 bits; what is missing is 0.
   void setSelfVersion(std::string_view version);
   void setStartTimestamp(const TimeValue& timestamp);
@@ -163,6 +174,7 @@ class VelkReportingBackend : public std::enable_shared_from_this<VelkReportingBa
   std::atomic<std::uint16_t> _eventID{0};                   ///< the last event's number
 
   // Used on the owning session's queue only.
+  std::shared_ptr<PostSender> _sender = std::make_shared<PostSender>();
   DottedVersion _selfVersion;
   std::string _reportVersion = _selfVersion.reportVersion();
   double _startTimestamp = 0;  ///< seconds since 1970

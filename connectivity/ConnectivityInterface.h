@@ -21,6 +21,11 @@ using HttpCompletion = Completion<ByteData, std::shared_ptr<const HttpResponse>,
 class ReportingSessionConnectivityInterface {
  public:
   virtual ~ReportingSessionConnectivityInterface() = default;
+  /// Posts are taken from here on. For backends that become enabled: they hand nothing to a transport that sleeps.
+  /// Idempotent, and cheap once it is active. Only posts: may be called under any lock.
+  virtual void activate() {}
+  /// Whether a post would be made now. For backends, before they build one: what is not taken is not counted as sent.
+  [[nodiscard]] virtual bool takesPosts() const { return true; }
   /// Asynchronous; the completion runs on the transport's own queue. Any thread; never blocks.
   virtual void postURLRequestWithCompletionHandler(HttpRequest request, HttpCompletion completion) = 0;
   /// For senders of events, before they build the next request: waits while too many of `sender` are under way. Never

@@ -34,6 +34,13 @@ void ReportingSessionConnectivityHelper::waitForRoom(std::uint64_t sender) { _wi
 
 void ReportingSessionConnectivityHelper::stopWaiting(std::uint64_t sender) { _window->stopWaiting(sender); }
 
+bool ReportingSessionConnectivityHelper::takesPosts() const {
+  if (_service != Service::awake) return false;
+  const bool isForPosts = _mode == POSTRequestMode() || _mode == kBackgroundUploadMode;
+  if (!isForPosts) log::error(texts::kPostWrongMode, _mode);
+  return isForPosts;
+}
+
 void ReportingSessionConnectivityHelper::postURLRequestWithCompletionHandler(HttpRequest request,
                                                                              HttpCompletion completion) {
   // Called or dropped, and by whatever path, it leaves the window once. Bulk has a line of its own and bounds of its

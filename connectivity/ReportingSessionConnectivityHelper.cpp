@@ -74,8 +74,17 @@ void ReportingSessionConnectivityHelper::onStateQueue(Work&& work) {
 }
 
 void ReportingSessionConnectivityHelper::activate(std::uint32_t releaseTimeout) {
+  _service = Service::awake;
   log::standard(texts::kActivating, sessionIdentifier().value_or(texts::kInactiveIdentifier));
   onStateQueue([releaseTimeout](auto& self) { self.activateOnQueue(releaseTimeout); });
+}
+
+void ReportingSessionConnectivityHelper::activate() {
+  // Not one that its owner has let go of: there would be nobody to invalidate it once more.
+  Service asleep = Service::asleep;
+  if (!_service.compare_exchange_strong(asleep, Service::awake)) return;
+  log::standard(texts::kActivating, sessionIdentifier().value_or(texts::kInactiveIdentifier));
+  onStateQueue([](auto& self) { self.activateOnQueue(self._releaseTimeout); });
 }
 
 void ReportingSessionConnectivityHelper::activateOnQueue(std::uint32_t releaseTimeout) {
@@ -117,6 +126,7 @@ HttpSessionConfiguration ReportingSessionConnectivityHelper::privateURLSessionCo
 }
 
 void ReportingSessionConnectivityHelper::invalidate() {
+  _service = Service::ended;
   _window->close();
   onStateQueue([](auto& self) { self.invalidateOnQueue(); });
 }

@@ -63,6 +63,8 @@ class ReportingSessionConnectivityHelper : public ReportingSessionConnectivityIn
 
   /// `releaseTimeout` in seconds; 0: the helper lives for ever.
   void activate(std::uint32_t releaseTimeout);
+  /// With the release timeout that was set last. Does nothing once the helper has been invalidated.
+  void activate() override;
   /// Running tasks end as they would have. Later posts are dropped, later pulls fail.
   void invalidate();
   /// Seconds; counts from the next start of the release timer.
@@ -79,6 +81,8 @@ class ReportingSessionConnectivityHelper : public ReportingSessionConnectivityIn
   /// Gives the keep-alive references back. Takes the agent's lock.
   void releaseAllIPCTransactions();
 
+  /// False before the activation, from the invalidation on, and (with an error line) in a mode for pulls.
+  [[nodiscard]] bool takesPosts() const override;
   /// Dropped, completion uncalled: on an inactive helper, in a mode for pulls, on a session that was invalidated.
   void postURLRequestWithCompletionHandler(HttpRequest request, HttpCompletion completion) override;
   /// Waits while RequestWindow::kMaximumRequests of the sender are under way; not once the helper has been invalidated.
@@ -139,6 +143,9 @@ class ReportingSessionConnectivityHelper : public ReportingSessionConnectivityIn
   void setSessionIdentifier(std::string identifier);
   [[nodiscard]] bool hasDelegate() const { return !_reportingdSessionDelegate.expired(); }
 
+  /// What the helper was asked to be. The state queue follows.
+  enum class Service : std::uint8_t { asleep, awake, ended };
+
   static constexpr SteadyTime kNoTimer{SteadyTime::duration::min()};
 
   // Constant after construction.
@@ -150,7 +157,8 @@ class ReportingSessionConnectivityHelper : public ReportingSessionConnectivityIn
   /// Shared with the completions of requests, which may outlive the helper.
   const std::shared_ptr<RequestWindow> _window = std::make_shared<RequestWindow>();
 
-  // Self-synchronised. All but the served count change on the state queue; `status` reads them from anywhere.
+  // Self-synchronised. All but the first two change on the state queue; `status` reads them from anywhere.
+  std::atomic<Service> _service{Service::asleep};
   std::atomic<std::uint32_t> _totalSessionsServedCount{0};
   std::atomic<std::uint32_t> _usageCount{0};
   std::atomic<bool> _isActive{false};

@@ -21,6 +21,7 @@ class IpcIncomingConnection : public IncomingConnection {
 
   void setInterruptionHandler(Task handler) override { _connection->setInterruptionHandler(std::move(handler)); }
   void setInvalidationHandler(Task handler) override { _connection->setInvalidationHandler(std::move(handler)); }
+  void setDepartureHandler(Task handler) override { _connection->setDepartureHandler(std::move(handler)); }
   void resume() override { _connection->resume(); }
   void invalidate() override { _connection->invalidate(); }
 

@@ -27,6 +27,9 @@ class IncomingConnection : public SessionConnection {
   // Handlers run on the connection's queue, once, and are dropped after the invalidation.
   virtual void setInterruptionHandler(Task handler) = 0;
   virtual void setInvalidationHandler(Task handler) = 0;
+  /// Runs as soon as the peer is known to have gone, whatever it left behind still has to run; at most once, on the
+  /// thread that moves bytes: it only posts.
+  virtual void setDepartureHandler(Task handler) = 0;
   /// Nothing is read before.
   virtual void resume() = 0;
 };

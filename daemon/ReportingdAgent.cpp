@@ -1,5 +1,7 @@
 #include "daemon/ReportingdAgent.h"
 
+#include <algorithm>
+
 #include "daemon/LogTexts.h"
 #include "daemon/StorebagService.h"
 #include "device/DeviceEnvironment.h"
@@ -30,6 +32,7 @@ ReportingdAgent::ReportingdAgent(const Platform& platform, std::shared_ptr<Store
     : _platform(platform),
       _storebagService(std::move(storebagService)),
       _makeSession(std::move(makeSession)),
+      _departures(platform.scheduler.makeSerialQueue("com.tavrin.velkreportingd.departures")),
       _connectivityHelpers(std::make_shared<SharedConnectivityHelpers>(platform)),
       _cachedStorebags(*_storebagService, platform.clock),
       _keepAlive(platform.keepAlive) {}
@@ -60,8 +63,24 @@ bool ReportingdAgent::shouldAcceptNewConnection(const std::shared_ptr<IncomingCo
       [session] { log::standard(daemontexts::kConnectionInterrupted, session->description()); });
   connection->setInvalidationHandler(
       [agent = shared_from_this(), session] { agent->connectionWasInvalidated(session); });
+  connection->setDepartureHandler([weak = weak_from_this(), gone = std::weak_ptr(session), queue = _departures] {
+    queue->async([weak, gone] {
+      const auto agent = weak.lock();
+      const auto itsSession = gone.lock();
+      if (agent && itsSession) agent->clientHasGone(itsSession);
+    });
+  });
   connection->resume();
   return true;
+}
+
+// A client that has gone is not active, however long what it left behind takes to run. A session that has not been
+// counted yet gives its place back when it is.
+void ReportingdAgent::clientHasGone(const std::shared_ptr<ReportingdSession>& session) {
+  session->clientHasGone();
+  Guard guard(_monitor);
+  const bool isListed = std::find(_sessionList.begin(), _sessionList.end(), session) != _sessionList.end();
+  if (isListed) _departed[session.get()] = session->isCounted() && decrementActiveClientsLocked(*session);
 }
 
 // On the connection's queue, behind everything that the peer had sent.
@@ -88,18 +107,21 @@ void ReportingdAgent::invalidateReportingSession(const std::shared_ptr<Reporting
   const auto description = session->description();
   std::erase(_sessionList, session);
   log::standard(daemontexts::kSessionInvalidated, description);
-  decrementActiveClientsLocked(*session);
+  const auto departed = _departed.extract(session.get());
+  const bool isGivenBack = !departed.empty() && departed.mapped();
+  // Whether this session was counted is not asked: one that never was still lowers its type's counter.
+  if (!isGivenBack) decrementActiveClientsLocked(*session);
 }
 
-// Whether this session was counted is not asked: one that never was still lowers its type's counter.
-void ReportingdAgent::decrementActiveClientsLocked(const ReportingdSession& session) {
+bool ReportingdAgent::decrementActiveClientsLocked(const ReportingdSession& session) {
   const auto sessionInfo = session.sessionInfo();
   const auto* value = sessionInfo ? clientTypeIn(*sessionInfo) : nullptr;
-  if (value == nullptr) return;
+  if (value == nullptr) return false;
   const auto clientType = int32Value(value);
   if (const auto count = _activeClients.decrement(clientType)) {
     log::debug(daemontexts::kActiveCountDecremented, clientType, *count);
   }
+  return true;
 }
 
 void ReportingdAgent::invalidateAllSessions() {
@@ -130,6 +152,9 @@ bool ReportingdAgent::isActiveClientLimitReachedForSession(ReportingdSession& se
   // The refused session is counted as well; its invalidation brings the counter down again.
   if (const auto count = _activeClients.increment(clientType)) {
     log::debug(daemontexts::kActiveCountIncremented, clientType, *count);
+  }
+  if (const auto departed = _departed.find(&session); departed != _departed.end()) {
+    departed->second = decrementActiveClientsLocked(session);
   }
   if (limitReached) session.invalidate();
   return limitReached;

@@ -8,7 +8,8 @@
 // this lock.
 //
 // A connection: offered -> refused | accepted (session made, listed) -> counted at its first session info
-//   -> invalidated (out of all tables) -> torn down (on the connection's queue, no lock held)
+//   -> its client gone (no longer active, while what it left behind still runs) -> invalidated (out of all tables) ->
+//   torn down (on the connection's queue, no lock held)
 #pragma once
 
 #include <cstdint>
@@ -16,6 +17,7 @@
 #include <memory>
 #include <optional>
 #include <string>
+#include <unordered_map>
 #include <vector>
 
 #include "connectivity/ConnectivityInterface.h"
@@ -98,13 +100,17 @@ class ReportingdAgent final : public ReportingdSessionDelegate,
                   SessionFactory makeSession);
 
   [[nodiscard]] AgentSnapshot snapshot();
+  void clientHasGone(const std::shared_ptr<ReportingdSession>& session);
   void connectionWasInvalidated(const std::shared_ptr<ReportingdSession>& session);
-  void decrementActiveClientsLocked(const ReportingdSession& session) VELK_REQUIRES(_monitor);
+  /// True when the session names a client type.
+  bool decrementActiveClientsLocked(const ReportingdSession& session) VELK_REQUIRES(_monitor);
 
   // Constant after construction.
   const Platform _platform;
   const std::shared_ptr<StorebagService> _storebagService;
   const SessionFactory _makeSession;
+  /// Takes the lock for the thread that moves bytes, which must not.
+  const std::shared_ptr<Queue> _departures;
 
   // Self-synchronised.
   const std::shared_ptr<SharedConnectivityHelpers> _connectivityHelpers;
@@ -118,6 +124,8 @@ class ReportingdAgent final : public ReportingdSessionDelegate,
   SharedDataTable _sharedData VELK_GUARDED_BY(_monitor);
   KeepAliveCounter _keepAlive VELK_GUARDED_BY(_monitor);
   ActiveClientCounter _activeClients VELK_GUARDED_BY(_monitor);
+  /// Listed sessions whose client has gone; true: its place among the active ones has been given back.
+  std::unordered_map<const ReportingdSession*, bool> _departed VELK_GUARDED_BY(_monitor);
 };
 
 }  // namespace velk

@@ -63,6 +63,8 @@ void Connection::setInterruptionHandler(Task handler) { _core->interruptionHandl
 
 void Connection::setInvalidationHandler(Task handler) { _core->invalidationHandler = std::move(handler); }
 
+void Connection::setDepartureHandler(Task handler) { _core->departureHandler = std::move(handler); }
+
 void Connection::resume() { _core->resume(); }
 
 void Connection::invalidate() { _core->invalidate(); }

@@ -148,6 +148,10 @@ class Connection {
   /// The last that is heard of the connection: it was ended here, or the peer said goodbye. Runs once.
   void setInvalidationHandler(Task handler);
 
+  /// The peer has hung up or said goodbye, or can no longer be understood; frames that it sent before may still have to
+  /// run, and the other two handlers come behind them. Runs at most once, on the loop's thread: it only posts.
+  void setDepartureHandler(Task handler);
+
   /// Keeps what could not be sent for `takeUnsentCalls`. For a connection whose delivery queue is one of its loop's.
   void keepUnsent();
 

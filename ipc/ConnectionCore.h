@@ -46,6 +46,7 @@ class ConnectionCore : public std::enable_shared_from_this<ConnectionCore> {
   std::shared_ptr<CallDispatcher> dispatcher;
   Task interruptionHandler;
   Task invalidationHandler;
+  Task departureHandler;  ///< used on the loop's thread
   /// Set before `resume`: what did not leave is kept for `takeUnsentCalls`.
   bool keepsUnsent = false;
 
@@ -96,6 +97,8 @@ class ConnectionCore : public std::enable_shared_from_this<ConnectionCore> {
   [[nodiscard]] bool receiveOnce();
   [[nodiscard]] bool received(std::span<const std::uint8_t> bytes);
   [[nodiscard]] bool pausesReading();
+  void awaitHangUp();
+  void peerHasGone();
   void readingEnded(End end, const char* reason);
   [[nodiscard]] bool openWatch();
   void awaitWritable();
@@ -159,6 +162,7 @@ class ConnectionCore : public std::enable_shared_from_this<ConnectionCore> {
   Task _whenClosed;
   bool _reading = false;
   bool _readingDone = false;
+  bool _awaitsHangUp = false;
   bool _closed = false;
   /// The shortest that a timer was started for: it closes the socket, whatever is left to send.
   Duration _drainTime = Duration::max();

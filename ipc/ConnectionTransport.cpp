@@ -102,8 +102,19 @@ bool ConnectionCore::pausesReading() {
   if (_unreadBytes.load() < kMaximumUnreadBytes && _unclaimedDescriptors.load() < kMaximumUnclaimedDescriptors) {
     return false;
   }
+  awaitHangUp();
   _readingPaused = true;
   return !(mayResumeReading() && _readingPaused.exchange(false));
+}
+
+/// A socket that is not read does not tell of its end by itself.
+void ConnectionCore::awaitHangUp() {
+  if (!departureHandler || std::exchange(_awaitsHangUp, true)) return;
+  _watch->whenHungUp([self = shared_from_this()] { self->peerHasGone(); });
+}
+
+void ConnectionCore::peerHasGone() {
+  if (auto handler = std::exchange(departureHandler, nullptr)) handler();
 }
 
 void ConnectionCore::readingEnded(End end, const char* reason) {
@@ -111,6 +122,11 @@ void ConnectionCore::readingEnded(End end, const char* reason) {
     Guard guard(_inboxLock);
     _receivedEnd = end;
     _endReason = reason;
+  }
+  if (end == End::here) {
+    departureHandler = nullptr;
+  } else {
+    peerHasGone();
   }
   scheduleDelivery();
 }

@@ -21,6 +21,9 @@ class DescriptorWatch {
   /// At most one of each kind may be outstanding.
   virtual void whenReadable(Task handler) = 0;
   virtual void whenWritable(Task handler) = 0;
+  /// The other end has gone (or the descriptor has failed), although what it sent may not have been read. Only sockets
+  /// tell.
+  virtual void whenHungUp(Task handler) = 0;
 };
 
 /// One thread over the system's readiness interface. All methods may be called from any thread unless they say

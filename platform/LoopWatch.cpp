@@ -47,6 +47,7 @@ class LoopWatchState : public std::enable_shared_from_this<LoopWatchState> {
   void dropHandlers() {
     const Task readable = exchangeHandler(Kind::wait_read, nullptr);
     const Task writable = exchangeHandler(Kind::wait_write, nullptr);
+    const Task hungUp = exchangeHandler(Kind::wait_error, nullptr);
   }
 
   [[nodiscard]] bool forked() const noexcept { return _loop->forked(); }
@@ -54,7 +55,8 @@ class LoopWatchState : public std::enable_shared_from_this<LoopWatchState> {
  private:
   [[nodiscard]] Task exchangeHandler(Kind kind, Task handler) {
     Guard guard(_lock);
-    return std::exchange(kind == Kind::wait_read ? _readable : _writable, std::move(handler));
+    Task& held = kind == Kind::wait_read ? _readable : kind == Kind::wait_write ? _writable : _hungUp;
+    return std::exchange(held, std::move(handler));
   }
 
   const std::shared_ptr<EventLoop::State> _loop;
@@ -63,6 +65,7 @@ class LoopWatchState : public std::enable_shared_from_this<LoopWatchState> {
   Lock _lock;
   Task _readable VELK_GUARDED_BY(_lock);
   Task _writable VELK_GUARDED_BY(_lock);
+  Task _hungUp VELK_GUARDED_BY(_lock);
 };
 
 namespace {
@@ -81,6 +84,7 @@ class LoopWatch final : public DescriptorWatch {
 
   void whenReadable(Task handler) override { _state->wait(LoopWatchState::Kind::wait_read, std::move(handler)); }
   void whenWritable(Task handler) override { _state->wait(LoopWatchState::Kind::wait_write, std::move(handler)); }
+  void whenHungUp(Task handler) override { _state->wait(LoopWatchState::Kind::wait_error, std::move(handler)); }
 
  private:
   std::shared_ptr<LoopWatchState> _state;

@@ -72,6 +72,7 @@ class ClientSession final : public ReportingdSession {
   [[nodiscard]] Result<void> sendToAggregator(const std::optional<PropertyDictionary>& sessionInfo, double timestamp,
                                               std::uint16_t category, std::uint16_t type,
                                               const std::optional<PropertyDictionary>& payload) override;
+  void clientHasGone() override;
   void invalidate() override;
   void teardown() override;
 
@@ -90,6 +91,7 @@ class ClientSession final : public ReportingdSession {
   void readDeviceIdentifier();
   void updateUserInfo(std::optional<PropertyDictionary> userInfo);
   void releaseUserInfo();
+  void storeHelper(std::shared_ptr<ReportingSessionConnectivityHelper> helper);
   void receivedUserInfo(const std::optional<PropertyDictionary>& userInfo);
   void createBackendsWithStorebag(const PropertyDictionary& storebag);
   void publishBackends(std::shared_ptr<const SessionBackends> backends);
@@ -105,6 +107,8 @@ class ClientSession final : public ReportingdSession {
   // Messages (MessagePipeline.cpp).
   /// The single entry of client messages and internal messages. Answers the text for the client.
   std::optional<std::string> sendMessageWithDictionary(const PropertyDictionary& dictionary);
+  /// Back-pressure: the client's next message waits while too many of this session's posts are under way.
+  void waitForRoom();
   [[nodiscard]] PropertyDictionary makeMessageBlob(const PropertyDictionary* payload);
   void internalSendMessage(PropertyDictionary payload, std::uint16_t method, std::uint16_t respCode);
   void sendStartMessage();
@@ -126,6 +130,9 @@ class ClientSession final : public ReportingdSession {
   // Uploads (Uploads.cpp).
   void uploadFileWithURL(std::string url, std::string extensionToken, FileDescriptor file, UploadReply reply);
 
+  // Flush (Flush.cpp).
+  void flushBackends(FlushReply reply);
+
   // Teardown (Teardown.cpp).
   [[nodiscard]] PropertyDictionary makeHealthPayload();
   void letGo();
@@ -143,6 +150,10 @@ class ClientSession final : public ReportingdSession {
   [[nodiscard]] const std::shared_ptr<const SessionBackends>& ownBackends() const VELK_NO_THREAD_SAFETY_ANALYSIS {
     return _backends;
   }
+  [[nodiscard]] const std::shared_ptr<ReportingSessionConnectivityHelper>& ownHelper() const
+      VELK_NO_THREAD_SAFETY_ANALYSIS {
+    return _connectivityHelper;
+  }
 
   // Constant after construction.
   ReportingdSessionDelegate& _delegate;
@@ -150,14 +161,17 @@ class ClientSession final : public ReportingdSession {
   const std::string _sessionIDString;
 
   // Of the connection's queue alone.
+  /// What the backends post carries its number.
+  const std::shared_ptr<PostSender> _sender;
   PropertyArray _frameworks;
   std::string _deviceIdentifier;
   std::optional<std::string> _storebagVersion;
   std::optional<ByteData> _digestKey;
   std::int32_t _digestAlgorithm = 0;
-  std::shared_ptr<ReportingSessionConnectivityHelper> _connectivityHelper;
   std::uint32_t _connectivityHelperReleaseTimeout;
   UploadQueue _uploads;
+  /// Where the texts of flushes are written to the message log, made with the first flush.
+  std::shared_ptr<Queue> _flushLogQueue;
   bool _tornDown = false;
 
   // Self-synchronised.
@@ -165,6 +179,7 @@ class ClientSession final : public ReportingdSession {
   std::atomic<bool> _hasAggregator{false};  // changes under _aggregationLock
   std::atomic<bool> _hasFinishedGracefully{false};
   std::atomic<bool> _counted{false};
+  std::atomic<bool> _clientHasGone{false};
   /// Held where events and the end marker are appended to this session's connection, so that nothing follows the
   /// marker. May be taken with the agent's monitor held; what runs under it waits for nobody.
   Lock _aggregationLock;
@@ -176,6 +191,7 @@ class ClientSession final : public ReportingdSession {
   std::optional<PropertyDictionary> _userInfo VELK_GUARDED_BY(_lock);
   Hierarchy _hierarchy VELK_GUARDED_BY(_lock);
   std::shared_ptr<const SessionBackends> _backends VELK_GUARDED_BY(_lock);
+  std::shared_ptr<ReportingSessionConnectivityHelper> _connectivityHelper VELK_GUARDED_BY(_lock);
 };
 
 }  // namespace velk

@@ -33,7 +33,10 @@ void addSessionsAccumulatedHealthInfoToPayload(PropertyDictionary& payload, cons
                                                const std::vector<std::shared_ptr<ReportingdSession>>& sessionList,
                                                const PropertyDictionary& storebags, const ProcessStatistics& process) {
   std::uint64_t batchedSize = 0;
-  for (const auto& session : sessionList) batchedSize += addSessionHealthInfo(*session, payload);
+  // A connection that was never described is no session: it reads the status, say.
+  for (const auto& session : sessionList) {
+    if (session->sessionInfo()) batchedSize += addSessionHealthInfo(*session, payload);
+  }
   batchedSize += addSessionHealthInfo(endingSession, payload);
   const std::uint64_t storebagsSize = memoryEstimate(storebags);
   payload.set("StorebagsCount", storebags.size());

@@ -1,4 +1,5 @@
 // The path of one event from the client to the backends.
+#include "connectivity/ReportingSessionConnectivityHelper.h"
 #include "device/DeviceEnvironment.h"
 #include "foundation/Format.h"
 #include "ipc/Vocabulary.h"
@@ -38,7 +39,13 @@ std::string orUnknown(std::optional<std::string> answer) { return answer ? std::
 
 void ClientSession::sendMessageWithDictionary(PropertyDictionary dictionary, TextReply reply) {
   log::standard(session_texts::kSendingMessage, sessionID());
+  if (_sender->hasPosted) waitForRoom();
   reply(sendMessageWithDictionary(dictionary));
+}
+
+void ClientSession::waitForRoom() {
+  _sender->hasPosted = false;
+  if (ownHelper() && !_clientHasGone) ownHelper()->waitForRoom(_sender->number);
 }
 
 std::optional<std::string> ClientSession::sendMessageWithDictionary(const PropertyDictionary& dictionary) {

@@ -42,15 +42,15 @@ void ClientSession::sendMessageWithSessionInfo(PropertyDictionary sessionInfo,
                                                std::uint16_t type, std::optional<PropertyDictionary> payload,
                                                TextReply reply) {
   storeSessionInfo(sessionInfo);
-  // Before the identifiers are looked at: a session that was never counted ends here when it names no client type.
-  if (_delegate.isActiveClientLimitReachedForSession(*this, sessionInfo)) {
-    reply(formatText(session_texts::kReplyLimitExceeded, {userInfo}));
-    return;
-  }
+  // Before the limit, which would end a session that names no client type.
   if (!sessionInfo.contains(kVelkReportingSessionInfoClientType) ||
       !sessionInfo.contains(kVelkReportingSessionInfoSessionID)) {
     log::error(session_texts::kNoIdentifiers);
     reply(std::string(session_texts::kReplyNoIdentifiers));
+    return;
+  }
+  if (_delegate.isActiveClientLimitReachedForSession(*this, sessionInfo)) {
+    reply(formatText(session_texts::kReplyLimitExceeded, {userInfo}));
     return;
   }
   _sessionID = uint32Value(sessionInfo.find(kVelkReportingSessionInfoSessionID));
@@ -88,11 +88,12 @@ void ClientSession::sendOneMessageWithSessionInfo(const std::optional<PropertyDi
     return;
   }
   receivedUserInfo(userInfo);
+  waitForRoom();
   const TimeValue now = _services.backends.platform.clock.wallTime();
   const auto message = singleMessage(payload, _services.backends.environment);
   for (const auto& entry : *backends) {
     entry.backend->updateState();
-    entry.backend->setReportingSessionConnectivityDelegate(_connectivityHelper);
+    entry.backend->setReportingSessionConnectivityDelegate(ownHelper());
     if (!passesLists(entry, category)) continue;
     const auto text = entry.backend->sendMessage(message, now, category, type, 0);
     if (!text) continue;

@@ -51,9 +51,7 @@ bool ClientSession::updateReportingStates() {
 }
 
 void ClientSession::updateSessionWithDefaultSessionInfo() {
-  if (updateReportingStates() && _connectivityHelper) {
-    _connectivityHelper->activate(_connectivityHelperReleaseTimeout);
-  }
+  if (updateReportingStates() && ownHelper()) ownHelper()->activate(_connectivityHelperReleaseTimeout);
   _delegate.updateDownstreamSessions(*this);
 }
 

@@ -18,11 +18,21 @@ std::shared_ptr<ReportingdSession> ReportingdSession::initWithSessionDelegate(
   return std::make_shared<ClientSession>(delegate, std::move(connection), services);
 }
 
+namespace {
+
+std::shared_ptr<PostSender> newSender() {
+  static std::atomic<std::uint64_t> last{0};
+  return std::make_shared<PostSender>(PostSender{.number = ++last});
+}
+
+}  // namespace
+
 ClientSession::ClientSession(ReportingdSessionDelegate& delegate, std::shared_ptr<SessionConnection> connection,
                              const SessionServices& services)
     : _delegate(delegate),
       _services(services),
       _sessionIDString(base64Encoded(randomUuid())),
+      _sender(newSender()),
       _connectivityHelperReleaseTimeout(kDefaultReleaseTimeout),
       _uploads(services.backends.platform.scheduler, services.backends.uploads, connection->user()),
       _connection(std::move(connection)) {

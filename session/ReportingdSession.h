@@ -60,6 +60,8 @@ class ReportingdSession : public ClientSessionInterface, public std::enable_shar
                                                       const std::optional<PropertyDictionary>& /*payload*/) {
     return {};
   }
+  /// The peer has hung up. What it sent before still runs, and waits for no room in the transport. Waits for nothing.
+  virtual void clientHasGone() {}
   /// Ends the connection. Only posts: may be called under the agent's lock.
   virtual void invalidate() = 0;
   /// The end: health message, flush, keep-alive, clean-up. Exactly once, on the connection's queue, after the agent

@@ -102,6 +102,11 @@ void ClientSession::storeUserInfo(std::optional<PropertyDictionary> userInfo) {
   _userInfo.swap(userInfo);
 }
 
+void ClientSession::storeHelper(std::shared_ptr<ReportingSessionConnectivityHelper> helper) {
+  Guard guard(_lock);
+  _connectivityHelper.swap(helper);
+}
+
 void ClientSession::readDeviceIdentifier() {
   std::array<char, kDeviceIdentifierSize> buffer{};
   _services.backends.environment.uniqueDeviceIdentifier(buffer);
@@ -114,19 +119,19 @@ void ClientSession::releaseUserInfo() {
   // The agent finds the helper by the user info that is still stored.
   if (ownUserInfo()) _delegate.releaseSharedConnectivityHelperForReportingSession(*this);
   storeUserInfo(std::nullopt);
-  _connectivityHelper.reset();
+  storeHelper(nullptr);
 }
 
 void ClientSession::updateUserInfo(std::optional<PropertyDictionary> userInfo) {
   releaseUserInfo();
   storeUserInfo(std::move(userInfo));
   if (!hasValidUserInfoKeys()) return;
-  _connectivityHelper = _delegate.copySharedConnectivityHelperForReportingSession(
-      *this, ReportingSessionConnectivityHelper::POSTRequestMode());
-  if (!_connectivityHelper) return;
-  _connectivityHelper->setReleaseTimeout(_connectivityHelperReleaseTimeout);
+  storeHelper(_delegate.copySharedConnectivityHelperForReportingSession(
+      *this, ReportingSessionConnectivityHelper::POSTRequestMode()));
+  if (!ownHelper()) return;
+  ownHelper()->setReleaseTimeout(_connectivityHelperReleaseTimeout);
   if (!ownBackends()) return;
-  for (const auto& entry : *ownBackends()) entry.backend->setReportingSessionConnectivityDelegate(_connectivityHelper);
+  for (const auto& entry : *ownBackends()) entry.backend->setReportingSessionConnectivityDelegate(ownHelper());
 }
 
 void ClientSession::receivedUserInfo(const std::optional<PropertyDictionary>& userInfo) {
@@ -149,14 +154,19 @@ void ClientSession::createBackendsWithStorebag(const PropertyDictionary& storeba
   log::standard(session_texts::kCreatingBackends, sessionID());
   const PropertyValue* releaseTimeout = storebag.find(kReleaseTimeoutKey);
   _connectivityHelperReleaseTimeout = releaseTimeout != nullptr ? uint32Value(releaseTimeout) : kDefaultReleaseTimeout;
+  // For backends that become enabled later, on whatever thread.
+  if (ownHelper()) ownHelper()->setReleaseTimeout(_connectivityHelperReleaseTimeout);
   const auto& info = ownSessionInfo();
   auto backends = createBackends(&storebag, info ? &*info : nullptr, ownUserInfo(), _deviceIdentifier, _services);
   if (backends) {
     for (const auto& entry : *backends) {
-      entry.backend->setReportingSessionConnectivityDelegate(_connectivityHelper);
+      entry.backend->setSender(_sender);
+      entry.backend->setReportingSessionConnectivityDelegate(ownHelper());
       entry.backend->setCorrelatedSessionID(_sessionIDString);
     }
   }
+  // What the old ones have batched would go with them.
+  if (ownBackends() && !ownBackends()->empty()) flushBackends(FlushReply());
   publishBackends(std::move(backends));
 }
 

@@ -8,7 +8,18 @@
 
 namespace velk {
 
+void ClientSession::clientHasGone() {
+  _clientHasGone = true;
+  std::shared_ptr<ReportingSessionConnectivityHelper> helper;
+  {
+    Guard guard(_lock);
+    helper = _connectivityHelper;
+  }
+  if (helper) helper->stopWaiting(_sender->number);
+}
+
 void ClientSession::invalidate() {
+  clientHasGone();
   std::shared_ptr<SessionConnection> connection;
   {
     Guard guard(_lock);
@@ -20,9 +31,8 @@ void ClientSession::invalidate() {
 void ClientSession::teardown() {
   if (std::exchange(_tornDown, true)) return;
   log::standard(session_texts::kSessionDealloc, sessionID());
-  PropertyDictionary healthPayload = makeHealthPayload();
   if (ownBackends() && ownSessionInfo()) {
-    internalSendMessage(std::move(healthPayload), kInternalCategory, kHealthMessageType);
+    internalSendMessage(makeHealthPayload(), kInternalCategory, kHealthMessageType);
     flushMessagesWithCompletion(FlushReply());
   }
   shutdownSessionAggregation();
@@ -53,9 +63,9 @@ PropertyDictionary ClientSession::makeHealthPayload() {
 }
 
 void ClientSession::returnKeepAlive() {
-  if (_connectivityHelper) {
+  if (ownHelper()) {
     log::standard(session_texts::kIncrementSessionsServed, sessionID());
-    _connectivityHelper->incrementTotalSessionsServedCount();
+    ownHelper()->incrementTotalSessionsServedCount();
     return;
   }
   log::standard(session_texts::kReleaseTransactionWithoutHelper, sessionID());

@@ -1,6 +1,7 @@
 // A transport that remembers what it is asked to post, and answers when the test says so.
 #pragma once
 
+#include <atomic>
 #include <cstddef>
 #include <vector>
 
@@ -16,6 +17,9 @@ class FakeTransport : public ReportingSessionConnectivityInterface {
   ~FakeTransport() override;
 
   void postURLRequestWithCompletionHandler(HttpRequest request, HttpCompletion completion) override;
+  void activate() override { ++activations; }
+  void waitForRoom(std::uint64_t) override { ++waits; }
+  [[nodiscard]] bool takesPosts() const override { return isActive; }
 
   /// How many requests came so far.
   [[nodiscard]] std::size_t count() const;
@@ -27,6 +31,10 @@ class FakeTransport : public ReportingSessionConnectivityInterface {
   void fail(std::size_t number, Error error);
   /// Drops a request as a transport without session does: its completion is destroyed uncalled.
   void drop(std::size_t number);
+
+  std::atomic<int> activations{0};
+  std::atomic<int> waits{0};
+  std::atomic<bool> isActive{true};
 
  private:
   struct Post {

@@ -76,7 +76,7 @@ TEST_F(AnswerTest, AbandonsAFlushWithoutTransport) {
   auto backend = makeBatching(openEntry());
   sendMany(*backend, 1);
   transport.reset();
-  EXPECT_TRUE(backend->flushMessagesWithCompletion(outcome.completion()));
+  EXPECT_FALSE(backend->flushMessagesWithCompletion(outcome.completion()));
   EXPECT_TRUE(outcome.abandoned);
   EXPECT_EQ(outcome.calls, 0);
 }

@@ -136,5 +136,18 @@ TEST(EventBatch, EstimatesItsSize) {
   EXPECT_EQ(batch.count(), 2U);
 }
 
+TEST(EventBatch, EstimatesItsSizeWithTheSessionIDThatWasSetLast) {
+  EventBatch batch;
+  const PropertyDictionary event{{"a", "some text"}, {"_sessionID", "short"}};
+  batch.append(event);
+  batch.append({{"b", 1}});
+  const std::string longer(200, 'x');
+  batch.setSessionID(longer);
+  EXPECT_EQ(batch.estimatedSize(), memoryEstimate({{"a", "some text"}, {"_sessionID", longer}}) +
+                                       memoryEstimate({{"b", 1}, {"_sessionID", longer}}));
+  batch.discard();
+  EXPECT_EQ(batch.estimatedSize(), 0U);
+}
+
 }  // namespace
 }  // namespace velk::test

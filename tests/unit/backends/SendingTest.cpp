@@ -276,6 +276,23 @@ TEST_F(SendingTest, IsWokenByAFlagAndBatchesTheEventThatWokeIt) {
   }
 }
 
+TEST_F(SendingTest, ActivatesItsTransportWhenItIsWoken) {
+  auto backend = makeConfigured(waitingEntry());
+  EXPECT_EQ(transport->activations, 0);
+  send(*backend, {{"n", 1}}, 7, 3, 2);
+  EXPECT_EQ(transport->activations, 1);
+}
+
+TEST_F(SendingTest, ActivatesTheTransportThatItIsGivenOnlyWhenItIsEnabled) {
+  auto enabled = makeConfigured(openEntry());
+  auto waiting = makeConfigured(waitingEntry());
+  const auto another = std::make_shared<FakeTransport>();
+  waiting->setReportingSessionConnectivityDelegate(another);
+  EXPECT_EQ(another->activations, 0);
+  enabled->setReportingSessionConnectivityDelegate(another);
+  EXPECT_EQ(another->activations, 1);
+}
+
 TEST_F(SendingTest, BatchesUntilUserInfoHasCome) {
   auto backend = makeConfigured(openEntry());
   backend->setUserInfoDict(std::nullopt);
@@ -389,6 +406,52 @@ TEST_F(SendingTest, PostsNothingWithoutAddress) {
   EXPECT_EQ(transport->count(), 0U);
 }
 
+TEST_F(SendingTest, PostsThatTheTransportWouldDropAreNeitherCountedNorCalledSent) {
+  isInternal = true;
+  auto single = makeConfigured(openEntry());
+  auto batching = makeBatching(openEntry());
+  transport->isActive = false;
+  EXPECT_EQ(send(*single, {{"n", 1}}), std::nullopt);
+  sendMany(*batching, 1);
+  EXPECT_EQ(send(*batching, {{"n", 2}}, 7, 3, 1), std::nullopt) << "neither the batch nor the realtime event";
+  EXPECT_EQ(batching->batchedEventsCount(), 0U);
+  sendMany(*batching, 1);
+  FlushOutcome outcome;
+  EXPECT_EQ(batching->flushMessagesWithCompletion(outcome.completion()), std::nullopt);
+  EXPECT_TRUE(outcome.abandoned);
+  EXPECT_EQ(transport->count(), 0U);
+
+  transport->isActive = true;
+  for (const auto& backend : {single, batching}) {
+    send(*backend, {{"n", 3}}, 7, 3, 4);
+    backend->flushMessagesWithCompletion({});
+    EXPECT_EQ(integerValue(eventsOf(lastRequest()).back().find("_bytesSentSinceLastReport")), 0);
+  }
+}
+
+TEST_F(SendingTest, PostsCarryTheNumberOfTheirSessionAndNeverWait) {
+  const auto sender = std::make_shared<PostSender>(PostSender{.number = 77});
+  auto backend = makeBatching(openEntry());
+  backend->setSender(sender);
+  sendMany(*backend, 1);
+  EXPECT_FALSE(sender->hasPosted);
+  send(*backend, {{"n", 2}}, 7, 3, 1);
+  EXPECT_TRUE(sender->hasPosted);
+  ASSERT_EQ(transport->count(), 2U);
+  EXPECT_EQ(transport->request(0).sender, 77U);
+  EXPECT_EQ(transport->request(1).sender, 77U);
+  EXPECT_EQ(transport->waits, 0);
+}
+
+TEST_F(SendingTest, DroppedFlushLeavesTheConfigurationOpen) {
+  auto backend = makeBatching(openEntry());
+  sendMany(*backend, 1);
+  transport->isActive = false;
+  backend->flushMessagesWithCompletion({});
+  backend->setState(kBackendWaiting);
+  EXPECT_EQ(backend->updateState(), kBackendEnabled);
+}
+
 TEST_F(SendingTest, LogsPrettyTextOnlyWhereAllowed) {
   const auto textWith = [this](bool overridden) {
     auto backend = makeConfigured(overridden ? with(openEntry(), "override_dnu", 1) : openEntry());
@@ -412,6 +475,15 @@ TEST_F(SendingTest, KeepsItsStateOnceEventsHaveLeftInAFlush) {
   EXPECT_EQ(backend->updateState(), kBackendWaiting);
   transport->answer(0, 503);
   EXPECT_EQ(backend->updateState(), kBackendDisabled);
+}
+
+TEST_F(SendingTest, WritesNoStateBackOnceItIsFrozen) {
+  auto backend = makeBatching(openEntry());
+  send(*backend, {{"n", 1}});
+  backend->flushMessagesWithCompletion({});
+  fakes.scheduler.runUntilIdle();
+  EXPECT_EQ(backend->updateState(), kBackendEnabled);
+  EXPECT_EQ(fakes.scheduler.runUntilIdle(), 0U) << "a refusal meanwhile would be undone";
 }
 
 TEST_F(SendingTest, StaysConfigurableAfterAStandaloneEvent) {

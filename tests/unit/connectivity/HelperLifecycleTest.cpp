@@ -122,6 +122,25 @@ TEST_F(ConnectivityHelperTest, ATransportThatIsActiveAgainKeepsTransactionsUntil
   EXPECT_EQ(owner->released, (std::vector<std::uint32_t>{0, 1}));
 }
 
+TEST_F(ConnectivityHelperTest, ABackendActivatesItWithTheTimeoutThatWasSetLast) {
+  const auto helper = make(Helper::POSTRequestMode());
+  helper->setReleaseTimeout(5);
+  helper->activate();
+  helper->activate();
+  scheduler().runUntilIdle();
+  EXPECT_TRUE(booleanValue(helper->status().find("active")));
+  EXPECT_EQ(integerValue(helper->status().find("releaseTimeout")), 5);
+  EXPECT_EQ(http.sessions().size(), 1U);
+}
+
+TEST_F(ConnectivityHelperTest, ABackendDoesNotActivateWhatItsOwnerHasLetGoOf) {
+  const auto helper = make(Helper::POSTRequestMode());
+  helper->invalidate();
+  helper->activate();
+  scheduler().runUntilIdle();
+  EXPECT_FALSE(booleanValue(helper->status().find("active")));
+}
+
 TEST_F(ConnectivityHelperTest, ItsSessionKeepsItAliveUntilItIsInvalid) {
   auto helper = makeActive(4);
   const std::weak_ptr<Helper> weak = helper;

@@ -2,6 +2,7 @@
 #pragma once
 
 #include <memory>
+#include <thread>
 #include <vector>
 
 #include "daemon/ReportingdAgent.h"
@@ -37,6 +38,17 @@ class AgentFixture : public StorebagFixture {
     session->info = PropertyDictionary{{kVelkReportingSessionInfoClientType, clientType}};
     limitReached = agent->isActiveClientLimitReachedForSession(*session, *session->info);
     return session;
+  }
+  /// Returns when every departure that has been heard of has been dealt with: they go in order, and this one shows.
+  void settleDepartures() {
+    constexpr std::int32_t kTypeOfNobodyElse = 29;
+    const auto last = connect();
+    const auto session = made.back();
+    session->info = PropertyDictionary{{kVelkReportingSessionInfoClientType, kTypeOfNobodyElse}};
+    static_cast<void>(agent->isActiveClientLimitReachedForSession(*session, *session->info));
+    last->depart();
+    while (activeClients(kTypeOfNobodyElse) != 0) std::this_thread::yield();
+    last->end();
   }
   [[nodiscard]] std::size_t sessionCount() { return agent->copyReportingAgentState().sessions.size(); }
   [[nodiscard]] std::int64_t keepAliveCount() { return integerValue(agent->copyStatus().find("keepAliveCount")); }

@@ -22,6 +22,7 @@ class FakeIncomingConnection : public IncomingConnection {
   }
   void setInterruptionHandler(Task handler) override { _interruption = std::move(handler); }
   void setInvalidationHandler(Task handler) override { _invalidation = std::move(handler); }
+  void setDepartureHandler(Task handler) override { _departure = std::move(handler); }
   void resume() override { resumed = true; }
   void invalidate() override { invalidated = true; }
   Result<void> sendMessageToClient(const std::optional<PropertyDictionary>&, double, std::uint16_t, std::uint16_t,
@@ -32,6 +33,10 @@ class FakeIncomingConnection : public IncomingConnection {
   std::uint32_t user() const override { return 1000; }
 
   void interrupt() { _interruption(); }
+  /// The peer has gone; what it sent may still have to run.
+  void depart() {
+    if (auto handler = std::exchange(_departure, nullptr)) handler();
+  }
   /// What the IPC layer does at the end: the handler runs once, then everything is let go.
   void end() {
     if (auto handler = std::exchange(_invalidation, nullptr)) handler();
@@ -48,6 +53,7 @@ class FakeIncomingConnection : public IncomingConnection {
   const std::set<std::string, std::less<>> _entitlements;
   Task _interruption;
   Task _invalidation;
+  Task _departure;
 };
 
 }  // namespace velk::test

@@ -73,6 +73,7 @@ class FakeReportingdSession : public ReportingdSession {
   void updateCombinedSessionID() override { calls.push_back("updateCombinedSessionID"); }
   void syncReportingStates() override { calls.push_back("syncReportingStates"); }
   void shutdownSessionAggregation() override { calls.push_back("shutdownSessionAggregation"); }
+  void clientHasGone() override { ++departures; }
   void invalidate() override {
     ++invalidations;
     if (connection) connection->invalidate();
@@ -93,6 +94,7 @@ class FakeReportingdSession : public ReportingdSession {
   std::vector<std::string> calls;
   std::atomic<int> invalidations{0};
   std::atomic<int> teardowns{0};
+  std::atomic<int> departures{0};
 };
 
 }  // namespace velk::test

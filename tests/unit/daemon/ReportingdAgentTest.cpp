@@ -163,6 +163,66 @@ TEST_F(ReportingdAgentTest, LowersTheNewTypesCounterWhenACountedSessionChangedIt
   EXPECT_EQ(activeClients(10), 0);
 }
 
+TEST_F(ReportingdAgentTest, GivesThePlaceOfAClientThatHasGoneBackAtOnceAndOnce) {
+  bool limitReached = false;
+  configured(9, limitReached);
+  const auto connection = connect();
+  const auto session = made.back();
+  session->info = PropertyDictionary{{kVelkReportingSessionInfoClientType, 9}};
+  agent->isActiveClientLimitReachedForSession(*session, *session->info);
+  EXPECT_EQ(activeClients(9), 2);
+  connection->depart();
+  settleDepartures();
+  EXPECT_EQ(activeClients(9), 1);
+  EXPECT_EQ(session->departures, 1);
+  EXPECT_EQ(session->invalidations, 0) << "what it left behind still runs";
+  // It may have been described again in between.
+  EXPECT_FALSE(agent->isActiveClientLimitReachedForSession(*session, *session->info));
+  connection->end();
+  EXPECT_EQ(activeClients(9), 1);
+}
+
+TEST_F(ReportingdAgentTest, ClientThatHasGoneBeforeItsSessionInfoRanIsNotCountedForEver) {
+  bool limitReached = false;
+  configured(9, limitReached);
+  const auto connection = connect();
+  const auto session = made.back();
+  connection->depart();
+  settleDepartures();
+  session->info = PropertyDictionary{{kVelkReportingSessionInfoClientType, 9}};
+  EXPECT_FALSE(agent->isActiveClientLimitReachedForSession(*session, *session->info));
+  EXPECT_EQ(activeClients(9), 1);
+  connection->end();
+  EXPECT_EQ(activeClients(9), 1);
+}
+
+TEST_F(ReportingdAgentTest, SixthSessionIsRefusedAlthoughItsClientHasGone) {
+  bool limitReached = false;
+  for (int number = 0; number < 5; ++number) configured(9, limitReached);
+  const auto connection = connect();
+  const auto sixth = made.back();
+  connection->depart();
+  settleDepartures();
+  sixth->info = PropertyDictionary{{kVelkReportingSessionInfoClientType, 9}};
+  EXPECT_TRUE(agent->isActiveClientLimitReachedForSession(*sixth, *sixth->info));
+  EXPECT_EQ(activeClients(9), 5);
+  connection->end();
+  EXPECT_EQ(activeClients(9), 5);
+}
+
+TEST_F(ReportingdAgentTest, DepartureThatIsHeardOfAfterTheEndChangesNothing) {
+  bool limitReached = false;
+  configured(9, limitReached);
+  const auto connection = connect();
+  const auto session = made.back();
+  session->info = PropertyDictionary{{kVelkReportingSessionInfoClientType, 9}};
+  agent->isActiveClientLimitReachedForSession(*session, *session->info);
+  connection->depart();
+  connection->end();
+  settleDepartures();
+  EXPECT_EQ(activeClients(9), 1);
+}
+
 TEST_F(ReportingdAgentTest, DropsTheSharedDataWithTheLastSessionOfAHierarchy) {
   const auto root = create();
   const auto child = create();

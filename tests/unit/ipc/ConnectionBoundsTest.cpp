@@ -64,6 +64,21 @@ TEST_F(ConnectionBoundsTest, StopsReadingUntilTheQueueCatchesUp) {
   rest.join();
 }
 
+TEST_F(ConnectionBoundsTest, TellsOfAHangUpAlthoughTooMuchWaitsToBeRead) {
+  makeOpen();
+  std::vector<std::uint8_t> stream;
+  while (stream.size() < ipc::kMaximumUnreadBytes + 64 * 1024) {
+    const auto call = callBytes(kMethod, 0, {std::string(10'000, 'x')});
+    stream.insert(stream.end(), call.begin(), call.end());
+  }
+  peer->send(stream);
+  peer->hangUp();
+  EXPECT_TRUE(departed.wait());
+  EXPECT_TRUE(events.empty());
+  runUntil("invalidated");
+  EXPECT_GT(events.size(), 50U);
+}
+
 TEST_F(ConnectionBoundsTest, ServesNoCallsToAPeerThatDoesNotReadItsReplies) {
   makeOpen();
   dispatch = [](IncomingCall& call) {

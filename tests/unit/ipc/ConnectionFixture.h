@@ -30,6 +30,7 @@ class ConnectionTest : public testing::Test {
     connection = Connection::adopt(std::move(ends->first), self(), accepted, loop, queue, [this] { closed.happen(); });
     connection->setInterruptionHandler([this] { events.push_back("interrupted"); });
     connection->setInvalidationHandler([this] { events.push_back("invalidated"); });
+    connection->setDepartureHandler([this] { departed.happen(); });
     connection->setExportedDispatcher(std::make_shared<FunctionDispatcher>([this](IncomingCall& call) {
       events.push_back("call " + std::to_string(call.method));
       return dispatch ? dispatch(call) : Result<void>();
@@ -62,6 +63,7 @@ class ConnectionTest : public testing::Test {
   EventLoop loop{"test-io"};
   std::shared_ptr<HandQueue> queue = std::make_shared<HandQueue>();
   Event closed;
+  Event departed;
   std::vector<std::string> events;
   std::function<Result<void>(IncomingCall&)> dispatch;
   std::optional<RawPeer> peer;

@@ -196,6 +196,20 @@ TEST_F(ConnectionTest, ShowsAGoodbyeAsInvalidated) {
   EXPECT_EQ(connection->end(), End::goodbye);
 }
 
+TEST_F(ConnectionTest, TellsOfThePeersDepartureBeforeWhatItLeftBehindHasRun) {
+  for (const bool saysGoodbye : {true, false}) {
+    events.clear();
+    makeOpen();
+    peer->send(callBytes(kMethod, 0, {}));
+    if (saysGoodbye) peer->send(frameBytes(FrameKind::goodbye, 0, {}));
+    if (!saysGoodbye) peer->hangUp();
+    EXPECT_TRUE(departed.wait());
+    EXPECT_TRUE(events.empty());
+    runUntil("invalidated");
+    EXPECT_EQ(events.front(), "call 2");
+  }
+}
+
 TEST_F(ConnectionTest, ShowsABareEndOfFileToAClientAsInterruptedUntilItInvalidates) {
   makeOpen(false);
   peer->hangUp();

@@ -41,6 +41,45 @@ TEST_F(ConcurrencyTest, OthersReadWhileOneShotsReplaceTheBackends) {
   EXPECT_EQ(session->backends(), nullptr);
 }
 
+TEST_F(ConcurrencyTest, OnlyMessagesOfItsClientWaitForRoom) {
+  start({"splunk"}, {}, userNamed("a", "b"));
+  fakes.scheduler.runUntilIdle();
+  const auto helper = delegate.helper("a:b");
+  auto& sender = backend("splunk").sender();
+  EXPECT_NE(sender.number, 0U);
+  for (std::size_t count = 0; count < RequestWindow::kMaximumRequests; ++count) {
+    HttpRequest request;
+    request.sender = sender.number;
+    helper->postURLRequestWithCompletionHandler(std::move(request), {});
+  }
+  sender.hasPosted = true;
+  // None of these would return if it waited: nothing is ever answered.
+  describe({}, userNamed("a", "b"));
+  configure();
+  fetchStates(userNamed("a", "b"));
+  session->flushMessagesWithCompletion({});
+  session->finishSessionGracefully();
+  session->teardown();
+  EXPECT_EQ(backend("splunk").sent.size(), 1U) << "the health message";
+  helper->invalidate();
+}
+
+TEST_F(ConcurrencyTest, ClientThatHasGoneWaitsForNoRoom) {
+  start({"splunk"}, {}, userNamed("a", "b"));
+  fakes.scheduler.runUntilIdle();
+  const auto helper = delegate.helper("a:b");
+  auto& sender = backend("splunk").sender();
+  for (std::size_t count = 0; count < RequestWindow::kMaximumRequests; ++count) {
+    HttpRequest request;
+    request.sender = sender.number;
+    helper->postURLRequestWithCompletionHandler(std::move(request), {});
+  }
+  session->clientHasGone();
+  sender.hasPosted = true;
+  send(message(1, 2));
+  EXPECT_EQ(backend("splunk").sent.size(), 1U);
+}
+
 TEST_F(ConcurrencyTest, SessionMayBeEndedFromAnyThread) {
   start({"splunk"}, {}, std::nullopt, true);
   std::thread agent([this] { session->invalidate(); });

@@ -226,6 +226,25 @@ TEST_F(ConfigurationTest, HelperStaysInactiveWithoutAnEnabledBackend) {
   EXPECT_FALSE(booleanValue(delegate.helper("a:b")->status().find("active")));
 }
 
+TEST_F(ConfigurationTest, SessionDescribedAgainWithAnotherUserActivatesTheNewHelper) {
+  start({"splunk"}, {}, userNamed("a", "b"));
+  describe({}, userNamed("c", "d"));
+  fakes.scheduler.runUntilIdle();
+  EXPECT_TRUE(booleanValue(delegate.helper("c:d")->status().find("active")));
+}
+
+TEST_F(ConfigurationTest, HelperActivatedLaterIsReleasedAfterTheStorebagsTimeout) {
+  prepareBackend = [](FakeBackend& each) { each.nextState = kBackendWaiting; };
+  delegate.storebag = PropertyDictionary{{"release_timeout", 5}, {"splunk", PropertyDictionary()}};
+  describe({}, userNamed("a", "b"));
+  configure();
+  backend("splunk").setState(kBackendEnabled);
+  fakes.scheduler.runUntilIdle();
+  const auto status = delegate.helper("a:b")->status();
+  EXPECT_TRUE(booleanValue(status.find("active")));
+  EXPECT_EQ(integerValue(status.find("releaseTimeout")), 5);
+}
+
 class ReleaseTimeoutTest : public SessionTest {
  protected:
   /// How long the helper that the user info "c:d" got after the configuration outlives the session.

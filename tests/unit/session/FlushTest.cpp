@@ -14,6 +14,7 @@ class FlushTest : public SessionTest {
     auto completion = std::move(backend(name).flushes.back());
     backend(name).flushes.clear();
     completion(std::move(text), std::move(error));
+    fakes.scheduler.runUntilIdle();
   }
   static Error refusal() { return Error{std::string(kVelkReportingErrorDomain), 503, "refused"}; }
 
@@ -84,6 +85,35 @@ TEST_F(FlushTest, ErrorStillAnswersAfterADroppedCompletion) {
   EXPECT_EQ(answer.dropped, 0);
 }
 
+TEST_F(FlushTest, TextIsWrittenOnAQueueOfItsOwnAndBeforeTheAnswer) {
+  start({"splunk"});
+  flush();
+  auto completion = std::move(backend("splunk").flushes.back());
+  completion("text", std::nullopt);
+  EXPECT_TRUE(messageLog.journal.entries().empty()) << "the transport's queue is kept waiting for the disk";
+  EXPECT_EQ(answer.calls, 0);
+  session->teardown();
+  session.reset();
+  fakes.scheduler.runUntilIdle();
+  EXPECT_EQ(messageLog.journal.count("[splunk -> flushMessages] text"), 1);
+  EXPECT_EQ(answer.text, "text");
+}
+
+TEST_F(FlushTest, ResultWithoutTextAnswersAtOnceUnlessOthersAreBeingWritten) {
+  start({"splunk", "korrin"});
+  flush();
+  FlushAnswer second;
+  session->flushMessagesWithCompletion(recordInto(second));
+  for (auto* name : {"splunk", "korrin"}) backend(name).flushes[0](std::nullopt, std::nullopt);
+  EXPECT_EQ(answer.calls, 1);
+  backend("splunk").flushes[1]("text", std::nullopt);
+  backend("korrin").flushes[1](std::nullopt, std::nullopt);
+  EXPECT_EQ(second.calls, 0);
+  fakes.scheduler.runUntilIdle();
+  EXPECT_EQ(second.calls, 1);
+  EXPECT_FALSE(second.text.has_value());
+}
+
 TEST_F(FlushTest, FlushesDoNotAnswerEachOther) {
   start({"splunk"});
   FlushAnswer second;
@@ -91,9 +121,11 @@ TEST_F(FlushTest, FlushesDoNotAnswerEachOther) {
   auto first = std::move(backend("splunk").flushes[0]);
   session->flushMessagesWithCompletion(recordInto(second));
   backend("splunk").flushes[1]("second", std::nullopt);
+  fakes.scheduler.runUntilIdle();
   EXPECT_EQ(answer.calls, 0);
   EXPECT_EQ(second.text, "second");
   first("first", std::nullopt);
+  fakes.scheduler.runUntilIdle();
   EXPECT_EQ(answer.text, "first");
 }
 
@@ -122,6 +154,7 @@ TEST_F(FlushTest, AnswersOnceWhenBackendsFinishTogether) {
       });
     }
     for (auto& finisher : finishers) finisher.join();
+    fakes.scheduler.runUntilIdle();
     EXPECT_EQ(answer.calls, 1);
   }
 }

@@ -1,3 +1,5 @@
+#include <algorithm>
+
 #include "tests/unit/session/SessionFixture.h"
 
 namespace velk::test {
@@ -31,13 +33,44 @@ TEST_F(OneShotTest, SendsToEveryBackendOfItsStorebag) {
   EXPECT_EQ(recordedLog.count("receivedUserInfo: Received new user info for session 7"), 1);
 }
 
-TEST_F(OneShotTest, LimitIsAskedBeforeTheIdentifiers) {
+TEST_F(OneShotTest, SampledInAfterOneSampledOutActivatesTheHelper) {
+  serveBackends({"splunk"});
+  prepareBackend = [](FakeBackend& each) { each.nextState = kBackendDisabled; };
+  sendOnce(info, user, payload);
+  fakes.scheduler.runUntilIdle();
+  ASSERT_FALSE(booleanValue(delegate.helper("a:b")->status().find("active")));
+  prepareBackend = nullptr;
+  sendOnce(info, user, payload);
+  fakes.scheduler.runUntilIdle();
+  EXPECT_TRUE(booleanValue(delegate.helper("a:b")->status().find("active")));
+}
+
+TEST_F(OneShotTest, IdentifiersAreLookedAtBeforeTheLimit) {
   delegate.limitReached = true;
-  EXPECT_EQ(sendOnce(PropertyDictionary(), PropertyDictionary{{"n", 1}}, payload),
-            "Exceeded maximum active reporting session limit for userInfo='{\"n\":1}'");
+  EXPECT_EQ(sendOnce(PropertyDictionary(), PropertyDictionary{{"n", 1}}, payload), kReplyNoIdentifiers);
   EXPECT_EQ(session->sessionInfo(), PropertyDictionary());
-  EXPECT_FALSE(recordedLog.contains("Could not retrieve identifiers"));
+  EXPECT_TRUE(delegate.limitQuestions.empty());
+  EXPECT_EQ(connection->invalidations, 0);
+  EXPECT_EQ(sendOnce(info, PropertyDictionary{{"n", 1}}, payload),
+            "Exceeded maximum active reporting session limit for userInfo='{\"n\":1}'");
+  EXPECT_EQ(session->sessionInfo(), info);
   EXPECT_EQ(connection->invalidations, 1);
+}
+
+TEST_F(OneShotTest, BackendsThatAreReplacedPostWhatTheyHaveBatched) {
+  serveBackends({"splunk"});
+  sendOnce(info, user, payload);
+  auto old = made.back();
+  journal.clear();
+  sendOnce(info, user, payload);
+  const auto entries = journal.entries();
+  const auto flushed = std::find(entries.begin(), entries.end(), "flush splunk");
+  ASSERT_NE(flushed, entries.end());
+  EXPECT_NE(std::find(flushed, entries.end(), "cleanup splunk"), entries.end());
+  ASSERT_EQ(old->flushes.size(), 1U);
+  old->flushes[0]("text", std::nullopt);
+  fakes.scheduler.runUntilIdle();
+  EXPECT_EQ(messageLog.journal.count("[splunk -> flushMessages] text"), 1);
 }
 
 TEST_F(OneShotTest, NeedsClientTypeAndNumber) {

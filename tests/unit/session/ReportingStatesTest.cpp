@@ -130,6 +130,17 @@ TEST_F(RelativesTest, ChildTakesStateAndThresholdOfItsParent) {
       1);
 }
 
+TEST_F(RelativesTest, BackendThatTheParentEnablesActivatesTheTransport) {
+  startParent({"splunk"});
+  prepareBackend = [](FakeBackend& each) { each.nextState = kBackendDisabled; };
+  start({"splunk"}, childOf(1), userNamed("child", "of"));
+  fakes.scheduler.runUntilIdle();
+  ASSERT_FALSE(booleanValue(delegate.helper("child:of")->status().find("active")));
+  session->syncReportingStates();
+  fakes.scheduler.runUntilIdle();
+  EXPECT_TRUE(booleanValue(delegate.helper("child:of")->status().find("active")));
+}
+
 TEST_F(RelativesTest, AbsentThresholdOfTheParentIsTakenToo) {
   startParent({"splunk"});
   start({"splunk"}, childOf(1));

@@ -107,6 +107,7 @@ class FakeBackend : public VelkReportingBackend {
   [[nodiscard]] const std::optional<PropertyDictionary>& heldUserInfo() const { return _userInfoDict; }
   [[nodiscard]] const std::optional<ByteData>& heldDigestKey() const { return _digestKey; }
   [[nodiscard]] std::int32_t heldDigestAlgorithm() const { return _digestAlgorithm; }
+  [[nodiscard]] PostSender& sender() const { return *_sender; }
   [[nodiscard]] bool nestedDataAllowed() const { return _allowNestedData; }
   using VelkReportingBackend::transport;
   /// Its attributes as one line.
@@ -148,7 +149,10 @@ class FakeDelegate : public ReportingdSessionDelegate {
   [[nodiscard]] std::optional<PropertyDictionary> sharedDataForSession(ReportingdSession&) override {
     return sharedData;
   }
-  [[nodiscard]] ReportingAgentState copyReportingAgentState() override { return state; }
+  [[nodiscard]] ReportingAgentState copyReportingAgentState() override {
+    ++stateCopies;
+    return state;
+  }
   void releaseIPCTransactions(std::uint32_t count) override;
   [[nodiscard]] std::shared_ptr<ReportingSessionConnectivityHelper> copySharedConnectivityHelperForReportingSession(
       ReportingdSession& session, std::int32_t mode) override;
@@ -170,6 +174,7 @@ class FakeDelegate : public ReportingdSessionDelegate {
   std::shared_ptr<ReportingdSession> parent;
   std::optional<PropertyDictionary> sharedData;
   ReportingAgentState state;
+  int stateCopies = 0;
   bool limitReached = false;
   std::vector<PropertyDictionary> limitQuestions;
 

@@ -81,6 +81,23 @@ TEST_F(TeardownTest, CountsTheLiveSessionsAndTheEndingOneInAddition) {
   EXPECT_EQ(number(report, "ProcessMemoryUsage"), 4096);
 }
 
+TEST_F(TeardownTest, LeavesOutConnectionsThatWereNeverDescribed) {
+  start({"splunk"});
+  delegate.state.sessions = {session, makeSession(std::make_shared<FakeConnection>())};
+  session->teardown();
+  const auto report = health();
+  EXPECT_EQ(number(report, key("SessionsCount", 8)), 2);
+  EXPECT_FALSE(report.contains("SessionsCount_Unknown"));
+}
+
+TEST_F(TeardownTest, MakesNoHealthMessageThatIsNotSent) {
+  session->teardown();
+  session = makeSession(connection);
+  describe();
+  session->teardown();
+  EXPECT_EQ(delegate.stateCopies, 0);
+}
+
 TEST_F(TeardownTest, SumsTheBackendsOfASession) {
   start({"splunk", "korrin"});
   backend("splunk").batchedSize = 3;
