@@ -1,13 +1,16 @@
 #include "daemon/DaemonProcess.h"
 
-#include <atomic>
+#include <algorithm>
+#include <cstdint>
 #include <vector>
 
+#include "daemon/CoalescedTask.h"
 #include "daemon/FrameworkVersion.h"
 #include "daemon/IdleWatch.h"
 #include "daemon/IncomingConnection.h"
 #include "daemon/MessageLogFile.h"
 #include "daemon/ReportingdAgent.h"
+#include "daemon/StopDeadline.h"
 #include "daemon/StorebagService.h"
 #include "daemon/WorkingDirectories.h"
 #include "device/DeviceEnvironment.h"
@@ -33,13 +36,18 @@ namespace velk {
 namespace {
 
 constexpr Duration kActivatedIdleLimit = std::chrono::seconds(30);
-// How long the end of the process waits for sessions to say goodbye, and then for the network to take their last posts.
-constexpr Duration kTeardownTime = std::chrono::seconds(5);
-constexpr Duration kDeliveryTime = std::chrono::seconds(10);
+// The end of the process, from its beginning: until when it waits for decisions about connections, for sessions to say
+// goodbye, for the network to take their last posts, for calls of the diagnostics adaptor, and for reads of clients'
+// files. Whoever comes later has what the earlier ones left; the posts have two seconds at the least.
+constexpr Duration kDecisionsUntil = std::chrono::milliseconds(500);
+constexpr Duration kTeardownsUntil = std::chrono::milliseconds(1500);
+constexpr Duration kDeliveriesUntil = std::chrono::milliseconds(3800);
+constexpr Duration kAdaptorUntil = std::chrono::milliseconds(4100);
+constexpr Duration kFilesUntil = std::chrono::milliseconds(4400);
+// Then the process ends, whatever its threads do.
+constexpr Duration kEndUntil = std::chrono::milliseconds(4700);
 // How long uploads may take of that: nothing is lost with them, since their files stay with the clients.
-constexpr Duration kUploadTime = std::chrono::seconds(2);
-// How long calls of the diagnostics adaptor, and reads of clients' files, may then still take.
-constexpr Duration kAdaptorTime = std::chrono::seconds(2);
+constexpr Duration kUploadTime = std::chrono::seconds(1);
 // How far beyond its usual bound the pool may grow while everybody waits for the agent's lock: more than the
 // connections that a few users may have.
 constexpr std::size_t kEmergencyThreads = 3584;
@@ -72,12 +80,20 @@ ThreadPoolOptions storebagPoolOptions() {
   return options;
 }
 
+std::int64_t milliseconds(Duration duration) { return duration / std::chrono::milliseconds(1); }
+
 std::string storebagDirectory(const Directories& directories) { return directories.cache + "/storebags"; }
 
 std::string textSetting(const UserDefaults& defaults, std::string_view key) {
   const auto value = defaults.value(key);
   const auto* text = value ? value->string() : nullptr;
   return text != nullptr ? *text : std::string();
+}
+
+LoadedEntitlements loadEntitlements(const std::string& configurationDirectory) {
+  auto loaded = EntitlementRules::load(configurationDirectory);
+  for (const auto& problem : loaded.unreadable) log::error("Entitlements: %@", problem);
+  return loaded;
 }
 
 std::unique_ptr<PowerLog> makePowerLog(const UserDefaults& defaults) {
@@ -92,21 +108,34 @@ struct DaemonProcess::Parts {
   Parts(const DaemonOptions& options, process::RunLoop& loop, bool activated);
 
   [[nodiscard]] bool hasEntitlement(std::string_view name, const Connection& connection);
+  [[nodiscard]] std::shared_ptr<const EntitlementRules> currentEntitlements();
   [[nodiscard]] bool isOccupied() const {
-    return listener && (listener->openConnections() > 0 || listener->hasWaitingConnection());
+    return std::any_of(listeners.begin(), listeners.end(), [](const auto& listener) {
+      return listener->openConnections() > 0 || listener->hasWaitingConnection();
+    });
   }
   [[nodiscard]] Listener::Options listenerOptions();
+  /// On every socket of the service manager, or on one of our own.
+  [[nodiscard]] Result<void> listen(std::vector<FileDescriptor> sockets, const std::string& socketPath);
   void reload();
-  /// Of the requests that are under way, after a little time for what a server is about to take.
-  void endUploads();
-  /// Does not return when one of them does not: a file may lie on a disk of its owner's making.
-  void reportUploads() const;
   /// Verification itself says nothing of a key that is missing, and everything that fails for it looks like the
   /// network.
   void reportMissingPublicKey() const;
 
+  // The steps of the end, in order.
+  void stopTakingConnections();
+  void endSessions();
+  /// Uploads have a little time for what a server is about to take; their requests end then.
+  void deliverPosts();
+  /// Does not return when one of them does not: a client's file may lie on a disk of its owner's making.
+  void endForeignCalls();
+  void joinThreads();
+  /// Until `offset` after the beginning of the end.
+  [[nodiscard]] Duration leftUntil(Duration offset) const { return stopDeadline.leftUntil(offset); }
+
   process::RunLoop& runLoop;
   const Directories directories;
+  StopDeadline stopDeadline{kEndUntil, [] { process::endNow(kExitSoftware); }};
 
   /// Above the pool, whose last tasks may still let go of sockets.
   const std::unique_ptr<UdpSocketService> udpSockets;
@@ -136,11 +165,11 @@ struct DaemonProcess::Parts {
   const std::shared_ptr<ReportingdAgent> agent;
 
   const std::shared_ptr<Queue> acceptQueue;
-  const std::shared_ptr<Queue> reloadQueue;
   EventLoop eventLoop;
+  CoalescedTask reloading;
   Lock entitlementsLock;
   std::shared_ptr<const EntitlementRules> entitlements VELK_GUARDED_BY(entitlementsLock);
-  std::unique_ptr<Listener> listener;
+  std::vector<std::unique_ptr<Listener>> listeners;
 };
 
 DaemonProcess::Parts::Parts(const DaemonOptions& options, process::RunLoop& loop, bool activated)
@@ -178,20 +207,20 @@ DaemonProcess::Parts::Parts(const DaemonOptions& options, process::RunLoop& loop
             return ReportingdSession::initWithSessionDelegate(delegate, std::move(connection), services);
           })),
       acceptQueue(pool->makeSerialQueue("com.tavrin.velkreportingd.accept")),
-      reloadQueue(pool->makeSerialQueue("com.tavrin.velkreportingd.reload")),
       eventLoop("velk-ipc"),
-      entitlements(std::make_shared<EntitlementRules>(EntitlementRules::load(directories.configuration))) {
+      reloading(pool->makeSerialQueue("com.tavrin.velkreportingd.reload"), [this] { reload(); }),
+      entitlements(std::make_shared<EntitlementRules>(loadEntitlements(directories.configuration).rules)) {
   // Starts the thread, early.
   storebagPool->makeSerialQueue("com.tavrin.velkreportingd.storebag")->async([] {});
 }
 
+std::shared_ptr<const EntitlementRules> DaemonProcess::Parts::currentEntitlements() {
+  Guard guard(entitlementsLock);
+  return entitlements;
+}
+
 bool DaemonProcess::Parts::hasEntitlement(std::string_view name, const Connection& connection) {
-  std::shared_ptr<const EntitlementRules> rules;
-  {
-    Guard guard(entitlementsLock);
-    rules = entitlements;
-  }
-  return rules->valueOfEntitlement(name, connection.peer());
+  return currentEntitlements()->valueOfEntitlement(name, connection.peer());
 }
 
 Listener::Options DaemonProcess::Parts::listenerOptions() {
@@ -203,15 +232,22 @@ Listener::Options DaemonProcess::Parts::listenerOptions() {
     return agent->shouldAcceptNewConnection(makeIncomingConnection(
         connection, [this](std::string_view name, const Connection& asked) { return hasEntitlement(name, asked); }));
   };
+  options.dependsOnExecutable = [this](const PeerCredentials& peer) {
+    return currentEntitlements()->dependOnExecutable(peer);
+  };
   return options;
 }
 
 void DaemonProcess::Parts::reload() {
-  auto rules = std::make_shared<const EntitlementRules>(EntitlementRules::load(directories.configuration));
-  log::standard("reload: %d entitlement grants; storebags are fetched afresh", rules->grantCount());
-  {
+  auto loaded = loadEntitlements(directories.configuration);
+  if (loaded.unreadable.empty()) {
+    log::standard("reload: %d entitlement grants; storebags are fetched afresh", loaded.rules.grantCount());
+    auto rules = std::make_shared<const EntitlementRules>(std::move(loaded.rules));
     Guard guard(entitlementsLock);
     entitlements.swap(rules);
+  } else {
+    // Half of the rules would lock out clients that nobody meant to lock out.
+    log::error("reload: not all entitlements can be read: the old ones stay; storebags are fetched afresh");
   }
   reportMissingPublicKey();
   agent->refreshStorebags();
@@ -237,87 +273,126 @@ Result<std::unique_ptr<DaemonProcess>> DaemonProcess::make(const DaemonOptions& 
     return failure("velkreportingd", kExitCannotCreate,
                    prepared.error().description + " (it must belong to the user that the daemon runs as)");
   }
-  auto listener = [&]() -> Result<std::unique_ptr<Listener>> {
-    if (activated) return Listener::adopt(std::move(sockets.front()), parts->listenerOptions());
-    const auto path =
-        options.socketPath.empty() ? parts->directories.runtime + "/" + std::string(kServiceName) : options.socketPath;
-    if (options.socketPath.empty()) {
-      // Everybody may connect, so everybody may pass through.
-      if (const auto made = files::createDirectories(parts->directories.runtime, 0755); !made) {
-        return Failure(made.error());
-      }
-    }
-    return Listener::bind(path, parts->listenerOptions());
-  }();
-  if (!listener) {
+  if (const auto listening = parts->listen(std::move(sockets), options.socketPath); !listening) {
     return failure("velkreportingd", kExitUnavailable,
-                   "cannot listen for clients: " + listener.error().description +
+                   "cannot listen for clients: " + listening.error().description +
                        " (another place for the socket is given with --socket)");
   }
-  parts->listener = std::move(*listener);
   return std::unique_ptr<DaemonProcess>(new DaemonProcess(std::move(parts)));
 }
 
-void DaemonProcess::resume() {
-  _parts->reportMissingPublicKey();
-  _parts->listener->resume();
-  _parts->idleWatch.start();
+Result<void> DaemonProcess::Parts::listen(std::vector<FileDescriptor> sockets, const std::string& socketPath) {
+  for (auto& socket : sockets) {
+    auto adopted = Listener::adopt(std::move(socket), listenerOptions());
+    if (!adopted) return Failure(adopted.error());
+    listeners.push_back(std::move(*adopted));
+  }
+  if (!listeners.empty()) return {};
+  if (socketPath.empty()) {
+    // Everybody may connect, so everybody may pass through.
+    if (auto made = files::createDirectories(directories.runtime, 0755); !made) return made;
+  }
+  const auto path = socketPath.empty() ? directories.runtime + "/" + std::string(kServiceName) : socketPath;
+  auto bound = Listener::bind(path, listenerOptions());
+  if (!bound) return Failure(bound.error());
+  listeners.push_back(std::move(*bound));
+  return {};
 }
 
-void DaemonProcess::reload() {
-  _parts->reloadQueue->async([parts = _parts.get()] { parts->reload(); });
+Result<void> DaemonProcess::resume() {
+  _parts->reportMissingPublicKey();
+  if (const auto prepared = _parts->stopDeadline.prepare(); !prepared) {
+    return failure("velkreportingd", kExitOsError, prepared.error().description);
+  }
+  for (const auto& listener : _parts->listeners) {
+    if (const auto resumed = listener->resume(); !resumed) {
+      return failure("velkreportingd", kExitUnavailable, "cannot listen for clients: " + resumed.error().description);
+    }
+  }
+  _parts->idleWatch.start();
+  return {};
 }
+
+void DaemonProcess::reload() { _parts->reloading.request(); }
 
 bool DaemonProcess::stopsListeningIfIdle() {
-  return _parts->idleWatch.isReleased() && _parts->listener->stopIfUnused();
+  return _parts->idleWatch.isReleased() && Listener::stopIfUnused(_parts->listeners);
 }
 
-void DaemonProcess::Parts::endUploads() {
+void DaemonProcess::Parts::stopTakingConnections() {
+  stopDeadline.expect("the event loop", "nothing was taken down yet; what sessions hold is lost");
+  for (const auto& listener : listeners) listener->stop();
+  // A decision that is being taken right now still counts.
+  for (const auto& listener : listeners) {
+    if (listener->waitUntilDecided(leftUntil(kDecisionsUntil))) continue;
+    log::error("stop: a decision about a connection is still being taken after %d ms; that client gets no session",
+               milliseconds(kDecisionsUntil));
+  }
+}
+
+void DaemonProcess::Parts::endSessions() {
+  // Everybody who is here: the call that runs is answered, then the session ends with its last messages.
+  stopDeadline.expect("the agent's lock", "what sessions have not posted is lost");
+  agent->invalidateAllSessions();
+  stopDeadline.expect("sessions that end", "what they have not posted is lost");
+  if (agent->waitForTeardowns(leftUntil(kTeardownsUntil))) return;
+  log::error("stop: sessions are still busy after %d ms and are cut off: what they have not posted is lost",
+             milliseconds(kTeardownsUntil));
+}
+
+void DaemonProcess::Parts::deliverPosts() {
+  stopDeadline.expect("posts to their servers", "their events are lost");
+  agent->invalidateAllConnectivityHelpers();
   if (!services.backends.uploads->waitUntilNone(kUploadTime)) http->endBulk();
+  if (idleWatch.waitUntilReleased(leftUntil(kDeliveriesUntil))) return;
+  log::error("stop: posts are still under way after %d ms and are cut off: their events are lost",
+             milliseconds(kDeliveriesUntil));
 }
 
-void DaemonProcess::Parts::reportUploads() const {
+void DaemonProcess::Parts::endForeignCalls() {
+  stopDeadline.expect("the diagnostics adaptor", "the events of its calls are lost");
+  if (!adaptorBundle->stop(leftUntil(kAdaptorUntil))) {
+    log::error(
+        "stop: the diagnostics adaptor does not return from its calls; the process ends without it after %d ms: "
+        "the events of these calls are lost",
+        milliseconds(kAdaptorUntil));
+    process::endNow(kExitSoftware);
+  }
+  // Uploads wait for their answers on threads of the pool.
+  stopDeadline.expect("the HTTP thread, which may be asking for a server's address", "nothing");
+  http->stop();
   auto& uploads = *services.backends.uploads;
-  const bool allEnded = uploads.waitUntilNone(kAdaptorTime);
+  const bool allEnded = uploads.waitUntilNone(leftUntil(kFilesUntil));
   if (const auto left = uploads.leftBehind() + uploads.count(); left > 0) {
     log::standard("stop: uploads left behind: %d; their files stay with their clients", left);
   }
   if (allEnded) return;
-  log::error("stop: files of clients that are being uploaded cannot be read; the process ends without them");
+  log::error("stop: files of clients that are being uploaded cannot be read; the process ends without them after %d ms",
+             milliseconds(kFilesUntil));
   process::endNow(kExitSoftware);
 }
 
+/// First those that hand work over, then those that do it.
+void DaemonProcess::Parts::joinThreads() {
+  stopDeadline.expect("the event loop", "nothing");
+  eventLoop.stop();
+  stopDeadline.expect("a thread that does not return from the system (a disk, a name service)", "nothing");
+  pool->stop();
+  storebagPool->stop();
+}
+
 void DaemonProcess::stop() {
+  _parts->stopDeadline.begin();
   _parts->idleWatch.stop();
   // Uploads that wait would take minutes, and would then find no transport.
   _parts->services.backends.uploads->stop();
   // Whoever waits for a storebag gets none, so that the agent's lock is free.
   _parts->storebagService->stop();
-  // Nobody new. A decision that is being taken right now still counts.
-  _parts->listener->stop();
-  _parts->acceptQueue->sync([] {});
-  // Everybody who is here: the call that runs is answered, then the session ends with its last messages.
-  _parts->agent->invalidateAllSessions();
-  if (!_parts->agent->waitForTeardowns(kTeardownTime)) {
-    log::error("stop: sessions are still busy after %d s and are cut off", kTeardownTime / std::chrono::seconds(1));
-  }
-  // What the sessions posted.
-  _parts->agent->invalidateAllConnectivityHelpers();
-  _parts->endUploads();
-  if (!_parts->idleWatch.waitUntilReleased(kDeliveryTime)) {
-    log::error("stop: posts are still under way after %d s and are cut off", kDeliveryTime / std::chrono::seconds(1));
-  }
-  if (!_parts->adaptorBundle->stop(kAdaptorTime)) {
-    log::error("stop: the diagnostics adaptor does not return from its calls; the process ends without it");
-    process::endNow(kExitSoftware);
-  }
-  // Uploads wait for their answers on threads of the pool.
-  _parts->http->stop();
-  _parts->reportUploads();
-  // The threads: first those that hand work over, then those that do it.
-  _parts->eventLoop.stop();
-  _parts->pool->stop();
-  _parts->storebagPool->stop();
+  _parts->stopTakingConnections();
+  _parts->endSessions();
+  _parts->deliverPosts();
+  _parts->endForeignCalls();
+  _parts->joinThreads();
 }
 
 }  // namespace velk

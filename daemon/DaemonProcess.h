@@ -21,15 +21,18 @@ class DaemonProcess {
                                                                    process::RunLoop& runLoop);
   ~DaemonProcess();
 
-  /// Takes connections from here on.
-  void resume();
-  /// Reads the entitlements again and lets the storebags be fetched afresh. Only posts.
+  /// Takes connections from the moment it returns. The error is of the same kind as that of `make`; `stop` is to
+  /// follow.
+  [[nodiscard]] Result<void> resume();
+  /// Reads the entitlements again (and keeps the old ones when they cannot be read) and lets the storebags be fetched
+  /// afresh. Only posts; what is asked for while it waits for its turn is done once.
   void reload();
   /// Takes no further connection if nothing has needed the process for as long as the idle limit says and nobody is at
   /// the door; false, and nothing has happened, otherwise. After true `stop` is to follow.
   [[nodiscard]] bool stopsListeningIfIdle();
-  /// Orderly end: no new connections, sessions torn down, what they posted delivered; each wait is bounded. Blocks for
-  /// half a minute at the worst.
+  /// Orderly end: no new connections, sessions torn down, what they posted delivered. Takes five seconds at the worst:
+  /// a wait that takes its bound is named in a line, and when a thread of the process does not return even then, the
+  /// process ends here, with `kExitSoftware`.
   void stop();
 
  private:

@@ -17,7 +17,11 @@ IdleWatch::IdleWatch(Scheduler& scheduler, std::optional<Duration> limit, std::f
       _queue(scheduler.makeSerialQueue("com.tavrin.velkreportingd.idle")),
       _timer(scheduler.makeTimer(_queue, [this] { limitPassed(); })) {}
 
-IdleWatch::~IdleWatch() { stop(); }
+IdleWatch::~IdleWatch() {
+  stop();
+  // A tick that is on its way would find nothing.
+  _queue->sync([this] { _timer->cancel(); });
+}
 
 void IdleWatch::start() {
   Guard guard(_lock);
@@ -26,11 +30,11 @@ void IdleWatch::start() {
 }
 
 void IdleWatch::stop() {
-  {
-    Guard guard(_lock);
-    _started = false;
-  }
-  _queue->sync([this] { _timer->cancel(); });
+  BlockingScope blocking;
+  Guard guard(_lock);
+  _started = false;
+  _timer->cancel();
+  while (_calling) _changed.wait(_lock);
 }
 
 void IdleWatch::beginTransaction() {
@@ -45,7 +49,7 @@ void IdleWatch::endTransaction() {
     _held = false;
     if (_started) arm();
   }
-  _released.notifyAll();
+  _changed.notifyAll();
   _queue->async([] { process::returnFreeMemory(); });  // nobody needs what the last sessions left behind
 }
 
@@ -57,10 +61,15 @@ void IdleWatch::limitPassed() {
   {
     Guard guard(_lock);
     if (_held || !_started) return;
+    _calling = true;
   }
   if (!_isOccupied()) _whenIdle();
-  Guard guard(_lock);
-  if (!_held && _started) arm();
+  {
+    Guard guard(_lock);
+    _calling = false;
+    if (!_held && _started) arm();
+  }
+  _changed.notifyAll();
 }
 
 bool IdleWatch::isReleased() const {
@@ -73,7 +82,7 @@ bool IdleWatch::waitUntilReleased(Duration limit) {
   const auto deadline = std::chrono::steady_clock::now() + limit;
   Guard guard(_lock);
   while (_held) {
-    if (!_released.waitUntil(_lock, deadline) && _held) return false;
+    if (!_changed.waitUntil(_lock, deadline) && _held) return false;
   }
   return true;
 }

@@ -26,7 +26,7 @@ class IdleWatch final : public KeepAlive {
 
   /// Begins to count. The callbacks are not called before.
   void start();
-  /// No callback begins after this has returned.
+  /// No callback begins after this has returned. Waits for one that runs, and for nothing else: not for a thread.
   void stop();
 
   void beginTransaction() override;
@@ -49,9 +49,11 @@ class IdleWatch final : public KeepAlive {
 
   // Guarded by _lock.
   mutable Lock _lock;
-  Condition _released;
+  /// The transaction has ended, or a callback.
+  Condition _changed;
   bool _held VELK_GUARDED_BY(_lock) = false;
   bool _started VELK_GUARDED_BY(_lock) = false;
+  bool _calling VELK_GUARDED_BY(_lock) = false;
 };
 
 }  // namespace velk

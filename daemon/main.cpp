@@ -45,7 +45,10 @@ int runDaemon(const DaemonOptions& options) {
   ReportingSessionConnectivityHelper::cleanupStorageRootFolder();
   auto daemon = DaemonProcess::make(options, **runLoop);
   if (!daemon) return fail(daemon.error(), daemon.error().code);
-  (*daemon)->resume();
+  if (const auto resumed = (*daemon)->resume(); !resumed) {
+    (*daemon)->stop();
+    return fail(resumed.error(), resumed.error().code);
+  }
   log::standard(daemontexts::kListenerResumes);
   launch::notifyReady("listening");
   runMainLoop(**daemon, **runLoop);
@@ -63,6 +66,7 @@ int main(int argumentCount, char** arguments) {
   velk::process::dropFromEnvironment("OPENSSL_CONF");
   velk::process::restrictNewFiles();
   velk::process::limitHeaps();
+  velk::process::raiseDescriptorLimit();
   const auto parsed = velk::parseDaemonOptions(argumentCount, arguments);
   if (const auto* status = std::get_if<int>(&parsed)) return *status;
   const auto& options = std::get<velk::DaemonOptions>(parsed);

@@ -58,6 +58,10 @@ inline constexpr std::size_t kMaximumFramesPerTurn = 256;
 /// of the descriptors that a daemon may have. Further ones are closed unread.
 inline constexpr std::size_t kMaximumConnectionsPerUser = 512;
 
+/// Look-ups of programs that may be under way for the peers of one user. A program may lie on a disk that does not
+/// answer: each such look-up keeps a thread, and further peers of that user wait behind them.
+inline constexpr std::size_t kMaximumLookUpsPerUser = 4;
+
 /// Bytes of a text that answers a call: the text of what was posted may be longer, and a part of it says more than an
 /// error. The rest of the frame is for what stands beside it.
 inline constexpr std::size_t kMaximumReplyTextBytes = kMaximumFrameBytes - 16 * 1024;

@@ -1,9 +1,12 @@
 #include "ipc/Listener.h"
 
+#include <algorithm>
 #include <atomic>
 #include <cerrno>
 #include <cstring>
+#include <deque>
 #include <map>
+#include <utility>
 
 #include "ipc/LogTexts.h"
 #include "platform/Entitlements.h"
@@ -26,8 +29,14 @@ class Listener::Core : public std::enable_shared_from_this<Listener::Core> {
   Core(FileDescriptor socket, FileDescriptor lock, std::string path, Options options)
       : _options(std::move(options)), _path(std::move(path)), _pathLock(std::move(lock)), _socket(std::move(socket)) {}
 
-  void resume() {
-    _options.loop->post([self = shared_from_this()] { self->startAccepting(); });
+  [[nodiscard]] Result<void> resume() {
+    if (auto started = _options.loop->start(); !started) return started;
+    Result<void> result = failure("listener", ECANCELED, "the event loop has ended");
+    Semaphore done;
+    _options.loop->post(
+        [self = shared_from_this(), &result, signal = Signal(done)] { result = self->startAccepting(); });
+    done.wait();
+    return result;
   }
 
   void stop() {
@@ -44,17 +53,32 @@ class Listener::Core : public std::enable_shared_from_this<Listener::Core> {
     _pathLock = FileDescriptor();
   }
 
+  [[nodiscard]] bool waitUntilDecided(Duration limit) {
+    BlockingScope blocking;
+    const auto deadline = std::chrono::steady_clock::now() + limit;
+    Guard guard(_lock);
+    while (_deciding) {
+      if (!_decided.waitUntil(_lock, deadline) && _deciding) return false;
+    }
+    return true;
+  }
+
   // Accepting happens on the loop's thread alone, so nobody is taken while it looks.
-  [[nodiscard]] bool stopIfUnused() {
+  [[nodiscard]] static bool stopIfUnused(std::span<const std::unique_ptr<Listener>> listeners) {
+    if (listeners.empty()) return true;
     std::atomic<bool> unused{false};
     Semaphore looked;
-    _options.loop->post([self = shared_from_this(), &unused, signal = Signal(looked)] {
-      if (self->openConnections() != 0 || self->hasWaitingConnection()) return;
-      self->_watch.reset();
+    listeners.front()->_core->_options.loop->post([listeners, &unused, signal = Signal(looked)] {
+      for (const auto& listener : listeners) {
+        if (listener->openConnections() != 0 || listener->hasWaitingConnection()) return;
+      }
+      for (const auto& listener : listeners) listener->_core->_watch.reset();
       unused = true;
     });
     looked.wait();
-    if (unused) stop();
+    if (unused) {
+      for (const auto& listener : listeners) listener->stop();
+    }
     return unused;
   }
 
@@ -87,13 +111,23 @@ class Listener::Core : public std::enable_shared_from_this<Listener::Core> {
     bool told = false;
   };
 
+  struct Pending;
+  /// Of one user's peers.
+  struct LookUps {
+    std::size_t underWay = 0;
+    std::deque<std::unique_ptr<Pending>> waiting;
+  };
+
   // On the loop's thread.
 
-  void startAccepting() {
-    if (_watch || isStopped()) return;
+  [[nodiscard]] Result<void> startAccepting() {
+    if (_watch) return {};
+    if (isStopped()) return failure("listener", ECANCELED, "the listener has been stopped");
     _watch = _options.loop->watch(_socket.get());
-    if (_watch) return accept();
-    log::error(ipc::texts::kAcceptRests, std::strerror(errno));
+    if (!_watch)
+      return failure("listener", errno, std::string("the socket cannot be watched: ") + std::strerror(errno));
+    accept();
+    return {};
   }
 
   void accept() {
@@ -122,9 +156,9 @@ class Listener::Core : public std::enable_shared_from_this<Listener::Core> {
       return 0;
     }
     _options.acceptQueue->async(
-        [self = shared_from_this(),
-         pending = std::make_unique<Pending>(Pending{std::move(accepted.socket), std::move(*peer)})]() mutable {
-          self->decide(std::move(*pending));
+        [self = shared_from_this(), pending = std::make_unique<Pending>(
+                                        Pending{std::move(accepted.socket), std::move(*peer), nullptr})]() mutable {
+          self->examine(std::move(pending));
         });
     return 0;
   }
@@ -157,18 +191,82 @@ class Listener::Core : public std::enable_shared_from_this<Listener::Core> {
   struct Pending {
     FileDescriptor socket;
     PeerCredentials peer;
+    std::shared_ptr<Queue> queue;
   };
 
-  void decide(Pending pending) {
-    const auto uid = pending.peer.uid;
+  void examine(std::unique_ptr<Pending> pending) {
+    pending->queue = _options.makeDeliveryQueue();
+    if (!_options.dependsOnExecutable || !_options.dependsOnExecutable(pending->peer)) {
+      return decide(std::move(pending));
+    }
+    {
+      Guard guard(_lock);
+      auto& lookUps = _lookUps[pending->peer.uid];
+      if (lookUps.underWay == ipc::kMaximumLookUpsPerUser) {
+        lookUps.waiting.push_back(std::move(pending));
+        return;
+      }
+      ++lookUps.underWay;
+    }
+    lookUp(std::move(pending));
+  }
+
+  void decide(std::unique_ptr<Pending> pending) {
+    const auto uid = pending->peer.uid;
+    if (!beginsToDecide()) {
+      pending->socket = FileDescriptor();
+      release(uid);
+      addUndecided(-1);
+      return;
+    }
     const auto connection =
-        Connection::adopt(std::move(pending.socket), std::move(pending.peer), true, *_options.loop,
-                          _options.makeDeliveryQueue(), [self = shared_from_this(), uid] { self->release(uid); });
-    if (isStopped() || !_options.shouldAcceptNewConnection(connection)) connection->invalidate();
+        Connection::adopt(std::move(pending->socket), std::move(pending->peer), true, *_options.loop,
+                          std::move(pending->queue), [self = shared_from_this(), uid] { self->release(uid); });
+    if (!_options.shouldAcceptNewConnection(connection)) connection->invalidate();
     addUndecided(-1);
+    {
+      Guard guard(_lock);
+      _deciding = false;
+    }
+    _decided.notifyAll();
+  }
+
+  /// False once the listener has been stopped: `waitUntilDecided` has nobody left to wait for.
+  [[nodiscard]] bool beginsToDecide() {
+    Guard guard(_lock);
+    _deciding = !_stopped;
+    return _deciding;
   }
 
   // Any thread.
+
+  /// May take for ever, on the connection's own queue.
+  void lookUp(std::unique_ptr<Pending> pending) {
+    const auto queue = pending->queue;
+    queue->async([self = shared_from_this(), pending = std::move(pending)]() mutable {
+      const auto uid = pending->peer.uid;
+      {
+        const BlockingScope blocking;
+        pending->peer.executable = self->_options.findExecutable(pending->peer.pid, uid).value_or("");
+      }
+      self->_options.acceptQueue->async(
+          [self, pending = std::move(pending)]() mutable { self->decide(std::move(pending)); });
+      if (auto next = self->nextToLookUp(uid)) self->lookUp(std::move(next));
+    });
+  }
+
+  /// Who waited for the look-up that has just ended; null when nobody did.
+  [[nodiscard]] std::unique_ptr<Pending> nextToLookUp(std::uint32_t uid) {
+    Guard guard(_lock);
+    const auto lookUps = _lookUps.find(uid);
+    if (!lookUps->second.waiting.empty()) {
+      auto next = std::move(lookUps->second.waiting.front());
+      lookUps->second.waiting.pop_front();
+      return next;
+    }
+    if (--lookUps->second.underWay == 0) _lookUps.erase(lookUps);
+    return nullptr;
+  }
 
   void release(std::uint32_t uid) {
     Guard guard(_lock);
@@ -203,7 +301,11 @@ class Listener::Core : public std::enable_shared_from_this<Listener::Core> {
   std::map<std::uint32_t, User> _users VELK_GUARDED_BY(_lock);
   std::size_t _open VELK_GUARDED_BY(_lock) = 0;
   int _undecided VELK_GUARDED_BY(_lock) = 0;
+  std::map<std::uint32_t, LookUps> _lookUps VELK_GUARDED_BY(_lock);
   bool _stopped VELK_GUARDED_BY(_lock) = false;
+  /// A decision is under way on the accept queue.
+  bool _deciding VELK_GUARDED_BY(_lock) = false;
+  Condition _decided;
 };
 
 Listener::Listener(std::shared_ptr<Core> core) noexcept : _core(std::move(core)) {}
@@ -224,11 +326,15 @@ Result<std::unique_ptr<Listener>> Listener::adopt(FileDescriptor socket, Options
       new Listener(std::make_shared<Core>(std::move(*adopted), FileDescriptor(), "", std::move(options))));
 }
 
-void Listener::resume() { _core->resume(); }
+Result<void> Listener::resume() { return _core->resume(); }
 
 void Listener::stop() { _core->stop(); }
 
-bool Listener::stopIfUnused() { return _core->stopIfUnused(); }
+bool Listener::waitUntilDecided(Duration limit) { return _core->waitUntilDecided(limit); }
+
+bool Listener::stopIfUnused(std::span<const std::unique_ptr<Listener>> listeners) {
+  return Core::stopIfUnused(listeners);
+}
 
 bool Listener::hasWaitingConnection() const { return _core->hasWaitingConnection(); }
 

@@ -1,15 +1,18 @@
-// The named service: takes connections on a socket and offers each to the daemon. Made by the daemon's main function,
-// once; lives until the daemon stops.
+// The named service: takes connections on a socket and offers each to the daemon. Made by the daemon's process, one for
+// each socket; lives until the daemon stops.
 #pragma once
 
 #include <cstddef>
 #include <functional>
 #include <memory>
+#include <optional>
+#include <span>
 #include <string>
 
 #include "foundation/Error.h"
 #include "ipc/Connection.h"
 #include "ipc/Limits.h"
+#include "platform/Entitlements.h"
 #include "platform/Queue.h"
 
 namespace velk {
@@ -19,6 +22,8 @@ class EventLoop;
 /// Accepting happens on the event loop's thread; the decision is taken on the accept queue, one connection at a time.
 /// Nothing is read from a connection before the handler has accepted and resumed it. Connections beyond a user's
 /// share are closed before anybody is asked. Running out of descriptors lets accepting rest for a moment.
+/// The loop's thread asks the kernel alone. Where a decision needs the peer's program, the look-up runs on the delivery
+/// queue of that connection, a few at a time for one user: one that takes for ever holds up that user's peers alone.
 class Listener {
  public:
   struct Options {
@@ -30,6 +35,9 @@ class Listener {
     std::function<std::shared_ptr<Queue>()> makeDeliveryQueue;
     /// True: the handler has set the connection up and resumed it. False: the connection is closed.
     std::function<bool(const std::shared_ptr<Connection>&)> shouldAcceptNewConnection;
+    /// Whether the decision depends on the program that the peer runs. Called on the accept queue; none: never.
+    std::function<bool(const PeerCredentials&)> dependsOnExecutable;
+    std::function<std::optional<std::string>(std::int32_t pid, std::uint32_t uid)> findExecutable = executableOfProcess;
     std::size_t maximumConnectionsPerUser = ipc::kMaximumConnectionsPerUser;
     /// The service's name in the error that a second daemon gets.
     std::string program = "velkreportingd";
@@ -45,16 +53,21 @@ class Listener {
   Listener(const Listener&) = delete;
   Listener& operator=(const Listener&) = delete;
 
-  void resume();
+  /// Returns once connections are being taken, or with the reason why they cannot be. Not on the loop's thread.
+  [[nodiscard]] Result<void> resume();
   /// Takes no further connection: waits for the loop to let go of the socket, removes the path if it was bound here.
   /// Not on the loop's thread. Connections that were accepted stay open; a decision under way still finishes.
   /// Idempotent; the destructor calls it.
   void stop();
 
-  /// As `stop`, if no connection is open and nobody waits; otherwise nothing happens and the result is false. Looking
-  /// and stopping are one step: nobody is taken in between. Who connects to a socket of the service manager afterwards
-  /// waits for the next daemon.
-  [[nodiscard]] bool stopIfUnused();
+  /// After `stop`: waits for the decision that is under way, if one is. Connections that were not being decided on by
+  /// then are closed. False when it was not taken within `limit`.
+  [[nodiscard]] bool waitUntilDecided(Duration limit);
+
+  /// Stops all of these, which share a loop, if none of them has an open or waiting connection; otherwise nothing
+  /// happens and the result is false. Looking and stopping are one step: nobody is taken in between. Who connects to a
+  /// socket of the service manager afterwards waits for the next daemon.
+  [[nodiscard]] static bool stopIfUnused(std::span<const std::unique_ptr<Listener>> listeners);
 
   /// Somebody waits in the socket's queue, or has been taken from it and not been decided on. With this false and no
   /// connection open the daemon may go without anybody noticing. Any thread.

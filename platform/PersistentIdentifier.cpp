@@ -1,5 +1,9 @@
 #include "platform/PersistentIdentifier.h"
 
+#include <map>
+#include <optional>
+#include <utility>
+
 #include "foundation/Uuid.h"
 #include "platform/Fork.h"
 #include "platform/Lock.h"
@@ -9,11 +13,39 @@
 namespace velk {
 namespace {
 
-// Held while the suite's file is read and written: the two operations that it serialises are rare, and the suite
-// never calls back.
-constinit PerProcess<Lock> identifierLocks;
-Lock& identifierLock() {
-  return identifierLocks.get([] { return new Lock; });
+/// Identifiers that could not be stored, so that a process whose suite cannot be written reports under one all the
+/// same. Any thread; nothing blocks under its lock.
+class Unstored {
+ public:
+  /// Keys may be made from what clients call themselves; identifiers beyond this many are new ones each time.
+  static constexpr std::size_t kMaximum = 1024;
+
+  [[nodiscard]] std::optional<std::string> find(const UserDefaults& suite, std::string_view key) const {
+    Guard guard(_lock);
+    const auto found = _identifiers.find(Key(&suite, key));
+    return found != _identifiers.end() ? std::optional(found->second) : std::nullopt;
+  }
+  /// The one that is kept: another thread may have been quicker.
+  [[nodiscard]] std::string keep(const UserDefaults& suite, std::string_view key, std::string identifier) {
+    Guard guard(_lock);
+    if (_identifiers.size() >= kMaximum && !_identifiers.contains(Key(&suite, key))) return identifier;
+    return _identifiers.emplace(Key(&suite, key), std::move(identifier)).first->second;
+  }
+  void forget(const UserDefaults& suite, std::string_view key) {
+    Guard guard(_lock);
+    _identifiers.erase(Key(&suite, key));
+  }
+
+ private:
+  using Key = std::pair<const UserDefaults*, std::string>;
+
+  mutable Lock _lock;
+  std::map<Key, std::string> _identifiers VELK_GUARDED_BY(_lock);
+};
+
+constinit PerProcess<Unstored> unstoredOfProcess;
+Unstored& unstored() {
+  return unstoredOfProcess.get([] { return new Unstored; });
 }
 
 std::string_view keyForDNU(bool respectConsent) { return respectConsent ? "uuidRespectDNU" : "uuidOverrideDNU"; }
@@ -27,12 +59,15 @@ void store(UserDefaults& defaults, std::string_view key, const std::string& iden
 }  // namespace
 
 std::string persistentIdentifier(UserDefaults& defaults, std::string_view key) {
+  const auto kept = unstored().find(defaults, key);
   std::string made;
-  const auto value = defaults.valueOrStore(key, [&] { return PropertyValue(made = randomUuidText()); });
+  const auto value = defaults.valueOrStore(key, [&] { return PropertyValue(made = kept ? *kept : randomUuidText()); });
   if (!value) {
     log::error("persistentIdentifier: Cannot store %s: %s", key, value.error());
-    return made.empty() ? randomUuidText() : made;
+    if (kept) return *kept;
+    return unstored().keep(defaults, key, made.empty() ? randomUuidText() : made);
   }
+  if (kept) unstored().forget(defaults, key);
   if (const auto* identifier = value->string()) return *identifier;
   // Something that is no identifier stands there.
   made = randomUuidText();
@@ -42,11 +77,7 @@ std::string persistentIdentifier(UserDefaults& defaults, std::string_view key) {
 
 std::string getPersistentIdentifierForDNU(UserDefaults& defaults, bool respectConsent) {
   const auto key = keyForDNU(respectConsent);
-  std::string identifier;
-  {
-    Guard guard(identifierLock());
-    identifier = persistentIdentifier(defaults, key);
-  }
+  const auto identifier = persistentIdentifier(defaults, key);
   log::standard(logtexts::kPersistentIdentifierForDNU, key, identifier);
   return identifier;
 }
@@ -54,10 +85,8 @@ std::string getPersistentIdentifierForDNU(UserDefaults& defaults, bool respectCo
 void regeneratePersistentIdentifierForDNU(UserDefaults& defaults, bool respectConsent) {
   const auto key = keyForDNU(respectConsent);
   const std::string identifier = randomUuidText();
-  {
-    Guard guard(identifierLock());
-    store(defaults, key, identifier);
-  }
+  unstored().forget(defaults, key);
+  store(defaults, key, identifier);
   log::standard(logtexts::kRegeneratedPersistentIdentifierForDNU, key, identifier);
 }
 

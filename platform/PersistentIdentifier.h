@@ -10,11 +10,12 @@
 namespace velk {
 
 /// The identifier stored under `key`; a new random UUID text is stored first when there is none. When it cannot be
-/// stored the new one is returned all the same, and the failure is logged.
+/// stored, the failure is logged and the new one is returned all the same, again and again in this process, until it
+/// can be stored.
 [[nodiscard]] std::string persistentIdentifier(UserDefaults& defaults, std::string_view key);
 
 /// For clients that respect the user's diagnostics-and-usage consent ("uuidRespectDNU") and for those that need not
-/// ("uuidOverrideDNU"). Serialised by one lock of the process.
+/// ("uuidOverrideDNU"). The suite makes reading and storing one step.
 [[nodiscard]] std::string getPersistentIdentifierForDNU(UserDefaults& defaults, bool respectConsent);
 /// Replaces the identifier; the other one stays.
 void regeneratePersistentIdentifierForDNU(UserDefaults& defaults, bool respectConsent);

@@ -18,6 +18,10 @@ void restrictNewFiles();
 /// refuses is left as it is.
 void setUtilityPriority();
 
+/// As many open descriptors as the system lets this process have, up to 65,536 (a limit that is higher already stays).
+/// What the system refuses is left as it is.
+void raiseDescriptorLimit();
+
 /// Few heaps instead of one for every thread that ever allocated: threads come and go here, and what each leaves free
 /// stays with its heap. Before other threads are started.
 void limitHeaps();

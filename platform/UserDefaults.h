@@ -16,7 +16,8 @@ namespace velk {
 inline constexpr std::string_view kVelkReportingDefaultsSuite = "com.tavrin.velkreporting";
 
 /// One suite. Any thread; every read sees what any process wrote last. Failures to write are returned; a file that
-/// cannot be read is set aside and reported, and counts as empty.
+/// cannot be read is set aside and reported, and counts as empty. A write waits a second at most for one that another
+/// process or thread has under way; after a wait in vain the writes of the next seconds fail at once.
 class UserDefaults {
  public:
   virtual ~UserDefaults() = default;

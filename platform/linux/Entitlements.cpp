@@ -14,6 +14,7 @@
 #include <cerrno>
 #include <charconv>
 #include <climits>
+#include <system_error>
 
 #include "foundation/Text.h"
 #include "platform/FileDescriptor.h"
@@ -26,7 +27,9 @@ namespace {
 
 constexpr std::size_t kMaximumFileBytes = 256 * 1024;
 constexpr std::size_t kNameBufferBytes = 64 * 1024;
-constexpr int kMaximumGroups = 65536;
+constexpr std::size_t kUsualGroups = 32;
+constexpr std::size_t kMaximumGroups = 65536;
+static_assert(sizeof(gid_t) == sizeof(std::uint32_t));
 
 std::optional<std::uint32_t> number(std::string_view text) {
   std::uint32_t result = 0;
@@ -35,51 +38,52 @@ std::optional<std::uint32_t> number(std::string_view text) {
   return result;
 }
 
-bool isUser(const std::string& user, std::uint32_t uid) {
-  if (const auto named = number(user)) return *named == uid;
+/// What the user database says of a name. An error: it could not be asked.
+using NamedNumber = Result<std::optional<std::uint32_t>>;
+
+NamedNumber answerOfDatabase(int error, const char* kind, const std::string& name, std::optional<std::uint32_t> found) {
+  // Several numbers stand for a name that is not there.
+  const bool wasAsked = error == 0 || error == ENOENT || error == ESRCH || error == EBADF || error == EPERM;
+  if (wasAsked) return found;
+  return failure("Entitlements", error,
+                 std::string("cannot look up ") + kind + " " + name + ": " + std::generic_category().message(error));
+}
+
+NamedNumber userNumber(const std::string& user) {
+  if (const auto numbered = number(user)) return numbered;
   std::vector<char> buffer(kNameBufferBytes);
   passwd entry{};
   passwd* found = nullptr;
-  return ::getpwnam_r(user.c_str(), &entry, buffer.data(), buffer.size(), &found) == 0 && found != nullptr &&
-         found->pw_uid == uid;
+  const int error = ::getpwnam_r(user.c_str(), &entry, buffer.data(), buffer.size(), &found);
+  return answerOfDatabase(error, "user", user, found != nullptr ? std::optional(entry.pw_uid) : std::nullopt);
 }
 
-std::optional<std::uint32_t> groupNumber(const std::string& group) {
-  if (const auto named = number(group)) return named;
+NamedNumber groupNumber(const std::string& group) {
+  if (const auto numbered = number(group)) return numbered;
   std::vector<char> buffer(kNameBufferBytes);
   ::group entry{};
   ::group* found = nullptr;
-  if (::getgrnam_r(group.c_str(), &entry, buffer.data(), buffer.size(), &found) != 0 || found == nullptr) {
-    return std::nullopt;
-  }
-  return found->gr_gid;
+  const int error = ::getgrnam_r(group.c_str(), &entry, buffer.data(), buffer.size(), &found);
+  return answerOfDatabase(error, "group", group, found != nullptr ? std::optional(entry.gr_gid) : std::nullopt);
 }
 
-/// The group that the process runs with, and all that its user belongs to.
-std::vector<gid_t> groupsOf(const PeerCredentials& peer) {
-  std::vector<gid_t> groups{peer.gid};
-  std::vector<char> buffer(kNameBufferBytes);
-  passwd entry{};
-  passwd* found = nullptr;
-  if (::getpwuid_r(peer.uid, &entry, buffer.data(), buffer.size(), &found) != 0 || found == nullptr) return groups;
-  int count = 64;
-  std::vector<gid_t> listed(static_cast<std::size_t>(count));
-  if (::getgrouplist(found->pw_name, found->pw_gid, listed.data(), &count) < 0) {
-    count = std::min(count, kMaximumGroups);
-    listed.resize(static_cast<std::size_t>(count));
-    if (::getgrouplist(found->pw_name, found->pw_gid, listed.data(), &count) < 0) return groups;
+/// Without them a grant to a group counts for the primary one alone: the safe side.
+std::vector<std::uint32_t> supplementaryGroups(int socket) {
+  std::vector<std::uint32_t> groups(kUsualGroups);
+  for (;;) {
+    auto bytes = static_cast<socklen_t>(groups.size() * sizeof(gid_t));
+    if (::getsockopt(socket, SOL_SOCKET, SO_PEERGROUPS, groups.data(), &bytes) == 0) {
+      groups.resize(bytes / sizeof(gid_t));
+      return groups;
+    }
+    const std::size_t needed = bytes / sizeof(gid_t);
+    if (errno != ERANGE || needed <= groups.size() || needed > kMaximumGroups) return {};
+    groups.resize(needed);
   }
-  groups.insert(groups.end(), listed.begin(), listed.begin() + count);
-  return groups;
 }
 
-bool isInAnyGroup(const std::vector<std::string>& granted, const PeerCredentials& peer) {
-  if (granted.empty()) return false;
-  const auto groups = groupsOf(peer);
-  return std::any_of(granted.begin(), granted.end(), [&](const std::string& group) {
-    const auto gid = groupNumber(group);
-    return gid && std::find(groups.begin(), groups.end(), *gid) != groups.end();
-  });
+bool contains(const std::vector<std::uint32_t>& numbers, std::uint32_t sought) {
+  return std::find(numbers.begin(), numbers.end(), sought) != numbers.end();
 }
 
 bool endsWith(std::string_view text, std::string_view end) {
@@ -91,7 +95,7 @@ bool endsWith(std::string_view text, std::string_view end) {
 /// Reads one file into grants. Lives for that file.
 class EntitlementRules::Parser {
  public:
-  Parser(std::string path, std::vector<Grant>& grants) : _path(std::move(path)), _grants(grants) {}
+  Parser(std::string path, LoadedEntitlements& loaded) : _path(std::move(path)), _loaded(loaded) {}
 
   void run(std::string_view text) {
     for (const auto line : split(text, '\n')) {
@@ -121,24 +125,39 @@ class EntitlementRules::Parser {
     if (!_hasSection) return complain("a section without a name");
     _sectionLine = _line;
     _current = Grant{std::string(name), {}, {}, {}};
+    _hasUnknownNames = false;
   }
 
   void readSetting(std::string_view key, std::string_view values) {
-    std::vector<std::string>* list = nullptr;
-    if (key == "users") list = &_current.users;
-    if (key == "groups") list = &_current.groups;
-    if (key == "executables") list = &_current.executables;
-    if (list == nullptr) return complain("an unknown setting");
-    _restrictsExecutables = _restrictsExecutables || list == &_current.executables;
+    const bool isKnown = key == "users" || key == "groups" || key == "executables";
+    if (!isKnown) return complain("an unknown setting");
+    _restrictsExecutables = _restrictsExecutables || key == "executables";
     for (const auto part : split(values, ',')) {
-      const auto value = trimmed(part);
+      const std::string value(trimmed(part));
       if (value.empty()) continue;
-      if (list == &_current.executables && value.front() != '/') {
-        complain("an executable that is not an absolute path");
-        continue;
-      }
-      list->emplace_back(value);
+      if (key == "users") addNumber(_current.users, userNumber(value), "user", value);
+      if (key == "groups") addNumber(_current.groups, groupNumber(value), "group", value);
+      if (key == "executables") addExecutable(value);
     }
+  }
+
+  void addNumber(std::vector<std::uint32_t>& list, const NamedNumber& found, const char* kind,
+                 const std::string& name) {
+    if (!found) {
+      _hasUnknownNames = true;
+      _loaded.unreadable.push_back({found.error().domain, found.error().code,
+                                    _path + ":" + std::to_string(_line) + ": " + found.error().description});
+    } else if (!*found) {
+      _hasUnknownNames = true;
+      log::error("Entitlements: %s:%d: there is no %s %s", _path, _line, kind, name);
+    } else {
+      list.push_back(**found);
+    }
+  }
+
+  void addExecutable(const std::string& path) {
+    if (path.front() != '/') return complain("an executable that is not an absolute path");
+    _current.executables.push_back(path);
   }
 
   void endSection() {
@@ -148,64 +167,77 @@ class EntitlementRules::Parser {
     // A restriction of which nothing usable is left must not turn into a grant without it.
     const bool restrictionIsLost = std::exchange(_restrictsExecutables, false) && _current.executables.empty();
     if (namesSomebody && !restrictionIsLost) {
-      _grants.push_back(std::move(_current));
+      _loaded.rules._grants.push_back(std::move(_current));
       return;
     }
+    // Names that nobody knows have had a line of their own.
+    if (_hasUnknownNames && !restrictionIsLost) return;
     log::error("Entitlements: %s:%d: the section grants nothing: %s", _path, _sectionLine,
                restrictionIsLost ? "no usable executable" : "no user and no group");
   }
 
   const std::string _path;
-  std::vector<Grant>& _grants;
+  LoadedEntitlements& _loaded;
   Grant _current;
   bool _hasSection = false;
   bool _restrictsExecutables = false;
+  bool _hasUnknownNames = false;
   int _line = 0;
   int _sectionLine = 0;
 };
 
-EntitlementRules EntitlementRules::load(const std::string& configurationDirectory) {
-  EntitlementRules rules;
+LoadedEntitlements EntitlementRules::load(const std::string& configurationDirectory) {
+  LoadedEntitlements loaded;
   const std::string directory = configurationDirectory + "/entitlements.d";
   const auto names = files::list(directory);
   if (!names) {
-    if (names.error().code != static_cast<int>(files::Code::notFound)) {
-      log::error("Entitlements: %s", names.error());
-    }
-    return rules;
+    const bool isAbsent = names.error().code == static_cast<int>(files::Code::notFound) && !files::exists(directory);
+    if (!isAbsent) loaded.unreadable.push_back(names.error());
+    return loaded;
   }
   for (const auto& name : *names) {
     if (!endsWith(name, ".conf") || name.front() == '.') continue;
     const std::string path = directory + "/" + name;
-    if (!files::isTrustworthy(path)) {
+    if (files::exists(path) && !files::isTrustworthy(path)) {
       log::error("Entitlements: Ignoring %s: others can write it or its directory", path);
       continue;
     }
     const auto bytes = files::read(path, kMaximumFileBytes);
     if (!bytes) {
-      log::error("Entitlements: Ignoring %s: %s", path, bytes.error());
+      loaded.unreadable.push_back(bytes.error());
       continue;
     }
-    Parser(path, rules._grants).run({reinterpret_cast<const char*>(bytes->data()), bytes->size()});
+    Parser(path, loaded).run({reinterpret_cast<const char*>(bytes->data()), bytes->size()});
   }
-  return rules;
+  return loaded;
+}
+
+bool EntitlementRules::hasEverything(const PeerCredentials& peer) { return peer.uid == 0 || peer.uid == ::geteuid(); }
+
+bool EntitlementRules::names(const Grant& grant, const PeerCredentials& peer) {
+  if (contains(grant.users, peer.uid) || contains(grant.groups, peer.gid)) return true;
+  return std::any_of(peer.groups.begin(), peer.groups.end(),
+                     [&](std::uint32_t group) { return contains(grant.groups, group); });
 }
 
 bool EntitlementRules::holds(const Grant& grant, const PeerCredentials& peer) {
   const bool runsIt = grant.executables.empty() ||
                       (!peer.executable.empty() && std::find(grant.executables.begin(), grant.executables.end(),
                                                              peer.executable) != grant.executables.end());
-  if (!runsIt) return false;
-  return std::any_of(grant.users.begin(), grant.users.end(),
-                     [&](const std::string& user) { return isUser(user, peer.uid); }) ||
-         isInAnyGroup(grant.groups, peer);
+  return runsIt && names(grant, peer);
 }
 
 bool EntitlementRules::valueOfEntitlement(std::string_view name, const PeerCredentials& peer) const {
   if (peer.uid == UINT32_MAX) return false;
-  if (peer.uid == 0 || peer.uid == ::geteuid()) return true;
+  if (hasEverything(peer)) return true;
   return std::any_of(_grants.begin(), _grants.end(),
                      [&](const Grant& grant) { return grant.entitlement == name && holds(grant, peer); });
+}
+
+bool EntitlementRules::dependOnExecutable(const PeerCredentials& peer) const {
+  if (peer.uid == UINT32_MAX || hasEverything(peer)) return false;
+  return std::any_of(_grants.begin(), _grants.end(),
+                     [&](const Grant& grant) { return !grant.executables.empty() && names(grant, peer); });
 }
 
 std::optional<std::string> executableOfProcess(std::int32_t pid, std::uint32_t uid) {
@@ -234,9 +266,7 @@ std::optional<PeerCredentials> credentialsOfPeer(int socketDescriptor) {
   ucred credentials{};
   socklen_t length = sizeof credentials;
   if (::getsockopt(socketDescriptor, SOL_SOCKET, SO_PEERCRED, &credentials, &length) != 0) return std::nullopt;
-  PeerCredentials peer{credentials.uid, credentials.gid, credentials.pid, {}};
-  peer.executable = executableOfProcess(peer.pid, peer.uid).value_or("");
-  return peer;
+  return PeerCredentials{credentials.uid, credentials.gid, credentials.pid, {}, supplementaryGroups(socketDescriptor)};
 }
 
 }  // namespace velk

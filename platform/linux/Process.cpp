@@ -10,6 +10,7 @@
 #include <sys/syscall.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <cerrno>
 #include <csignal>
 #include <cstdint>
@@ -20,6 +21,8 @@ namespace velk::process {
 namespace {
 
 constexpr int kUtilityNice = 5;
+// Beyond this, code of libraries that goes through all descriptors a process might have takes noticeable time.
+constexpr rlim_t kUsefulDescriptors = 65'536;
 // linux/ioprio.h is not part of every distribution's headers.
 constexpr int kIoPriorityOfProcess = 1;
 constexpr int kIoPriorityClassShift = 13;
@@ -35,6 +38,14 @@ Failure systemFailure(const char* what) {
 void dropFromEnvironment(const char* variable) { ::unsetenv(variable); }
 
 void restrictNewFiles() { ::umask(077); }
+
+void raiseDescriptorLimit() {
+  rlimit limit{};
+  if (::getrlimit(RLIMIT_NOFILE, &limit) != 0) return;
+  // Infinity is the largest number of all.
+  limit.rlim_cur = std::max(limit.rlim_cur, std::min(limit.rlim_max, kUsefulDescriptors));
+  static_cast<void>(::setrlimit(RLIMIT_NOFILE, &limit));
+}
 
 void limitHeaps() { ::mallopt(M_ARENA_MAX, 2); }
 

@@ -7,9 +7,11 @@
 #include <algorithm>
 #include <cerrno>
 #include <system_error>
+#include <thread>
 
 #include "foundation/Json.h"
 #include "platform/BlockingScope.h"
+#include "platform/Clock.h"
 #include "platform/FileDescriptor.h"
 #include "platform/Files.h"
 #include "platform/Lock.h"
@@ -119,44 +121,128 @@ class CachedFile {
   std::shared_ptr<const Version> _version VELK_GUARDED_BY(_lock);
 };
 
-/// The lock file of a suite, held by one writer of all processes.
+/// How long a writer waits for the others: it may be a session that holds up more than itself.
+constexpr Duration kLockTime = std::chrono::seconds(1);
+/// After a wait in vain nobody waits again for so long, so that the several settings of one session cost one wait.
+constexpr Duration kHeldMemory = std::chrono::seconds(10);
+/// The system wakes nobody after a time, so the file is tried again and again; and a process that writes many settings
+/// in a row leaves the others this gap to come in.
+constexpr Duration kLockRetry = std::chrono::microseconds(500);
+constexpr Duration kLockGap = std::chrono::milliseconds(1);
+
+/// The way to a suite's lock file in this process: one thread at a time asks for it.
+class SuiteGate {
+ public:
+  explicit SuiteGate(std::string path) : _path(std::move(path)) {}
+
+  [[nodiscard]] const std::string& path() const noexcept { return _path; }
+
+  /// False when another thread was still in at the deadline. The caller counts as blocked.
+  bool enter(SteadyTime deadline) {
+    Guard guard(_lock);
+    while (_isTaken) {
+      if (!_left.waitUntil(_lock, deadline) && _isTaken) return false;
+    }
+    _isTaken = true;
+    return true;
+  }
+  void leave() {
+    {
+      Guard guard(_lock);
+      _isTaken = false;
+    }
+    _left.notifyOne();
+  }
+
+  // Of whoever is in.
+
+  /// Whether the file was found held a moment ago, so that one more attempt must do.
+  [[nodiscard]] bool isKnownToBeHeld(SteadyTime now) const { return now < _heldUntil; }
+  void noteHeld(SteadyTime now) { _heldUntil = now + kHeldMemory; }
+  void noteReleased(SteadyTime now) { _released = now; }
+  [[nodiscard]] Duration gapLeft(SteadyTime now) const { return _released + kLockGap - now; }
+
+ private:
+  const std::string _path;
+  // Used by whoever is in.
+  SteadyTime _heldUntil{};
+  SteadyTime _released{};
+  // Guarded by _lock.
+  Lock _lock;
+  Condition _left;
+  bool _isTaken VELK_GUARDED_BY(_lock) = false;
+};
+
+/// The lock file of a suite, held by one writer of all processes, or the reason why it is not.
 class SuiteLock {
  public:
-  explicit SuiteLock(const std::string& path) {
-    // Failing is usual: the file is there already.
-    (void)files::createEmpty(path);
-    _file = FileDescriptor(::open(path.c_str(), O_RDWR | O_CLOEXEC | O_NOFOLLOW));
-    if (!_file) {
-      _whyNot = errno;
-      return;
-    }
+  explicit SuiteLock(SuiteGate& gate) : _gate(gate) {
     const BlockingScope blocking;
-    while (::flock(_file.get(), LOCK_EX) != 0) {
-      if (errno == EINTR) continue;
-      _whyNot = errno;
-      _file = FileDescriptor();
+    const auto deadline = systemClock().steadyTime() + kLockTime;
+    _isIn = _gate.enter(deadline);
+    if (!_isIn) {
+      _isHeldElsewhere = true;
+      _whyNot = gate.path() + " is held by another thread of this process";
       return;
     }
+    // Failing is usual: the file is there already.
+    (void)files::createEmpty(_gate.path());
+    _file = FileDescriptor(::open(_gate.path().c_str(), O_RDWR | O_CLOEXEC | O_NOFOLLOW));
+    if (!_file || !acquires(deadline)) fail(errno);
   }
   ~SuiteLock() {
     // Closing it would not do: a child that was forked meanwhile has a copy, and would keep everybody out.
-    if (_file) static_cast<void>(::flock(_file.get(), LOCK_UN));
+    if (_file) {
+      static_cast<void>(::flock(_file.get(), LOCK_UN));
+      _gate.noteReleased(systemClock().steadyTime());
+    }
+    if (_isIn) _gate.leave();
   }
   SuiteLock(const SuiteLock&) = delete;
   SuiteLock& operator=(const SuiteLock&) = delete;
   [[nodiscard]] bool held() const noexcept { return static_cast<bool>(_file); }
-  [[nodiscard]] std::string whyNot() const { return std::generic_category().message(_whyNot); }
+  /// Somebody else has it, who may be changing the suite just now.
+  [[nodiscard]] bool isHeldElsewhere() const noexcept { return _isHeldElsewhere; }
+  [[nodiscard]] const std::string& whyNot() const noexcept { return _whyNot; }
 
  private:
+  bool acquires(SteadyTime deadline) {
+    const auto begun = systemClock().steadyTime();
+    if (const auto gap = _gate.gapLeft(begun); gap > Duration::zero()) std::this_thread::sleep_for(gap);
+    for (;;) {
+      if (::flock(_file.get(), LOCK_EX | LOCK_NB) == 0) return true;
+      if (errno == EINTR) continue;
+      if (errno != EWOULDBLOCK) return false;
+      const auto now = systemClock().steadyTime();
+      if (now >= deadline || _gate.isKnownToBeHeld(now)) {
+        // A wait, and not this attempt alone, begins the time in which nobody waits: it ends some day.
+        if (now >= deadline) _gate.noteHeld(now);
+        errno = EWOULDBLOCK;
+        return false;
+      }
+      std::this_thread::sleep_for(kLockRetry);
+    }
+  }
+
+  void fail(int error) {
+    _isHeldElsewhere = error == EWOULDBLOCK;
+    _whyNot = _isHeldElsewhere ? _gate.path() + " is held by another process"
+                               : "cannot lock " + _gate.path() + ": " + std::generic_category().message(error);
+    _file = FileDescriptor();
+  }
+
+  SuiteGate& _gate;
+  bool _isIn = false;
+  bool _isHeldElsewhere = false;
   FileDescriptor _file;
-  int _whyNot = 0;
+  std::string _whyNot;
 };
 
 class FileUserDefaults : public UserDefaults {
  public:
   FileUserDefaults(std::string_view suite, std::string stateDirectory, const std::string& configurationDirectory)
       : _stateDirectory(std::move(stateDirectory)),
-        _lockPath(_stateDirectory + "/" + std::string(suite) + ".lock"),
+        _gate(_stateDirectory + "/" + std::string(suite) + ".lock"),
         _user(_stateDirectory + "/" + std::string(suite) + ".json"),
         _administrator(configurationDirectory.empty() ? ""
                                                       : configurationDirectory + "/" + std::string(suite) + ".json") {}
@@ -218,8 +304,12 @@ class FileUserDefaults : public UserDefaults {
 
   /// Under the suite's lock a corrupt file is what every process sees, so it is moved away once.
   std::shared_ptr<const Version> afterSettingAside(bool isUnreported) const {
-    const SuiteLock suite(_lockPath);
-    return setAsideLocked(isUnreported);
+    const SuiteLock suite(_gate);
+    if (!suite.isHeldElsewhere()) return setAsideLocked(isUnreported);
+    bool isNew = false;
+    auto version = _user.current(isNew);
+    if (isUnreported) log::error("UserDefaults: Cannot use %s: %s; %s", _user.path(), version->problem, suite.whyNot());
+    return version;
   }
 
   std::shared_ptr<const Version> setAsideLocked(bool isUnreported) const {
@@ -251,8 +341,8 @@ class FileUserDefaults : public UserDefaults {
   Result<void> change(const std::function<bool(PropertyDictionary&)>& edit,
                       std::size_t maximumBytes = kMaximumSuiteBytes) {
     if (auto made = files::createDirectories(_stateDirectory, 0700); !made) return made;
-    const SuiteLock suite(_lockPath);
-    if (!suite.held()) return failure("UserDefaults", 1, "cannot lock " + _lockPath + ": " + suite.whyNot());
+    const SuiteLock suite(_gate);
+    if (!suite.held()) return failure("UserDefaults", 1, suite.whyNot());
     const auto version = setAsideLocked(false);
     if (version->usability == Usability::unreadable) {
       return failure("UserDefaults", 2, "cannot read " + _user.path() + ": " + version->problem);
@@ -278,8 +368,8 @@ class FileUserDefaults : public UserDefaults {
 
   // Constant after construction.
   const std::string _stateDirectory;
-  const std::string _lockPath;
   // Self-synchronised.
+  mutable SuiteGate _gate;
   mutable CachedFile _user;
   mutable CachedFile _administrator;
 };

@@ -189,7 +189,7 @@ void FakeDaemon::start() {
   auto listener = Listener::bind(_directory.path() + "/socket", std::move(options));
   if (!listener) throw std::runtime_error(listener.error().description);
   _listener = std::move(*listener);
-  _listener->resume();
+  if (const auto resumed = _listener->resume(); !resumed) throw std::runtime_error(resumed.error().description);
 }
 
 void FakeDaemon::stop() {

@@ -49,8 +49,9 @@ class ListenerTest : public testing::Test {
     auto bound = Listener::bind(path, std::move(with));
     ASSERT_TRUE(bound) << bound.error().description;
     listener = std::move(*bound);
-    listener->resume();
+    ASSERT_TRUE(listener->resume());
   }
+  bool stopsIfUnused() { return Listener::stopIfUnused({&listener, 1}); }
   std::shared_ptr<Connection> connectClient() {
     auto connected = Connection::connect(path, loop, loop.makeLoopQueue("client"));
     EXPECT_TRUE(connected);
@@ -74,12 +75,12 @@ TEST_F(ListenerTest, StopsUnusedOnlyWhileNobodyIsThere) {
     const auto client = connectClient();
     ASSERT_TRUE(client);
     client->resume();
-    EXPECT_FALSE(listener->stopIfUnused());
+    EXPECT_FALSE(stopsIfUnused());
     client->invalidate();
   }
   EXPECT_TRUE(invalidations.wait());
   // The connection is counted until its socket has been closed, which follows its handler.
-  while (!listener->stopIfUnused()) std::this_thread::yield();
+  while (!stopsIfUnused()) std::this_thread::yield();
   EXPECT_FALSE(Connection::connect(path, loop, loop.makeLoopQueue("late")));
 }
 
@@ -123,7 +124,7 @@ TEST_F(ListenerTest, AdoptsAnInheritedSocketAndLeavesItsPath) {
   listener = std::move(*adopted);
   const auto early = connectClient();
   EXPECT_TRUE(listener->hasWaitingConnection());
-  listener->resume();
+  ASSERT_TRUE(listener->resume());
   Event answered;
   early->resume();
   ASSERT_TRUE(early->callMethod(2, {1}, [&](Result<PropertyArray> result) {
@@ -173,6 +174,154 @@ TEST_F(ListenerTest, KnowsThePeer) {
   ASSERT_TRUE(asked.wait());
   EXPECT_EQ(peer.uid, ::getuid());
   EXPECT_EQ(peer.pid, ::getpid());
+}
+
+TEST_F(ListenerTest, AsksForNoProgramThatNobodyNeeds) {
+  auto with = options();
+  std::atomic<int> lookUps{0};
+  with.findExecutable = [&](std::int32_t, std::uint32_t) {
+    ++lookUps;
+    return std::optional<std::string>("/bin/x");
+  };
+  Event asked;
+  std::string executable = "not asked";
+  with.shouldAcceptNewConnection = [&](const std::shared_ptr<Connection>& connection) {
+    executable = connection->peer().executable;
+    asked.happen();
+    return false;
+  };
+  listen(std::move(with));
+  connectClient()->invalidate();
+  ASSERT_TRUE(asked.wait());
+  EXPECT_EQ(executable, "");
+  EXPECT_EQ(lookUps, 0);
+}
+
+TEST_F(ListenerTest, ALookUpThatDoesNotReturnHoldsUpItsPeerAlone) {
+  auto with = options();
+  Event lookedUp;
+  Event diskAnswers;
+  std::atomic<int> peers{0};
+  with.dependsOnExecutable = [&](const PeerCredentials&) { return peers++ == 0; };
+  with.findExecutable = [&](std::int32_t, std::uint32_t) {
+    lookedUp.happen();
+    EXPECT_TRUE(diskAnswers.wait());
+    return std::optional<std::string>("/bin/slow");
+  };
+  Event decided;
+  std::vector<std::string> executables;
+  with.shouldAcceptNewConnection = [&](const std::shared_ptr<Connection>& connection) {
+    executables.push_back(connection->peer().executable);
+    decided.happen();
+    return false;
+  };
+  listen(std::move(with));
+  const auto slow = connectClient();
+  EXPECT_TRUE(lookedUp.wait());
+  const auto other = connectClient();
+  EXPECT_TRUE(decided.wait());
+  diskAnswers.happen();
+  EXPECT_TRUE(decided.wait());
+  EXPECT_EQ(executables, (std::vector<std::string>{"", "/bin/slow"}));
+}
+
+TEST_F(ListenerTest, LooksForTheProgramsOfAFewPeersOfAUserAtOnce) {
+  auto with = options();
+  constexpr int kPeers = static_cast<int>(ipc::kMaximumLookUpsPerUser) + 3;
+  std::atomic<int> underWay{0};
+  std::atomic<int> most{0};
+  Event lookedUp;
+  Event diskAnswers;
+  with.dependsOnExecutable = [](const PeerCredentials&) { return true; };
+  with.findExecutable = [&](std::int32_t, std::uint32_t) {
+    most = std::max<int>(most, ++underWay);
+    lookedUp.happen();
+    EXPECT_TRUE(diskAnswers.wait());
+    --underWay;
+    return std::optional<std::string>();
+  };
+  Event decided;
+  with.shouldAcceptNewConnection = [&](const std::shared_ptr<Connection>&) {
+    decided.happen();
+    return false;
+  };
+  listen(std::move(with));
+  std::vector<std::shared_ptr<Connection>> clients;
+  for (int peer = 0; peer < kPeers; ++peer) clients.push_back(connectClient());
+  for (std::size_t peer = 0; peer < ipc::kMaximumLookUpsPerUser; ++peer) ASSERT_TRUE(lookedUp.wait());
+  for (int peer = 0; peer < kPeers; ++peer) diskAnswers.happen();
+  for (int peer = 0; peer < kPeers; ++peer) ASSERT_TRUE(decided.wait());
+  EXPECT_LE(most, static_cast<int>(ipc::kMaximumLookUpsPerUser));
+}
+
+TEST_F(ListenerTest, ClosesWhoeverIsStillBeingLookedAtWhenItStops) {
+  auto with = options();
+  Event lookedUp;
+  Event diskAnswers;
+  with.dependsOnExecutable = [](const PeerCredentials&) { return true; };
+  with.findExecutable = [&](std::int32_t, std::uint32_t) {
+    lookedUp.happen();
+    EXPECT_TRUE(diskAnswers.wait());
+    return std::optional<std::string>();
+  };
+  std::atomic<int> decisions{0};
+  with.shouldAcceptNewConnection = [&](const std::shared_ptr<Connection>&) {
+    ++decisions;
+    return false;
+  };
+  listen(std::move(with));
+  const auto client = connectClient();
+  ASSERT_TRUE(lookedUp.wait());
+  listener->stop();
+  EXPECT_TRUE(listener->waitUntilDecided(Duration::zero())) << "nothing is being decided";
+  diskAnswers.happen();
+  while (listener->openConnections() != 0) std::this_thread::yield();
+  EXPECT_EQ(decisions, 0);
+}
+
+TEST_F(ListenerTest, WaitsForTheDecisionThatIsUnderWay) {
+  auto with = options();
+  Event asked;
+  Event answers;
+  with.shouldAcceptNewConnection = [&](const std::shared_ptr<Connection>&) {
+    asked.happen();
+    EXPECT_TRUE(answers.wait());
+    return false;
+  };
+  listen(std::move(with));
+  const auto client = connectClient();
+  ASSERT_TRUE(asked.wait());
+  listener->stop();
+  EXPECT_FALSE(listener->waitUntilDecided(std::chrono::milliseconds(1)));
+  answers.happen();
+  EXPECT_TRUE(listener->waitUntilDecided(kPatience));
+}
+
+TEST_F(ListenerTest, SaysThatItCannotListen) {
+  auto bound = Listener::bind(path, options());
+  ASSERT_TRUE(bound);
+  loop.stop();
+  EXPECT_FALSE((*bound)->resume());
+}
+
+TEST_F(ListenerTest, StopsSeveralOnlyWhileAllAreUnused) {
+  std::vector<std::unique_ptr<Listener>> both;
+  const std::string second = directory.path() + "/second";
+  for (const auto& each : {path, second}) {
+    auto bound = Listener::bind(each, options());
+    ASSERT_TRUE(bound);
+    ASSERT_TRUE((*bound)->resume());
+    both.push_back(std::move(*bound));
+  }
+  auto client = Connection::connect(second, loop, loop.makeLoopQueue("client"));
+  ASSERT_TRUE(client);
+  (*client)->resume();
+  EXPECT_FALSE(Listener::stopIfUnused(both));
+  EXPECT_NE(connectClient(), nullptr) << "the first one listens as well";
+  (*client)->invalidate();
+  while (!Listener::stopIfUnused(both)) std::this_thread::yield();
+  EXPECT_FALSE(Connection::connect(path, loop, loop.makeLoopQueue("late")));
+  EXPECT_FALSE(Connection::connect(second, loop, loop.makeLoopQueue("late")));
 }
 
 TEST_F(ListenerTest, BoundsTheConnectionsOfAUser) {

@@ -7,6 +7,8 @@
 #include <unistd.h>
 
 #include <filesystem>
+#include <set>
+#include <vector>
 
 #include "platform/FileDescriptor.h"
 #include "tests/support/RecordingLog.h"
@@ -24,12 +26,13 @@ class EntitlementsTest : public testing::Test {
   std::string grant(std::string_view text, std::string_view file = "test.conf") const {
     return directory.write("entitlements.d/" + std::string(file), text);
   }
-  [[nodiscard]] EntitlementRules rules() const { return EntitlementRules::load(directory.path()); }
+  [[nodiscard]] LoadedEntitlements loaded() const { return EntitlementRules::load(directory.path()); }
+  [[nodiscard]] EntitlementRules rules() const { return loaded().rules; }
   [[nodiscard]] bool holds(const PeerCredentials& peer) const { return rules().valueOfEntitlement(kName, peer); }
 
   test::RecordingLog log;
   const test::TemporaryDirectory directory;
-  const PeerCredentials somebody{kSomebody, kSomeGroup, 1, "/usr/bin/agent"};
+  const PeerCredentials somebody{kSomebody, kSomeGroup, 1, "/usr/bin/agent", {}};
 };
 
 TEST_F(EntitlementsTest, GrantsNobodyByDefault) {
@@ -40,27 +43,66 @@ TEST_F(EntitlementsTest, GrantsNobodyByDefault) {
 }
 
 TEST_F(EntitlementsTest, GrantsRootAndItself) {
-  EXPECT_TRUE(holds({0, 0, 1, ""}));
-  EXPECT_TRUE(holds({::geteuid(), ::getegid(), 1, ""}));
+  EXPECT_TRUE(holds({0, 0, 1, "", {}}));
+  EXPECT_TRUE(holds({::geteuid(), ::getegid(), 1, "", {}}));
 }
 
 TEST_F(EntitlementsTest, GrantsNamedUsers) {
   grant("[com.tavrin.private.velkreportingd]\nusers = 54320, 54321 ,nobody\n");
   EXPECT_TRUE(holds(somebody));
-  EXPECT_TRUE(holds({65534, 65534, 1, ""}));
-  EXPECT_FALSE(holds({54319, kSomeGroup, 1, ""}));
+  EXPECT_TRUE(holds({65534, 65534, 1, "", {}}));
+  EXPECT_FALSE(holds({54319, kSomeGroup, 1, "", {}}));
 }
 
 TEST_F(EntitlementsTest, GrantsNamedGroups) {
   grant("[com.tavrin.private.velkreportingd]\ngroups=54322\n");
   EXPECT_TRUE(holds(somebody));
-  EXPECT_FALSE(holds({kSomebody, 1, 1, ""}));
+  EXPECT_FALSE(holds({kSomebody, 1, 1, "", {}}));
 }
 
-TEST_F(EntitlementsTest, CountsTheGroupsOfTheUser) {
+TEST_F(EntitlementsTest, CountsTheSupplementaryGroupsOfTheProcess) {
+  grant("[com.tavrin.private.velkreportingd]\ngroups=54323\n");
+  EXPECT_TRUE(holds({kSomebody, kSomeGroup, 1, "", {7, 54323}}));
+  EXPECT_FALSE(holds({kSomebody, kSomeGroup, 1, "", {7, 8}}));
+}
+
+TEST_F(EntitlementsTest, DoesNotCountGroupsThatTheUserHasAndTheProcessHasNot) {
   // A user whose primary group is known to the system, running with another one.
   grant("[com.tavrin.private.velkreportingd]\ngroups=daemon\n");
-  EXPECT_TRUE(holds({1, 4, 1, ""}));
+  EXPECT_FALSE(holds({1, 4, 1, "", {}}));
+}
+
+TEST_F(EntitlementsTest, NamesTheNamesThatNobodyKnows) {
+  const auto path = grant("[com.tavrin.private.velkreportingd]\nusers=no-such-user, 54321\ngroups=no-such-group\n");
+  EXPECT_TRUE(holds(somebody));
+  EXPECT_EQ(log.count(log::Level::error, "Entitlements: " + path + ":2: there is no user no-such-user"), 1);
+  EXPECT_EQ(log.count(log::Level::error, "Entitlements: " + path + ":3: there is no group no-such-group"), 1);
+  EXPECT_EQ(log.lines().size(), 2U);
+}
+
+TEST_F(EntitlementsTest, NeedsAProgramOnlyForThePeersOfGrantsThatNameOne) {
+  grant(
+      "[com.tavrin.private.velkreportingd]\nusers=54321\n"
+      "[com.tavrin.private.velkreportingd]\ngroups=54399\nexecutables=/usr/bin/agent\n");
+  EXPECT_FALSE(rules().dependOnExecutable(somebody));
+  EXPECT_TRUE(rules().dependOnExecutable({1, 54399, 1, "", {}}));
+  EXPECT_FALSE(rules().dependOnExecutable({0, 54399, 1, "", {}})) << "root has everything anyway";
+  EXPECT_FALSE(rules().dependOnExecutable(PeerCredentials{}));
+}
+
+TEST_F(EntitlementsTest, SaysWhichFileCannotBeRead) {
+  grant("[com.tavrin.private.velkreportingd]\nusers=54321\n", "a.conf");
+  std::filesystem::create_directory(directory / "entitlements.d/b.conf");
+  const auto read = loaded();
+  EXPECT_EQ(read.rules.grantCount(), 1);
+  ASSERT_EQ(read.unreadable.size(), 1U);
+  EXPECT_NE(read.unreadable[0].description.find("entitlements.d/b.conf is not a regular file"), std::string::npos);
+}
+
+TEST_F(EntitlementsTest, SaysThatTheDirectoryCannotBeRead) {
+  static_cast<void>(directory.write("entitlements.d", "no directory"));
+  ASSERT_EQ(loaded().unreadable.size(), 1U);
+  EXPECT_NE(loaded().unreadable[0].description.find("entitlements.d"), std::string::npos);
 }
 
 TEST_F(EntitlementsTest, IsBoundToTheNameOfTheSection) {
@@ -72,9 +114,9 @@ TEST_F(EntitlementsTest, IsBoundToTheNameOfTheSection) {
 TEST_F(EntitlementsTest, NarrowsAGrantToExecutables) {
   grant("[com.tavrin.private.velkreportingd]\nusers=54321\nexecutables=/usr/bin/agent, /usr/bin/other\n");
   EXPECT_TRUE(holds(somebody));
-  EXPECT_FALSE(holds({kSomebody, kSomeGroup, 1, "/tmp/agent"}));
-  EXPECT_FALSE(holds({kSomebody, kSomeGroup, 1, ""}));
-  EXPECT_FALSE(holds({54319, kSomeGroup, 1, "/usr/bin/agent"}));
+  EXPECT_FALSE(holds({kSomebody, kSomeGroup, 1, "/tmp/agent", {}}));
+  EXPECT_FALSE(holds({kSomebody, kSomeGroup, 1, "", {}}));
+  EXPECT_FALSE(holds({54319, kSomeGroup, 1, "/usr/bin/agent", {}}));
 }
 
 TEST_F(EntitlementsTest, GrantsNothingToAnExecutableAlone) {
@@ -97,7 +139,7 @@ TEST_F(EntitlementsTest, TakesSectionsOfOneNameApart) {
       "[com.tavrin.private.velkreportingd]\nusers=54320\n"
       "[com.tavrin.private.velkreportingd]\nexecutables=/usr/bin/agent\ngroups=1\n");
   EXPECT_FALSE(holds(somebody));
-  EXPECT_TRUE(holds({54320, kSomeGroup, 1, ""}));
+  EXPECT_TRUE(holds({54320, kSomeGroup, 1, "", {}}));
 }
 
 TEST_F(EntitlementsTest, ReadsEveryConfigurationFile) {
@@ -105,7 +147,7 @@ TEST_F(EntitlementsTest, ReadsEveryConfigurationFile) {
   grant("[com.tavrin.private.velkreportingd]\nusers=54321\n", "b.conf");
   grant("[com.tavrin.private.velkreportingd]\nusers=54322\n", "c.conf.bak");
   EXPECT_TRUE(holds(somebody));
-  EXPECT_FALSE(holds({54322, 1, 1, ""}));
+  EXPECT_FALSE(holds({54322, 1, 1, "", {}}));
   EXPECT_EQ(rules().grantCount(), 2U);
 }
 
@@ -135,7 +177,7 @@ TEST_F(EntitlementsTest, NamesTheLineOfWhatItDoesNotUnderstand) {
       "[\n"
       "users=54320\n");
   EXPECT_TRUE(holds(somebody));
-  EXPECT_FALSE(holds({54320, 1, 1, ""}));
+  EXPECT_FALSE(holds({54320, 1, 1, "", {}}));
   log.clear();
   (void)rules();
   EXPECT_EQ(log.count("Entitlements: " + path + ":1: a setting outside of a section"), 1);
@@ -165,7 +207,11 @@ TEST_F(EntitlementsTest, TellsWhoIsAtTheOtherEnd) {
   EXPECT_EQ(peer->uid, ::geteuid());
   EXPECT_EQ(peer->gid, ::getegid());
   EXPECT_EQ(peer->pid, ::getpid());
-  EXPECT_FALSE(peer->executable.empty());
+  EXPECT_EQ(peer->executable, "") << "nobody asks the file system for it";
+  std::vector<gid_t> groups(static_cast<std::size_t>(::getgroups(0, nullptr)));
+  ASSERT_EQ(::getgroups(static_cast<int>(groups.size()), groups.data()), static_cast<int>(groups.size()));
+  EXPECT_EQ(std::multiset<gid_t>(peer->groups.begin(), peer->groups.end()),
+            std::multiset<gid_t>(groups.begin(), groups.end()));
   EXPECT_EQ(credentialsOfPeer(-1), std::nullopt);
 }
 

@@ -53,6 +53,15 @@ TEST_F(PersistentIdentifierTest, AnswersEvenWhenNothingCanBeStored) {
   EXPECT_TRUE(log.contains("persistentIdentifier: Cannot store uuidRespectDNU: "));
 }
 
+TEST_F(PersistentIdentifierTest, StaysTheSameWhileItCannotBeStored) {
+  defaults.setFailsWrites(true);
+  const auto first = getPersistentIdentifierForDNU(defaults, true);
+  EXPECT_EQ(getPersistentIdentifierForDNU(defaults, true), first);
+  defaults.setFailsWrites(false);
+  EXPECT_EQ(getPersistentIdentifierForDNU(defaults, true), first);
+  EXPECT_EQ(defaults.value("uuidRespectDNU"), PropertyValue(first));
+}
+
 TEST_F(PersistentIdentifierTest, ReplacesWhatIsNoIdentifier) {
   defaults.put("uuidRespectDNU", 7);
   const auto identifier = getPersistentIdentifierForDNU(defaults, true);

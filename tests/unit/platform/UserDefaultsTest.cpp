@@ -8,9 +8,11 @@
 #include <sys/wait.h>
 #include <unistd.h>
 
+#include <chrono>
 #include <thread>
 #include <vector>
 
+#include "platform/FileDescriptor.h"
 #include "platform/Files.h"
 #include "platform/Platform.h"
 #include "tests/support/FakeUserDefaults.h"
@@ -247,6 +249,79 @@ TEST_F(UserDefaultsTest, ChildrenForkedDuringAWriteKeepNobodyOut) {
   ::kill(child, SIGKILL);
   int status = 0;
   EXPECT_EQ(::waitpid(child, &status, 0), child);
+}
+
+class HeldSuiteTest : public UserDefaultsTest {
+ protected:
+  /// As another process would hold it.
+  void hold() {
+    ASSERT_TRUE(open()->set("before", 1));
+    lock = FileDescriptor(::open((directory / "state/suite.lock").c_str(), O_RDWR | O_CLOEXEC));
+    ASSERT_EQ(::flock(lock.get(), LOCK_EX | LOCK_NB), 0);
+  }
+  template <class Work>
+  static std::chrono::steady_clock::duration timeOf(Work work) {
+    const auto begun = std::chrono::steady_clock::now();
+    work();
+    return std::chrono::steady_clock::now() - begun;
+  }
+
+  FileDescriptor lock;
+};
+
+TEST_F(HeldSuiteTest, IsReadAsEver) {
+  hold();
+  EXPECT_EQ(open()->value("before"), PropertyValue(1));
+}
+
+TEST_F(HeldSuiteTest, SaysAfterASecondWhichFileIsHeld) {
+  hold();
+  const auto suite = open();
+  const auto stored = suite->set("key", 1);
+  ASSERT_FALSE(stored);
+  EXPECT_EQ(stored.error().description, directory / "state/suite.lock" + " is held by another process");
+}
+
+TEST_F(HeldSuiteTest, CostsOneWaitForManySettings) {
+  hold();
+  const auto suite = open();
+  const auto first = timeOf([&] { EXPECT_FALSE(suite->set("key", 1)); });
+  const auto others = timeOf([&] {
+    for (int key = 0; key < 100; ++key) EXPECT_FALSE(suite->set(std::to_string(key), key));
+  });
+  EXPECT_GE(first, std::chrono::milliseconds(900));
+  EXPECT_LT(others, 10 * first) << "a hundred waits would take a hundred times as long";
+  lock = FileDescriptor();
+  EXPECT_TRUE(suite->set("key", 1)) << "once it is free it can be written at once";
+}
+
+TEST_F(HeldSuiteTest, LetsThreadsWaitTogether) {
+  hold();
+  const auto suite = open();
+  const auto all = timeOf([&] {
+    std::vector<std::thread> threads;
+    for (int thread = 0; thread < 8; ++thread) threads.emplace_back([&] { EXPECT_FALSE(suite->set("key", 1)); });
+    for (auto& thread : threads) thread.join();
+  });
+  EXPECT_LT(all, std::chrono::seconds(5));
+}
+
+TEST_F(HeldSuiteTest, IsWrittenByWhoeverWaitedLongEnough) {
+  hold();
+  const auto suite = open();
+  std::thread holder([&] {
+    std::this_thread::sleep_for(std::chrono::milliseconds(20));
+    lock = FileDescriptor();
+  });
+  EXPECT_TRUE(suite->set("key", 1));
+  holder.join();
+}
+
+TEST_F(HeldSuiteTest, LeavesACorruptFileWhereItIs) {
+  hold();
+  ASSERT_TRUE(files::writeAtomically(directory / "state/suite.json", ByteData{'{'}));
+  EXPECT_EQ(open()->value("before"), std::nullopt);
+  EXPECT_TRUE(files::exists(directory / "state/suite.json"));
 }
 
 TEST_F(UserDefaultsTest, LosesNoKeyOfThreadsThatWriteAtOnce) {
