@@ -46,7 +46,10 @@ Daemon::Daemon(ReportingServer& server, const Options& options) : _server(server
   require(defaults->set("velkreporting_storebag_url", server.url("/bags/vindle")));
   if (options.consent) require(defaults->set(kDiagnosticsAndUsageSetting, true));
   for (const auto& entry : options.defaults) require(defaults->set(entry.key, entry.value));
-  if (options.user) giveAllTo(directory(), *options.user);
+  if (options.user) {
+    giveAllTo(directory(), *options.user);
+    std::filesystem::permissions(server.tls().caFile(), std::filesystem::perms(0644));
+  }
   if (options.starts) start();
 }
 
@@ -67,7 +70,7 @@ std::map<std::string, std::string> Daemon::environment() const {
 
 void Daemon::start() {
   ChildProcess::Options child;
-  if (_options.threads) child.command = {"prlimit", "--nproc=" + std::to_string(*_options.threads)};
+  if (_options.threads) child.command = {"/usr/bin/prlimit", "--nproc=" + std::to_string(*_options.threads)};
   child.command.insert(child.command.end(), {daemonProgram(), "--socket", socketPath()});
   child.command.insert(child.command.end(), _options.arguments.begin(), _options.arguments.end());
   child.user = _options.user;
