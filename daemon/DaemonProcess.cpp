@@ -64,9 +64,21 @@ std::optional<Duration> idleLimit(const DaemonOptions& options, bool activated) 
   return activated ? std::optional(kActivatedIdleLimit) : std::nullopt;
 }
 
+constexpr char kSessionQueue[] = "com.tavrin.velkreportingd.session";
+
 ThreadPoolOptions poolOptions() {
   ThreadPoolOptions options;
   options.emergencyThreads = kEmergencyThreads;
+  // Calls wait for storebags and for room, uploads for servers, foreign code for anything.
+  options.patientQueues = {kSessionQueue, "com.tavrin.velkreportingd.uploads", "com.tavrin.VelkReporting.quillAdaptor"};
+  options.keptThreads = 1;
+  return options;
+}
+
+/// Its tasks wait for nobody: one thread is enough to get on.
+ThreadPoolOptions storebagPoolOptions() {
+  ThreadPoolOptions options;
+  options.keptThreads = 1;
   return options;
 }
 
@@ -227,7 +239,7 @@ Listener::Options DaemonProcess::Parts::listenerOptions() {
   Listener::Options options;
   options.loop = &eventLoop;
   options.acceptQueue = acceptQueue;
-  options.makeDeliveryQueue = [this] { return pool->makeSerialQueue("com.tavrin.velkreportingd.session"); };
+  options.makeDeliveryQueue = [this] { return pool->makeSerialQueue(kSessionQueue); };
   options.shouldAcceptNewConnection = [this](const std::shared_ptr<Connection>& connection) {
     return agent->shouldAcceptNewConnection(makeIncomingConnection(
         connection, [this](std::string_view name, const Connection& asked) { return hasEntitlement(name, asked); }));

@@ -30,7 +30,9 @@ class SerialQueueCore::HandOver {
   ~HandOver() { (*this)(); }
 
   void operator()() noexcept {
-    if (_waiter != nullptr) _core->_handOverTo = std::exchange(_waiter, nullptr);
+    if (_waiter == nullptr) return;
+    _waiter->isNext = true;
+    _core->_handOverTo = std::exchange(_waiter, nullptr);
   }
 
  private:
@@ -38,38 +40,60 @@ class SerialQueueCore::HandOver {
   Waiter* _waiter;
 };
 
-SerialQueueCore::SerialQueueCore(std::shared_ptr<QueueRunner> runner, std::string label)
-    : _runner(std::move(runner)), _label(std::move(label)), _shortName(lastComponent(_label)) {}
+SerialQueueCore::SerialQueueCore(std::shared_ptr<QueueRunner> runner, std::string label, bool isPatient)
+    : _runner(std::move(runner)), _label(std::move(label)), _shortName(lastComponent(_label)), _isPatient(isPatient) {}
 
 void SerialQueueCore::async(Task task) {
   if (_fork.forked()) return;
   {
     Guard guard(_lock);
     _incoming.push_back(std::move(task));
-    if (std::exchange(_owned, true)) return;
+    if (_owner != Owner::nobody || !entersRunnerLocked()) return;
   }
-  if (!_runner->schedule(shared_from_this())) drain(false);
+  scheduleTurn(false);
+}
+
+/// True when the runner is to be told.
+bool SerialQueueCore::entersRunnerLocked() {
+  _owner = Owner::runner;
+  return !std::exchange(_isScheduled, true);
+}
+
+void SerialQueueCore::scheduleTurn(bool runsWhenStopped) {
+  if (!_runner->schedule(shared_from_this()) && beginsTurn()) drain(runsWhenStopped);
 }
 
 void SerialQueueCore::runSync(void (*work)(void*), void* context) noexcept {
   if (CurrentQueueScope::contains(this) || _fork.forked()) return work(context);
   const auto self = shared_from_this();  // `work` may drop the queue's last reference.
   Waiter waiter;
-  bool waits = false;
+  bool sleeps = false;
   {
     Guard guard(_lock);
-    waits = std::exchange(_owned, true);
-    if (waits) _incoming.emplace_back(HandOver(*this, waiter));
+    sleeps = _owner == Owner::thread;
+    if (_owner == Owner::nobody) {
+      waiter.isNext = true;
+    } else {
+      _incoming.emplace_back(HandOver(*this, waiter));
+    }
+    if (sleeps) {
+      _waiters.push_back(&waiter);
+    } else {
+      _owner = Owner::thread;
+    }
   }
-  if (waits) waiter.owns.wait();
+  if (sleeps) waiter.owns.wait();
   {
     CurrentQueueScope current(this);
+    while (!waiter.isNext && nextIsReady()) perform(true);
+    _handOverTo = nullptr;
     work(context);
   }
   release();
 }
 
 void SerialQueueCore::runTurn() noexcept {
+  if (!beginsTurn()) return;
   CurrentQueueScope current(this);
   do {
     for (unsigned done = 0; done < kTasksPerTurn; ++done) {
@@ -77,7 +101,35 @@ void SerialQueueCore::runTurn() noexcept {
       perform(true);
       if (handsOver()) return;
     }
-  } while (!_runner->yield(shared_from_this()));
+  } while (!leavesTurn());
+}
+
+/// False when the queue is not the runner's any more.
+bool SerialQueueCore::beginsTurn() {
+  Guard guard(_lock);
+  _isScheduled = false;
+  if (_owner != Owner::runner) return false;
+  _owner = Owner::thread;
+  return true;
+}
+
+/// False when the turn goes on, since nobody else wants the thread.
+bool SerialQueueCore::leavesTurn() {
+  if (_fork.forked() || wakesWaiterOrEntersRunner() == Next::waiter) return true;
+  return _runner->yield(shared_from_this()) || !beginsTurn();
+}
+
+/// The owner lets go, with tasks left. A sync that waits goes on with them: the runner may have no thread for that.
+SerialQueueCore::Next SerialQueueCore::wakesWaiterOrEntersRunner() {
+  Waiter* first = nullptr;
+  {
+    Guard guard(_lock);
+    if (_waiters.empty()) return entersRunnerLocked() ? Next::runner : Next::runnerThatKnows;
+    first = _waiters.front();
+    _waiters.erase(_waiters.begin());
+  }
+  first->owns.signal();
+  return Next::waiter;
 }
 
 /// False when there is none: the queue has become idle, and is no longer the caller's.
@@ -91,7 +143,7 @@ bool SerialQueueCore::takesBatch() {
   Guard guard(_lock);
   if (_incoming.empty()) {
     if (_incoming.capacity() > kKeptCapacity) surplus.swap(_incoming);
-    _owned = false;
+    _owner = Owner::nobody;
     return false;
   }
   _batch.swap(_incoming);
@@ -108,14 +160,17 @@ void SerialQueueCore::perform(bool run) noexcept {
 bool SerialQueueCore::handsOver() {
   auto* const waiter = std::exchange(_handOverTo, nullptr);
   if (waiter == nullptr) return false;
+  {
+    Guard guard(_lock);
+    _waiters.erase(_waiters.begin());  // they were told of in the order of their work
+  }
   waiter->owns.signal();
   return true;
 }
 
 /// The end of a `sync`.
 void SerialQueueCore::release() noexcept {
-  if (!nextIsReady()) return;
-  if (!_runner->schedule(shared_from_this())) drain(true);
+  if (nextIsReady() && wakesWaiterOrEntersRunner() == Next::runner) scheduleTurn(true);
 }
 
 /// The end of a queue whose runner was stopped: what was handed over during a `sync` runs, anything later is dropped.
@@ -154,9 +209,9 @@ class SerialQueue final : public Queue {
 }  // namespace
 
 std::shared_ptr<Queue> makeSerialQueue(std::shared_ptr<QueueRunner> runner, std::shared_ptr<TimerService> timers,
-                                       std::string label) {
-  return std::make_shared<SerialQueue>(std::make_shared<SerialQueueCore>(std::move(runner), std::move(label)),
-                                       std::move(timers));
+                                       std::string label, bool isPatient) {
+  return std::make_shared<SerialQueue>(
+      std::make_shared<SerialQueueCore>(std::move(runner), std::move(label), isPatient), std::move(timers));
 }
 
 }  // namespace velk

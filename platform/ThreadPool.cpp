@@ -1,6 +1,7 @@
 #include "platform/ThreadPool.h"
 
 #include <algorithm>
+#include <cstdint>
 #include <cstdio>
 #include <cstdlib>
 #include <deque>
@@ -21,22 +22,64 @@
 namespace velk {
 namespace {
 
+/// When the system refused a thread and work waits, it is asked again after this.
+constexpr Duration kPauseAfterRefusal = std::chrono::milliseconds(100);
+
+/// The queues that wait for a thread, in order. Not synchronised.
+class ReadyQueues {
+ public:
+  using QueuePointer = std::shared_ptr<SerialQueueCore>;
+
+  void push(QueuePointer queue) {
+    auto& line = queue->isPatient() ? _patient : _others;
+    line.push_back({++_last, std::move(queue)});
+  }
+  [[nodiscard]] bool empty() const noexcept { return _patient.empty() && _others.empty(); }
+  /// Without a patient queue unless one `mayBePatient`.
+  [[nodiscard]] bool hasOne(bool mayBePatient) const noexcept {
+    return !_others.empty() || (mayBePatient && !_patient.empty());
+  }
+  /// There is one.
+  QueuePointer take(bool mayBePatient) {
+    const bool isPatient =
+        mayBePatient && !_patient.empty() && (_others.empty() || _patient.front().number < _others.front().number);
+    auto& line = isPatient ? _patient : _others;
+    auto queue = std::move(line.front().queue);
+    line.pop_front();
+    return queue;
+  }
+
+ private:
+  struct Entry {
+    std::uint64_t number;
+    QueuePointer queue;
+  };
+  std::uint64_t _last = 0;
+  std::deque<Entry> _others;
+  std::deque<Entry> _patient;
+};
+
 /// The pool's threads and the queues that wait for one. Its counts are exact: whoever wakes or starts a thread counts
 /// it as running at once. What holds whenever nobody has the lock: while queues wait, `runningThreads` threads run,
-/// or all that may exist do, or (with emergency threads) at least one does.
+/// or all that may exist do, or (with emergency threads) at least one does, or the queues are patient and the threads
+/// that are left are kept from them, or the system refused a thread.
 ///
 /// A task may fork. The child has that task's thread alone, and perhaps the lock as another thread held it: there the
 /// pool does nothing, and the thread ends with its task.
 class PoolCore final : public QueueRunner, public BlockingObserver, public std::enable_shared_from_this<PoolCore> {
  public:
-  explicit PoolCore(const ThreadPoolOptions& options)
+  PoolCore(const ThreadPoolOptions& options, std::function<void(Task)> retryLater)
       : _runningThreads(options.runningThreads != 0 ? options.runningThreads
                                                     : std::max(2u, std::thread::hardware_concurrency())),
         _maximumThreads(std::max<std::size_t>(options.maximumThreads, 1)),
         _maximumWhenBlocked(_maximumThreads + options.emergencyThreads),
         _idleThreadLifetime(options.idleThreadLifetime),
+        _keptThreads(options.keptThreads),
         _isNeverStopped(options.isNeverStopped),
-        _retryLater(options.retryLater) {}
+        _retryLater(std::move(retryLater)) {}
+
+  /// Once, before anything else.
+  void startKeptThreads();
 
   bool schedule(std::shared_ptr<SerialQueueCore> queue) override;
   bool yield(const std::shared_ptr<SerialQueueCore>& queue) override;
@@ -60,6 +103,9 @@ class PoolCore final : public QueueRunner, public BlockingObserver, public std::
   void retryStarting();
   void work();
   std::shared_ptr<SerialQueueCore> nextQueue();
+  [[nodiscard]] bool mayRunPatientLocked() const VELK_REQUIRES(_lock);
+  [[nodiscard]] bool isKeptLocked() const VELK_REQUIRES(_lock);
+  void endPatientTurn();
   bool parksLocked() VELK_REQUIRES(_lock);
   void endThread();
 
@@ -68,6 +114,7 @@ class PoolCore final : public QueueRunner, public BlockingObserver, public std::
   const std::size_t _maximumThreads;
   const std::size_t _maximumWhenBlocked;
   const Duration _idleThreadLifetime;
+  const std::size_t _keptThreads;
   const bool _isNeverStopped;
   const std::function<void(Task)> _retryLater;
   const ForkGuard _fork;
@@ -75,11 +122,15 @@ class PoolCore final : public QueueRunner, public BlockingObserver, public std::
   // Guarded by _lock, under which nobody is called.
   mutable Lock _lock;
   Condition _becameIdle;
-  std::deque<std::shared_ptr<SerialQueueCore>> _ready VELK_GUARDED_BY(_lock);
+  ReadyQueues _ready VELK_GUARDED_BY(_lock);
   std::vector<IdleThread*> _idle VELK_GUARDED_BY(_lock);
   /// Running, idle and blocked ones.
   std::size_t _total VELK_GUARDED_BY(_lock) = 0;
   std::size_t _running VELK_GUARDED_BY(_lock) = 0;
+  /// Those that have begun to work: a thread that is being started may yet be refused.
+  std::size_t _arrived VELK_GUARDED_BY(_lock) = 0;
+  /// Those that run a patient queue.
+  std::size_t _patient VELK_GUARDED_BY(_lock) = 0;
   /// Counted, but not in `_threads` yet.
   std::size_t _starting VELK_GUARDED_BY(_lock) = 0;
   bool _refused VELK_GUARDED_BY(_lock) = false;
@@ -93,13 +144,25 @@ class PoolCore final : public QueueRunner, public BlockingObserver, public std::
 /// Whether the current thread is one of this pool.
 thread_local const PoolCore* currentPool = nullptr;
 
+void PoolCore::startKeptThreads() {
+  for (std::size_t number = 0; number < _keptThreads; ++number) {
+    {
+      Guard guard(_lock);
+      ++_total;
+      ++_running;
+      ++_starting;
+    }
+    startOne();
+  }
+}
+
 bool PoolCore::schedule(std::shared_ptr<SerialQueueCore> queue) {
   if (_fork.forked()) return false;
   bool starts = false;
   {
     Guard guard(_lock);
     if (_stopped) return false;
-    _ready.push_back(std::move(queue));
+    _ready.push(std::move(queue));
     starts = wakesOneLocked();
   }
   if (starts) startOne();
@@ -110,7 +173,7 @@ bool PoolCore::yield(const std::shared_ptr<SerialQueueCore>& queue) {
   if (_fork.forked()) return true;  // nobody runs it: the thread is to end
   Guard guard(_lock);
   if (_ready.empty() && _running <= _runningThreads) return false;
-  _ready.push_back(queue);
+  _ready.push(queue);
   return true;
 }
 
@@ -131,10 +194,10 @@ void PoolCore::didBlock() noexcept {
   ++_running;
 }
 
-/// Wakes an idle thread if one more may run. True when there is none and the caller is to start one.
+/// Wakes an idle thread if one more may run. True when there is none for what is ready and the caller is to start one.
 bool PoolCore::wakesOneLocked() {
   if (_running >= _runningThreads) return false;
-  if (_idle.empty()) {
+  if (_idle.empty() || !_ready.hasOne(mayRunPatientLocked())) {
     if (_total >= (_running == 0 ? _maximumWhenBlocked : _maximumThreads)) return false;
     ++_total;
     ++_running;
@@ -164,7 +227,7 @@ void PoolCore::startOne() {
     } else {
       --_total;
       --_running;
-      needsRetry = _retryLater && !_ready.empty() && !std::exchange(_retryIsDue, true);
+      needsRetry = !_ready.empty() && !std::exchange(_retryIsDue, true);
     }
     _becameIdle.notifyAll();
   }
@@ -189,10 +252,15 @@ void PoolCore::retryStarting() {
 void PoolCore::work() {
   currentPool = this;
   setBlockingObserver(this);
+  {
+    Guard guard(_lock);
+    ++_arrived;
+  }
   std::string name;
   while (auto queue = nextQueue()) {
     if (name != queue->shortName()) setCurrentThreadName(name = queue->shortName());
     queue->runTurn();
+    if (queue->isPatient()) endPatientTurn();
   }
   setBlockingObserver(nullptr);
   endThread();
@@ -203,14 +271,27 @@ std::shared_ptr<SerialQueueCore> PoolCore::nextQueue() {
   if (_fork.forked()) return nullptr;
   Guard guard(_lock);
   for (;;) {
-    if (!_ready.empty() && _running <= _runningThreads) {
-      auto queue = std::move(_ready.front());
-      _ready.pop_front();
+    const bool mayRunPatient = mayRunPatientLocked();
+    if (_ready.hasOne(mayRunPatient) && _running <= _runningThreads) {
+      auto queue = _ready.take(mayRunPatient);
+      if (queue->isPatient()) ++_patient;
       return queue;
     }
     if (!parksLocked()) return nullptr;
   }
 }
+
+/// Before the thread looks for its next queue, which may be a patient one.
+void PoolCore::endPatientTurn() {
+  if (_fork.forked()) return;
+  Guard guard(_lock);
+  --_patient;
+}
+
+bool PoolCore::mayRunPatientLocked() const { return _patient + _keptThreads < _arrived; }
+
+/// No thread without work may end.
+bool PoolCore::isKeptLocked() const { return _keptThreads != 0 && !mayRunPatientLocked(); }
 
 /// Sleeps until somebody has work for the thread. False when it was not needed for long, or the pool is being stopped.
 bool PoolCore::parksLocked() {
@@ -220,12 +301,18 @@ bool PoolCore::parksLocked() {
     _idle.push_back(&self);
     if (_idle.size() == _total) _becameIdle.notifyAll();
     const auto end = TimerSchedule::after(systemClock().steadyTime(), _idleThreadLifetime);
-    while (!self.isWoken && !_stopped && self.woken.waitUntil(_lock, end)) {
+    while (!self.isWoken && !_stopped) {
+      if (isKeptLocked()) {
+        self.woken.wait(_lock);
+      } else if (!self.woken.waitUntil(_lock, end) && !isKeptLocked()) {
+        break;
+      }
     }
     if (self.isWoken) return true;
     _idle.erase(std::find(_idle.begin(), _idle.end(), &self));
   }
   --_total;
+  --_arrived;
   return false;
 }
 
@@ -265,15 +352,12 @@ void PoolCore::stop() {
   for (auto& thread : threads) thread.join();
 }
 
-/// Null when everything has run: the pool takes no more. Otherwise a queue that is left without any thread.
+/// Null when everything has run: the pool takes no more. Otherwise a queue for which there may be no thread.
 std::shared_ptr<SerialQueueCore> PoolCore::waitUntilIdle() {
   Guard guard(_lock);
   while (!_ready.empty() || _idle.size() != _total || _starting != 0) {
-    if (_total == 0 && !_ready.empty()) {
-      auto orphan = std::move(_ready.front());
-      _ready.pop_front();
-      return orphan;
-    }
+    if (_total == 0 && !_ready.empty()) return _ready.take(true);
+    if (_refused && _ready.hasOne(false)) return _ready.take(false);
     _becameIdle.wait(_lock);
   }
   _stopped = true;
@@ -290,7 +374,13 @@ std::size_t PoolCore::threadCount() const {
 class ElasticThreadPool final : public ThreadPool {
  public:
   explicit ElasticThreadPool(const ThreadPoolOptions& options)
-      : _core(std::make_shared<PoolCore>(options)), _timers(std::make_shared<TimerThread>()) {}
+      : _patientQueues(options.patientQueues),
+        _timers(std::make_shared<TimerThread>()),
+        _core(std::make_shared<PoolCore>(options, options.retryLater ? options.retryLater : byTimer(_timers))) {
+    if (options.keptThreads == 0) return;
+    _timers->start();
+    _core->startKeptThreads();
+  }
   ~ElasticThreadPool() override {
     if (_fork.forked()) {
       // The child has none of the threads, and their locks may be held for ever: they are left alone, on purpose.
@@ -302,7 +392,8 @@ class ElasticThreadPool final : public ThreadPool {
   }
 
   [[nodiscard]] std::shared_ptr<Queue> makeSerialQueue(std::string label) override {
-    return velk::makeSerialQueue(_core, _timers, std::move(label));
+    const bool isPatient = std::find(_patientQueues.begin(), _patientQueues.end(), label) != _patientQueues.end();
+    return velk::makeSerialQueue(_core, _timers, std::move(label), isPatient);
   }
   [[nodiscard]] std::unique_ptr<Timer> makeTimer(std::shared_ptr<Queue> queue, Task handler) override {
     return makeQueueTimer(_timers, std::move(queue), std::move(handler));
@@ -317,9 +408,17 @@ class ElasticThreadPool final : public ThreadPool {
   [[nodiscard]] std::size_t threadCount() const override { return _core->threadCount(); }
 
  private:
+  static std::function<void(Task)> byTimer(std::shared_ptr<TimerThread> timers) {
+    return [timers = std::move(timers)](Task task) {
+      timers->add(TimerSchedule::after(timers->now(), kPauseAfterRefusal), Duration::zero(),
+                  [task = std::move(task)](SteadyTime) mutable { task(); });
+    };
+  }
+
   const ForkGuard _fork;
-  const std::shared_ptr<PoolCore> _core;
+  const std::vector<std::string> _patientQueues;
   const std::shared_ptr<TimerThread> _timers;
+  const std::shared_ptr<PoolCore> _core;
 };
 
 }  // namespace

@@ -4,6 +4,8 @@
 #include <cstddef>
 #include <functional>
 #include <memory>
+#include <string>
+#include <vector>
 
 #include "platform/Queue.h"
 
@@ -18,17 +20,22 @@ struct ThreadPoolOptions {
   /// may be in that work. Without them a process whose threads all want one lock stands still for ever as soon as the
   /// lock's holder waits for a task.
   std::size_t emergencyThreads = 0;
+  /// Queues with these labels are patient: their tasks wait, perhaps for seconds, for what tasks of other queues do.
+  /// `keptThreads` are left for the others, so that these run when the system gives no further thread.
+  std::vector<std::string> patientQueues = {};
+  /// So many threads, and the one for timers, are started with the pool and never end.
+  std::size_t keptThreads = 0;
   /// A thread without work for this long ends.
   Duration idleThreadLifetime = std::chrono::seconds(5);
   /// Nobody will stop the pool: a thread that ends leaves nothing behind that `stop` would wait for.
   bool isNeverStopped = false;
   /// Runs a task a moment later, on a thread that is none of the pool's: for the next attempt when the system refuses a
-  /// thread and work waits. Without it that work waits for the next task, or for a thread that becomes free.
+  /// thread and work waits. By default the thread for timers does it.
   std::function<void(Task)> retryLater;
 };
 
-/// Starts no thread before there is work. `stop` runs what was handed over, drops delayed work, joins all threads;
-/// it blocks, must not be called from a task, and is called by the destructor.
+/// Starts no thread before there is work, but for the kept ones. `stop` runs what was handed over, drops delayed work,
+/// joins all threads; it blocks, must not be called from a task, and is called by the destructor.
 ///
 /// In a forked child a pool of the parent's does nothing: tasks are destroyed unrun, `sync` runs its work at once, and
 /// nothing is locked, so that a task may fork, and its child may wait, or use a pool of its own. Where the child

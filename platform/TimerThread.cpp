@@ -9,6 +9,11 @@ namespace velk {
 
 SteadyTime TimerThread::now() const { return systemClock().steadyTime(); }
 
+void TimerThread::start() {
+  Guard guard(_lock);
+  if (!_stopped && !_thread.joinable()) startLocked();
+}
+
 TimerSchedule::Identifier TimerThread::add(SteadyTime deadline, Duration leeway, TimerSchedule::Action action) {
   if (_fork.forked()) return 0;
   Guard guard(_lock);

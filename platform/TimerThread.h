@@ -17,6 +17,8 @@ class TimerThread final : public TimerService {
   TimerThread() = default;
   ~TimerThread() override { stop(); }
 
+  /// Ahead of the first deadline: the system may refuse a thread later.
+  void start();
   TimerSchedule::Identifier add(SteadyTime deadline, Duration leeway, TimerSchedule::Action action) override;
   void remove(TimerSchedule::Identifier identifier) override;
   [[nodiscard]] SteadyTime now() const override;

@@ -2,6 +2,7 @@
 
 #include <signal.h>
 #include <stdlib.h>
+#include <unistd.h>
 
 #include <filesystem>
 #include <fstream>
@@ -21,6 +22,14 @@ void require(const Result<void>& result) {
   if (!result) throw std::runtime_error(result.error().description);
 }
 
+void giveAllTo(const std::string& directory, uid_t user) {
+  std::vector<std::string> paths{directory};
+  for (const auto& entry : std::filesystem::recursive_directory_iterator(directory)) paths.push_back(entry.path());
+  for (const auto& path : paths) {
+    if (::chown(path.c_str(), user, user) != 0) throw std::runtime_error("cannot give " + path + " away");
+  }
+}
+
 }  // namespace
 
 Daemon::Daemon(ReportingServer& server, const Options& options) : _server(server), _options(options) {
@@ -37,6 +46,10 @@ Daemon::Daemon(ReportingServer& server, const Options& options) : _server(server
   require(defaults->set("velkreporting_storebag_url", server.url("/bags/vindle")));
   if (options.consent) require(defaults->set(kDiagnosticsAndUsageSetting, true));
   for (const auto& entry : options.defaults) require(defaults->set(entry.key, entry.value));
+  if (options.user) {
+    giveAllTo(directory(), *options.user);
+    std::filesystem::permissions(server.tls().caFile(), std::filesystem::perms(0644));
+  }
   if (options.starts) start();
 }
 
@@ -57,8 +70,10 @@ std::map<std::string, std::string> Daemon::environment() const {
 
 void Daemon::start() {
   ChildProcess::Options child;
-  child.command = {daemonProgram(), "--socket", socketPath()};
+  if (_options.threads) child.command = {"/usr/bin/prlimit", "--nproc=" + std::to_string(*_options.threads)};
+  child.command.insert(child.command.end(), {daemonProgram(), "--socket", socketPath()});
   child.command.insert(child.command.end(), _options.arguments.begin(), _options.arguments.end());
+  child.user = _options.user;
   child.environment = environment();
   child.environment["SSL_CERT_FILE"] = _server.tls().caFile();
   child.environment["LC_ALL"] = "en_US.UTF-8";

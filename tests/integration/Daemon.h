@@ -96,6 +96,10 @@ class Daemon {
     /// Lines of device.conf.
     std::string deviceConfiguration;
     bool consent = true;
+    /// Whom it runs as; only root may choose.
+    std::optional<uid_t> user;
+    /// The most threads that its user may have.
+    std::optional<int> threads;
     /// False: the socket and directories are prepared, and `start` is called by the test.
     bool starts = true;
   };

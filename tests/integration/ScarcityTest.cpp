@@ -253,5 +253,46 @@ TEST_F(Scarcity, OfRoomForRepliesEndsTheConnectionThatDoesNotReadThem) {
   EXPECT_TRUE(connection.waitForEnd());
 }
 
+/// Opens five sessions of each type at once, each with an event, and waits until all are served.
+void serveForty(const Daemon& daemon, ReportingServer& server, const std::vector<int>& types) {
+  const std::size_t before = server.events().size();
+  std::vector<std::unique_ptr<ControlledSession>> sessions;
+  std::vector<std::size_t> lines;
+  for (const int type : types) {
+    for (int number = 0; number < 5; ++number) {
+      sessions.push_back(std::make_unique<ControlledSession>(daemon));
+      lines.push_back(sessions.back()->sendOpening(type, static_cast<int>(sessions.size())));
+      sessions.back()->sendEvent(7, 1, PropertyDictionary{{"number", number}});
+    }
+  }
+  for (std::size_t i = 0; i < sessions.size(); ++i) {
+    ASSERT_NE(sessions[i]->reply(lines[i]).array("reply"), nullptr) << "session " << i;
+  }
+  EXPECT_TRUE(server.waitForEvents(before + sessions.size()));
+  for (auto& session : sessions) EXPECT_EQ(session->finish(), 0);
+}
+
+TEST(ScarcityOfThreads, DelaysSessionsButServesThemAllAndTheDaemonEnds) {
+  if (::geteuid() != 0) GTEST_SKIP() << "only root may choose a user with few threads";
+  const std::vector<std::pair<int, const char*>> types{{5, "bramble"},  {6, "clover"},  {8, "fennel"},  {9, "heather"},
+                                                       {10, "juniper"}, {14, "mallow"}, {15, "nettle"}, {16, "orchid"}};
+  ReportingServer server;
+  server.setStorebagDelay(std::chrono::milliseconds(200));
+  std::vector<int> numbers;
+  for (const auto& [type, name] : types) {
+    numbers.push_back(type);
+    server.setStorebag(name, storebagWith(server, {{"batchEvents", true}}));
+  }
+  Daemon::Options options;
+  options.user = 30000 + static_cast<uid_t>(::getpid() % 30000);
+  options.threads = 24;
+  Daemon daemon(server, options);
+
+  serveForty(daemon, server, numbers);
+  EXPECT_TRUE(daemon.log().waitForPart("<3>Failed to start a thread: ")) << "or the limit was too high to be felt";
+  serveForty(daemon, server, numbers);
+  EXPECT_EQ(daemon.stop(), 0);
+}
+
 }  // namespace
 }  // namespace velk::test

@@ -1,10 +1,12 @@
 #include "platform/ThreadPool.h"
 
 #include <gtest/gtest.h>
+#include <pthread.h>
 #include <signal.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <atomic>
 #include <cerrno>
 #include <cstdlib>
@@ -205,6 +207,173 @@ TEST(ThreadPool, EmergencyThreadsAreBoundedToo) {
   pool->stop();
 }
 
+/// The system refuses every thread while one lives: it has no room for such a stack.
+class RefusedThreads {
+ public:
+  RefusedThreads() {
+    pthread_getattr_default_np(&_usual);
+    pthread_attr_t absurd;
+    pthread_attr_init(&absurd);
+    pthread_attr_setstacksize(&absurd, std::size_t{1} << 50);
+    pthread_setattr_default_np(&absurd);
+    pthread_attr_destroy(&absurd);
+  }
+  ~RefusedThreads() {
+    pthread_setattr_default_np(&_usual);
+    pthread_attr_destroy(&_usual);
+  }
+
+ private:
+  pthread_attr_t _usual;
+};
+
+/// Ends the test when the pool stands still: its destructor would wait for ever.
+void expectProgress(std::unique_ptr<ThreadPool>& pool, Semaphore& done) {
+  if (done.waitFor(20s)) return;
+  ADD_FAILURE() << "the pool stands still";
+  static_cast<void>(pool.release());
+}
+
+TEST(ThreadPool, ASyncRunsWhatStandsBeforeItWhereNoThreadIsLeft) {
+  auto pool = makeThreadPool(options(1, 1));
+  const auto caller = pool->makeSerialQueue("caller");
+  const auto other = pool->makeSerialQueue("other");
+  static std::vector<int> order;
+  static Semaphore done;
+  order.clear();
+  caller->async([other] {
+    for (int number = 0; number < 200; ++number) other->async([number] { order.push_back(number); });
+    other->sync([] { order.push_back(200); });
+    other->async([] { order.push_back(201); });
+    other->sync([] { order.push_back(202); });
+    done.signal();
+  });
+  expectProgress(pool, done);
+  ASSERT_EQ(order.size(), 203U);
+  EXPECT_TRUE(std::is_sorted(order.begin(), order.end()));
+}
+
+TEST(ThreadPool, ASyncThatSleepsRunsWhatStandsBeforeItWhereNoThreadIsLeft) {
+  auto pool = makeThreadPool(options(1, 1));
+  const auto caller = pool->makeSerialQueue("caller");
+  const auto other = pool->makeSerialQueue("other");
+  static std::vector<int> order;
+  static Semaphore done;
+  static Semaphore called;
+  order.clear();
+  other->sync([&] {
+    other->async([] { order.push_back(1); });
+    caller->async([other] {
+      called.signal();
+      other->sync([] { order.push_back(2); });
+      done.signal();
+    });
+    // The pool's only thread sleeps, behind a task that wants it.
+    called.wait();
+    while (pool->threadCount() != 1) std::this_thread::yield();
+  });
+  expectProgress(pool, done);
+  EXPECT_EQ(order, (std::vector{1, 2}));
+}
+
+TEST(ThreadPool, EverybodyMaySyncWithEverybodyElsesQueueOnFewThreads) {
+  constexpr int kQueues = 30;
+  auto pool = makeThreadPool(options(2, 3));
+  std::vector<std::shared_ptr<Queue>> states;
+  for (int number = 0; number < kQueues; ++number) states.push_back(pool->makeSerialQueue("state"));
+  static Semaphore done;
+  static std::atomic<int> left;
+  left = kQueues;
+  for (int number = 0; number < kQueues; ++number) {
+    pool->makeSerialQueue("caller")->async([states, number] {
+      for (int turn = 0; turn < 200; ++turn) {
+        const auto& state = states[static_cast<std::size_t>(number + turn) % kQueues];
+        for (int task = 0; task < turn % 5; ++task) state->async([] {});
+        state->sync([] {});
+      }
+      if (--left == 0) done.signal();
+    });
+  }
+  expectProgress(pool, done);
+}
+
+TEST(ThreadPool, KeepsAThreadFromPatientQueuesForWhatTheyWaitFor) {
+  auto limits = options(4, 3);
+  limits.patientQueues = {"patient"};
+  limits.keptThreads = 1;
+  auto pool = makeThreadPool(limits);
+  constexpr int kPatient = 8;
+  static Semaphore gate;
+  static Semaphore ended;
+  static Semaphore opened;
+  for (int number = 0; number < kPatient; ++number) {
+    pool->makeSerialQueue("patient")->async([] {
+      gate.wait();
+      ended.signal();
+    });
+  }
+  pool->makeSerialQueue("opener")->async([] {
+    for (int number = 0; number < kPatient; ++number) gate.signal();
+    opened.signal();
+  });
+  expectProgress(pool, opened);
+  for (int number = 0; number < kPatient; ++number) ended.wait();
+}
+
+TEST(ThreadPool, KeptThreadsStartAtOnceAndNeverEnd) {
+  auto limits = options(2, 512, 1ms);
+  limits.patientQueues = {"patient"};
+  limits.keptThreads = 1;
+  const auto pool = makeThreadPool(limits);
+  EXPECT_EQ(pool->threadCount(), 1U);
+  for (int turn = 0; turn < 5; ++turn) {
+    Semaphore ran;
+    pool->makeSerialQueue(turn % 2 == 0 ? "patient" : "other")->async([&] { ran.signal(); });
+    ran.wait();
+    while (pool->threadCount() != 1) std::this_thread::sleep_for(1ms);
+  }
+}
+
+TEST(ThreadPool, AsksAgainForAThreadWithoutFurtherWork) {
+  auto pool = makeThreadPool(options(2));
+  static Semaphore waits;
+  static Semaphore gate;
+  static Semaphore ran;
+  const auto first = pool->makeSerialQueue("first");
+  first->asyncAfter(1ms, [] {
+    waits.signal();
+    gate.wait();
+  });
+  waits.wait();
+  const auto second = pool->makeSerialQueue("second");
+  {
+    RefusedThreads refused;
+    second->async([] { ran.signal(); });
+    EXPECT_FALSE(ran.waitFor(50ms)) << "there is no thread for it";
+  }
+  expectProgress(pool, ran);
+  gate.signal();
+}
+
+TEST(ThreadPool, StopNeedsNoNewThread) {
+  auto pool = makeThreadPool(options(2));
+  Semaphore waits;
+  Semaphore gate;
+  std::atomic<bool> ran = false;
+  const auto blocked = pool->makeSerialQueue("blocked");
+  const auto opener = pool->makeSerialQueue("opener");
+  blocked->async([&] {
+    waits.signal();
+    gate.wait();
+    ran = true;
+  });
+  waits.wait();
+  RefusedThreads refused;
+  opener->async([&] { gate.signal(); });
+  pool->stop();
+  EXPECT_TRUE(ran);
+}
+
 TEST(ThreadPool, IdleThreadsEnd) {
   const auto pool = makeThreadPool(options(2, 512, 1ms));
   const auto queue = pool->makeSerialQueue("queue");
@@ -245,8 +414,10 @@ TEST(ThreadPool, BusyQueueLetsOthersHaveTheThread) {
     });
   }
   modest->async([&] { modestRan = true; });
+  Semaphore done;
+  greedy->async([&] { done.signal(); });
   go.signal();
-  greedy->sync([] {});
+  done.wait();
   EXPECT_TRUE(modestRan);
   EXPECT_LT(before, 200);
 }
