@@ -102,6 +102,8 @@ function(velk_test name)
   endif()
   add_executable(${name} ${ARG_SOURCES})
   target_link_libraries(${name} PRIVATE ${ARG_LINKS} velk_test_support GTest::gtest GTest::gmock GTest::gtest_main)
+  # Two thirds of a test file's compilation would go into optimising assertions.
+  target_compile_options(${name} PRIVATE -O0)
   velk_use_precompiled(${name} velk_precompiled_tests)
   if(VELK_SANITIZE STREQUAL "tsan")
     # The sanitizer's shadow needs an address space laid out without randomisation.
