@@ -75,20 +75,13 @@ ThreadPoolOptions poolOptions() {
   return options;
 }
 
-/// Its tasks wait for nobody: one thread is enough to get on.
-ThreadPoolOptions storebagPoolOptions() {
-  ThreadPoolOptions options;
-  options.keptThreads = 1;
-  return options;
-}
-
 /// One thread that never ends: an answer for which the agent's lock is held must not depend on a thread that the system
 /// may refuse. One is enough, because no task there waits for another.
 ThreadPoolOptions storebagPoolOptions() {
   ThreadPoolOptions options;
   options.runningThreads = 1;
   options.maximumThreads = 1;
-  options.idleThreadLifetime = Duration::max();
+  options.keptThreads = 1;
   return options;
 }
 
@@ -221,10 +214,7 @@ DaemonProcess::Parts::Parts(const DaemonOptions& options, process::RunLoop& loop
       acceptQueue(pool->makeSerialQueue("com.tavrin.velkreportingd.accept")),
       eventLoop("velk-ipc"),
       reloading(pool->makeSerialQueue("com.tavrin.velkreportingd.reload"), [this] { reload(); }),
-      entitlements(std::make_shared<EntitlementRules>(loadEntitlements(directories.configuration).rules)) {
-  // Starts the thread, early.
-  storebagPool->makeSerialQueue("com.tavrin.velkreportingd.storebag")->async([] {});
-}
+      entitlements(std::make_shared<EntitlementRules>(loadEntitlements(directories.configuration).rules)) {}
 
 std::shared_ptr<const EntitlementRules> DaemonProcess::Parts::currentEntitlements() {
   Guard guard(entitlementsLock);
