@@ -137,7 +137,7 @@ TEST(EventBatch, EstimatesItsSize) {
 }
 
 TEST(EventBatch, EstimatesItsSizeWithTheSessionIDThatWasSetLast) {
-  EventBatch batch;
+  LoneBatch batch;
   const PropertyDictionary event{{"a", "some text"}, {"_sessionID", "short"}};
   batch.append(event);
   batch.append({{"b", 1}});
