@@ -22,6 +22,10 @@ class BatchMemory {
     return false;
   }
   void giveBack(std::uint64_t bytes) noexcept { _taken.fetch_sub(bytes, std::memory_order_relaxed); }
+  /// What a batch holds has another size now. Never refused: the events are there.
+  void replace(std::uint64_t before, std::uint64_t now) noexcept {
+    _taken.fetch_add(now - before, std::memory_order_relaxed);  // a smaller size wraps around to the right sum
+  }
   [[nodiscard]] std::uint64_t taken() const noexcept { return _taken.load(std::memory_order_relaxed); }
 
  private:

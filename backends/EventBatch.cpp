@@ -47,11 +47,13 @@ std::vector<PropertyDictionary> EventBatch::take() {
 }
 
 void EventBatch::setSessionID(const std::string& sessionID) {
+  const std::uint64_t before = _bytes;
   for (auto& event : _events) {
     _bytes -= memoryEstimate(event);
     event.set("_sessionID", sessionID);
     _bytes += memoryEstimate(event);
   }
+  _memory->replace(before, _bytes);
 }
 
 }  // namespace velk

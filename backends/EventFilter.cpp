@@ -84,7 +84,12 @@ void EventFilter::createFiltersFromArray(const PropertyArray& filters) {
   if (filters.empty()) return;
   _records.clear();
   _records.reserve(filters.size());
-  for (const PropertyValue& filter : filters) _records.push_back(recordOf(filter));
+  _keySizes = 0;
+  for (const PropertyValue& filter : filters) {
+    _records.push_back(recordOf(filter));
+    const auto& key = _records.back().key;
+    if (key) _keySizes |= std::uint64_t{1} << sizeBit(key->folded());
+  }
 }
 
 void EventFilter::apply(PropertyDictionary& event) const {
@@ -92,12 +97,13 @@ void EventFilter::apply(PropertyDictionary& event) const {
   const std::int32_t method = int32Value(event.find("_method"));
   const std::int32_t status = int32Value(event.find("_status"));
   const auto applies = [&](const FilterRecord& record, Foldable& key) {
-    return (record.method < 0 || record.method == method) && (record.status < 0 || record.status == status) &&
-           record.key && key.equals(*record.key);
+    return record.key && key.equals(*record.key) && (record.method < 0 || record.method == method) &&
+           (record.status < 0 || record.status == status);
   };
   // First find, then act: acting moves the entries.
   std::vector<std::pair<std::string, const FilterRecord*>> matches;
   for (const auto& entry : event) {
+    if (!mayMatch(entry.key)) continue;
     Foldable key(entry.key);
     for (const FilterRecord& record : _records) {
       if (!applies(record, key)) continue;

@@ -2,9 +2,11 @@
 // backend and used on its session's queue.
 #pragma once
 
+#include <algorithm>
 #include <cstddef>
 #include <cstdint>
 #include <optional>
+#include <string_view>
 #include <vector>
 
 #include "foundation/PropertyValue.h"
@@ -33,7 +35,16 @@ class EventFilter {
   void apply(PropertyDictionary& event) const;
 
  private:
+  /// Whether some record may match: its key is as long, or letters of the key may fold to others.
+  [[nodiscard]] bool mayMatch(std::string_view key) const noexcept {
+    return ((_keySizes >> sizeBit(key)) & 1U) != 0 || !isAscii(key);
+  }
+  [[nodiscard]] static std::size_t sizeBit(std::string_view key) noexcept {
+    return std::min<std::size_t>(key.size(), 63);
+  }
+
   std::vector<FilterRecord> _records;
+  std::uint64_t _keySizes = 0;  ///< a bit for each size of a folded key
 };
 
 }  // namespace velk

@@ -7,8 +7,7 @@
 #include <memory>
 #include <new>
 #include <optional>
-
-#include "foundation/Text.h"
+#include <utility>
 
 namespace velk {
 
@@ -27,12 +26,6 @@ std::optional<std::string> mapped(std::string_view text, int options) {
 }
 
 }  // namespace
-
-bool isAscii(std::string_view text) noexcept {
-  unsigned bits = 0;
-  for (const char byte : text) bits |= static_cast<unsigned char>(byte);
-  return bits < 0x80;
-}
 
 std::string caseFolded(std::string_view text) {
   if (isAscii(text)) return lowerCased(text);
@@ -70,22 +63,8 @@ std::string lowerCasedText(std::string_view text) {
 }
 
 const std::string& Foldable::folded() {
-  if (!_isFolded) {
-    _folded = caseFolded(_text);
-    _isFolded = true;
-  }
-  return _folded;
-}
-
-// Folded text that is ASCII is lower-cased, and any other holds bytes that no ASCII text has.
-bool Foldable::equals(const FoldedText& other) {
-  if (_isAscii) return equalsIgnoringCase(_text, other.folded());
-  return folded() == other.folded();
-}
-
-bool Foldable::contains(const FoldedText& part) {
-  if (_isAscii) return containsIgnoringCase(_text, part.folded());
-  return folded().find(part.folded()) != std::string::npos;
+  if (!_folded) _folded = caseFolded(_text);
+  return *_folded;
 }
 
 }  // namespace velk

@@ -177,7 +177,8 @@ TEST(Pipeline, FiltersActOnTheFirstRecordThatFits) {
                       filter("digits", "whitelistValues", {{"value", PropertyArray{"5"}}}), filter("kept", "unknown"),
                       filter("kept", "remove"), filter("other", "remove", {{"method", 8}}),
                       filter("status", "remove", {{"status", 4}}),
-                      filter("both", "remove", {{"method", 7}, {"status", 3}}), filter("clientId", "sha256")}}});
+                      filter("both", "remove", {{"method", 7}, {"status", 3}}), filter("clientId", "sha256"),
+                      filter("GRÖSSE", "remove")}}});
 
   const auto event = pipeline.roundTrip(PropertyDictionary{{"name", "x"},
                                                            {"text", "abc"},
@@ -189,11 +190,17 @@ TEST(Pipeline, FiltersActOnTheFirstRecordThatFits) {
                                                            {"kept", 1},
                                                            {"other", 1},
                                                            {"status", 1},
-                                                           {"both", 1}});
+                                                           {"both", 1},
+                                                           {"größe", 1},
+                                                           {"Gro\u0308\u00dfe", 1},
+                                                           {"grosse", 1}});
 
   EXPECT_FALSE(event.contains("name"));
   EXPECT_EQ(*event.string("text"), "ba7816bf8f01cfea414140de5dae2223b00361a396177a9cb410ff61f20015ad");
   EXPECT_FALSE(event.contains("number")) << "never plain where a hash was promised";
+  EXPECT_FALSE(event.contains("größe"));
+  EXPECT_FALSE(event.contains("Gro\u0308\u00dfe"));
+  EXPECT_TRUE(event.contains("grosse"));
   EXPECT_FALSE(event.contains("bad"));
   EXPECT_TRUE(event.contains("fine"));
   EXPECT_TRUE(event.contains("white"));

@@ -118,6 +118,18 @@ TEST(EventBatch, GivesItsMemoryBack) {
   EXPECT_EQ(memory->taken(), 0U);
 }
 
+TEST(EventBatch, GivesBackWhatItHoldsWithAnotherSessionID) {
+  const auto memory = std::make_shared<BatchMemory>();
+  EventBatch batch(memory);
+  batch.append({{"_sessionID", std::string(100, 'x')}});
+  for (const auto& sessionID : {std::string(500, 'y'), std::string("z")}) {
+    batch.setSessionID(sessionID);
+    EXPECT_EQ(memory->taken(), batch.estimatedSize());
+  }
+  batch.discard();
+  EXPECT_EQ(memory->taken(), 0U);
+}
+
 TEST(EventBatch, WritesASessionIDIntoEveryEvent) {
   LoneBatch batch;
   batch.append({{"_sessionID", 5}});
@@ -137,7 +149,7 @@ TEST(EventBatch, EstimatesItsSize) {
 }
 
 TEST(EventBatch, EstimatesItsSizeWithTheSessionIDThatWasSetLast) {
-  EventBatch batch;
+  LoneBatch batch;
   const PropertyDictionary event{{"a", "some text"}, {"_sessionID", "short"}};
   batch.append(event);
   batch.append({{"b", 1}});
