@@ -47,11 +47,14 @@ std::vector<PropertyDictionary> EventBatch::take() {
 }
 
 void EventBatch::setSessionID(const std::string& sessionID) {
+  const std::uint64_t before = _bytes;
   for (auto& event : _events) {
     _bytes -= memoryEstimate(event);
     event.set("_sessionID", sessionID);
     _bytes += memoryEstimate(event);
   }
+  // What has been kept stays, also above the bound. A difference below zero takes: unsigned numbers wrap.
+  _memory->giveBack(before - _bytes);
 }
 
 }  // namespace velk

@@ -137,7 +137,8 @@ TEST(EventBatch, EstimatesItsSize) {
 }
 
 TEST(EventBatch, EstimatesItsSizeWithTheSessionIDThatWasSetLast) {
-  EventBatch batch;
+  const auto memory = std::make_shared<BatchMemory>();
+  EventBatch batch(memory);
   const PropertyDictionary event{{"a", "some text"}, {"_sessionID", "short"}};
   batch.append(event);
   batch.append({{"b", 1}});
@@ -145,8 +146,12 @@ TEST(EventBatch, EstimatesItsSizeWithTheSessionIDThatWasSetLast) {
   batch.setSessionID(longer);
   EXPECT_EQ(batch.estimatedSize(), memoryEstimate({{"a", "some text"}, {"_sessionID", longer}}) +
                                        memoryEstimate({{"b", 1}, {"_sessionID", longer}}));
+  EXPECT_EQ(memory->taken(), batch.estimatedSize());
+  batch.setSessionID("short");
+  EXPECT_EQ(memory->taken(), batch.estimatedSize());
   batch.discard();
   EXPECT_EQ(batch.estimatedSize(), 0U);
+  EXPECT_EQ(memory->taken(), 0U);
 }
 
 }  // namespace
