@@ -9,7 +9,7 @@
 namespace velk {
 
 void ClientSession::clientHasGone() {
-  _clientHasGone = true;
+  if (_clientHasGone.exchange(true)) return;
   std::shared_ptr<ReportingSessionConnectivityHelper> helper;
   {
     Guard guard(_lock);

@@ -74,10 +74,13 @@ TEST_F(ConcurrencyTest, ClientThatHasGoneWaitsForNoRoom) {
     request.sender = sender.number;
     helper->postURLRequestWithCompletionHandler(std::move(request), {});
   }
+  sender.hasPosted = true;
+  std::thread connectionsQueue([this] { send(message(1, 2)); });
   session->clientHasGone();
+  connectionsQueue.join();
   sender.hasPosted = true;
   send(message(1, 2));
-  EXPECT_EQ(backend("splunk").sent.size(), 1U);
+  EXPECT_EQ(backend("splunk").sent.size(), 2U);
 }
 
 TEST_F(ConcurrencyTest, SessionMayBeEndedFromAnyThread) {
