@@ -14,30 +14,27 @@ namespace {
 
 using SessionList = CorrelatedSessions::SessionList;
 
-/// Of a list that outlives it.
-struct LevelledSession {
-  std::uint32_t level;
-  const std::shared_ptr<ReportingdSession>* session;
-};
-
-bool contains(const SessionList& list, const ReportingdSession& session) {
-  return std::any_of(list.begin(), list.end(), [&](const auto& listed) { return listed.get() == &session; });
-}
+constexpr std::uint32_t kEveryLevel = UINT32_MAX;
 
 void removeFrom(SessionList& list, const ReportingdSession& session) {
   std::erase_if(list, [&](const auto& listed) { return listed.get() == &session; });
 }
 
+constexpr auto isBelow = [](const auto& left, const auto& right) { return left.level < right.level; };
+
+}  // namespace
+
 /// First session of each level below `level`, from the root on. A level that a client made up (they go to four thousand
-/// million) costs no more than the sessions that there are. Asked for every session of a tree, under the agent's lock:
-/// a few passes over the list, and nothing allocated for a session.
-std::vector<LevelledSession> firstSessionsBelow(std::uint32_t level, const SessionList& list) {
+/// million) costs no more than the sessions that there are. Asked for every event of a tree, under the agent's lock: a
+/// few passes over the list.
+std::vector<CorrelatedSessions::LevelledSession> CorrelatedSessions::firstSessionsBelow(std::uint32_t level,
+                                                                                        const SessionList& list) {
   std::vector<LevelledSession> first;
   first.reserve(list.size());
   for (const auto& session : list) {
-    if (const auto its = session->hierarchyLevel(); its < level) first.push_back({its, &session});
+    const auto its = session->hierarchyLevel();
+    if (its < level || level == kEveryLevel) first.push_back({its, &session});
   }
-  const auto isBelow = [](const auto& left, const auto& right) { return left.level < right.level; };
   if (!std::is_sorted(first.begin(), first.end(), isBelow)) std::stable_sort(first.begin(), first.end(), isBelow);
   first.erase(std::unique(first.begin(), first.end(),
                           [](const auto& left, const auto& right) { return left.level == right.level; }),
@@ -45,7 +42,42 @@ std::vector<LevelledSession> firstSessionsBelow(std::uint32_t level, const Sessi
   return first;
 }
 
-}  // namespace
+void CorrelatedSessions::makeIndex(const std::string& token) {
+  const auto* list = sessions(token);
+  if (list == nullptr) return;
+  Index index{list, {}, firstSessionsBelow(kEveryLevel, *list)};
+  index.members.reserve(list->size());
+  for (const auto& session : *list) index.members.insert(session.get());
+  _index = std::move(index);
+}
+
+const CorrelatedSessions::Index* CorrelatedSessions::indexOf(const SessionList& list) const {
+  return _index && _index->list == &list ? &*_index : nullptr;
+}
+
+bool CorrelatedSessions::contains(const SessionList& list, const ReportingdSession& session) const {
+  if (const auto* index = indexOf(list)) return index->members.contains(&session);
+  return std::any_of(list.begin(), list.end(), [&](const auto& listed) { return listed.get() == &session; });
+}
+
+std::shared_ptr<ReportingdSession> CorrelatedSessions::firstSession(std::uint32_t level,
+                                                                    const SessionList& list) const {
+  const auto* index = indexOf(list);
+  if (index == nullptr) return getFirstSessionWithHierarchy(level, list);
+  const auto& first = index->firstSessions;
+  const auto found = std::lower_bound(first.begin(), first.end(), LevelledSession{level, nullptr}, isBelow);
+  return found != first.end() && found->level == level ? *found->session : nullptr;
+}
+
+template <class Use>
+auto CorrelatedSessions::withFirstSessionsBelow(std::uint32_t level, const SessionList& list, Use use) const {
+  if (const auto* index = indexOf(list)) {
+    const auto& first = index->firstSessions;
+    return use(first.begin(), std::lower_bound(first.begin(), first.end(), LevelledSession{level, nullptr}, isBelow));
+  }
+  const auto first = firstSessionsBelow(level, list);
+  return use(first.begin(), first.end());
+}
 
 std::vector<std::string> CorrelatedSessions::add(ReportingdSession& session) {
   const auto token = session.hierarchyToken();
@@ -53,6 +85,7 @@ std::vector<std::string> CorrelatedSessions::add(ReportingdSession& session) {
     log::standard(daemontexts::kStandaloneSession, session.sessionID());
     return {};
   }
+  _index.reset();
   std::size_t deserted = 0;
   for (auto& [otherToken, list] : _sessions) {
     removeFrom(list, session);
@@ -65,6 +98,7 @@ std::vector<std::string> CorrelatedSessions::add(ReportingdSession& session) {
 }
 
 std::vector<std::string> CorrelatedSessions::remove(const ReportingdSession& session) {
+  _index.reset();
   // Under every token: the session may have forgotten its own since it registered.
   for (auto& [token, list] : _sessions) removeFrom(list, session);
   return dropEmptyLists();
@@ -106,24 +140,22 @@ std::optional<std::string> CorrelatedSessions::parentSessionIDString(const Repor
     log::standard(daemontexts::kNotFoundForChain, session.sessionID(), *token);
     return std::nullopt;
   }
-  const auto ancestors = firstSessionsBelow(level, *list);
-  // From the parent up to the root, or to the first gap.
-  auto top = ancestors.end();
-  while (top != ancestors.begin() &&
-         std::prev(top)->level + static_cast<std::uint32_t>(ancestors.end() - top) + 1 == level) {
-    --top;
-  }
-  std::optional<std::string> chain;
-  for (auto ancestor = top; ancestor != ancestors.end(); ++ancestor) {
-    if (chain) {
-      *chain += '.';
-      *chain += (*ancestor->session)->sessionIDString();
-    } else {
-      chain = (*ancestor->session)->sessionIDString();
+  return withFirstSessionsBelow(level, *list, [level](auto begin, auto end) {
+    // From the parent up to the root, or to the first gap.
+    auto top = end;
+    while (top != begin && std::prev(top)->level + static_cast<std::uint32_t>(end - top) + 1 == level) --top;
+    std::optional<std::string> chain;
+    for (auto ancestor = top; ancestor != end; ++ancestor) {
+      if (chain) {
+        *chain += '.';
+        *chain += (*ancestor->session)->sessionIDString();
+      } else {
+        chain = (*ancestor->session)->sessionIDString();
+      }
     }
-  }
-  if (ancestors.end() - top != static_cast<std::ptrdiff_t>(level)) log::standard(daemontexts::kGapInChain, chain);
-  return chain;
+    if (end - top != static_cast<std::ptrdiff_t>(level)) log::standard(daemontexts::kGapInChain, chain);
+    return chain;
+  });
 }
 
 std::shared_ptr<ReportingdSession> CorrelatedSessions::parent(const ReportingdSession& session) const {
@@ -140,7 +172,7 @@ std::shared_ptr<ReportingdSession> CorrelatedSessions::parent(const ReportingdSe
     log::error(daemontexts::kNotFoundForParent, session.sessionID(), *token);
     return nullptr;
   }
-  auto found = getFirstSessionWithHierarchy(level - 1, *list);
+  auto found = firstSession(level - 1, *list);
   if (!found) log::standard(daemontexts::kNoParentAtLevel, level - 1, *token);
   return found;
 }
@@ -153,10 +185,12 @@ std::shared_ptr<ReportingdSession> CorrelatedSessions::ancestorWithAggregator(co
   if (std::none_of(list->begin(), list->end(), [](const auto& listed) { return listed->hasAggregator(); })) {
     return nullptr;
   }
-  for (const auto& ancestor : firstSessionsBelow(session.hierarchyLevel(), *list)) {
-    if ((*ancestor.session)->hasAggregator()) return *ancestor.session;
-  }
-  return nullptr;
+  return withFirstSessionsBelow(
+      session.hierarchyLevel(), *list, [](auto begin, auto end) -> std::shared_ptr<ReportingdSession> {
+        const auto found =
+            std::find_if(begin, end, [](const auto& ancestor) { return (*ancestor.session)->hasAggregator(); });
+        return found != end ? *found->session : nullptr;
+      });
 }
 
 SessionList CorrelatedSessions::descendants(const ReportingdSession& session) const {

@@ -7,6 +7,7 @@
 #include <memory>
 #include <optional>
 #include <string>
+#include <unordered_set>
 #include <utility>
 #include <vector>
 
@@ -39,6 +40,20 @@ class CorrelatedSessions {
   /// Every deeper session of the token, in list order.
   [[nodiscard]] SessionList descendants(const ReportingdSession& session) const;
 
+  /// While it lives, questions about sessions of this token are answered from an index, as of its making: for asking
+  /// about every session of a tree, which would otherwise walk the whole list for each. Made under the agent's lock,
+  /// which is held for as long as it lives. A session that registers or leaves meanwhile ends the index.
+  class Survey {
+   public:
+    Survey(CorrelatedSessions& sessions, const std::string& token) : _sessions(sessions) { _sessions.makeIndex(token); }
+    ~Survey() { _sessions._index.reset(); }
+    Survey(const Survey&) = delete;
+    Survey& operator=(const Survey&) = delete;
+
+   private:
+    CorrelatedSessions& _sessions;
+  };
+
   [[nodiscard]] std::size_t tokenCount() const noexcept { return _sessions.size(); }
   /// Every token with its sessions in list order; deserted lists are there as well.
   [[nodiscard]] std::vector<std::pair<std::string, SessionList>> snapshot() const {
@@ -49,11 +64,34 @@ class CorrelatedSessions {
                                                                                        const SessionList& sessionList);
 
  private:
+  struct LevelledSession {
+    std::uint32_t level;
+    /// In a list that outlives it.
+    const std::shared_ptr<ReportingdSession>* session;
+  };
+  struct Index {
+    const SessionList* list;
+    std::unordered_set<const ReportingdSession*> members;
+    /// Of each level, from the root on.
+    std::vector<LevelledSession> firstSessions;
+  };
+
+  [[nodiscard]] static std::vector<LevelledSession> firstSessionsBelow(std::uint32_t level, const SessionList& list);
+  void makeIndex(const std::string& token);
+  /// The index, if there is one of this list; else null.
+  [[nodiscard]] const Index* indexOf(const SessionList& list) const;
+  [[nodiscard]] bool contains(const SessionList& list, const ReportingdSession& session) const;
+  [[nodiscard]] std::shared_ptr<ReportingdSession> firstSession(std::uint32_t level, const SessionList& list) const;
+  /// Calls `use` with the first sessions of the levels below `level`, from the root on: two iterators.
+  template <class Use>
+  [[nodiscard]] auto withFirstSessionsBelow(std::uint32_t level, const SessionList& list, Use use) const;
+
   [[nodiscard]] std::vector<std::string> dropEmptyLists();
   /// Null when the token has no list or an empty one.
   [[nodiscard]] const SessionList* sessions(const std::string& token) const;
 
   std::map<std::string, SessionList, std::less<>> _sessions;
+  std::optional<Index> _index;
 };
 
 }  // namespace velk

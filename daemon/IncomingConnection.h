@@ -19,7 +19,7 @@ using StatusHandler = std::function<void(StatusReply)>;
 
 class IncomingConnection : public SessionConnection {
  public:
-  /// The boolean value of the peer's entitlement; false when it has none. May block in the user database.
+  /// The boolean value of the peer's entitlement; false when it has none.
   [[nodiscard]] virtual bool valueOfEntitlement(std::string_view name) const = 0;
   /// Exports the session interface and takes the client's reply interface. Without a status handler the peer may not
   /// read the status. The session is held until the connection has been invalidated.

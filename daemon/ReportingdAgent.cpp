@@ -201,8 +201,11 @@ std::shared_ptr<ReportingdSession> ReportingdAgent::getAncestorWithAggregatorFor
 }
 
 void ReportingdAgent::updateDownstreamSessions(ReportingdSession& session) {
-  if (!session.hierarchyToken()) return;
+  const auto token = session.hierarchyToken();
+  if (!token) return;
   Guard guard(_monitor);
+  // Every session below asks for its parent and its chain.
+  const CorrelatedSessions::Survey survey(_correlatedSessions, *token);
   session.updateCombinedSessionID();
   session.syncReportingStates();
   const bool ancestorAggregates =

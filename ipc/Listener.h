@@ -21,9 +21,10 @@ class EventLoop;
 
 /// Accepting happens on the event loop's thread; the decision is taken on the accept queue, one connection at a time.
 /// Nothing is read from a connection before the handler has accepted and resumed it. Connections beyond a user's
-/// share are closed before anybody is asked. Running out of descriptors lets accepting rest for a moment.
-/// The loop's thread asks the kernel alone. Where a decision needs the peer's program, the look-up runs on the delivery
-/// queue of that connection, a few at a time for one user: one that takes for ever holds up that user's peers alone.
+/// share (of this socket) are closed before anybody is asked. Running out of descriptors lets accepting rest for a
+/// moment. The loop's thread asks the kernel alone. Where a decision needs the peer's program, the look-up runs on the
+/// delivery queue of that connection, a few at a time for one user: one that takes for ever holds up that user's peers
+/// alone.
 class Listener {
  public:
   struct Options {

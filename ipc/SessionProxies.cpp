@@ -238,7 +238,14 @@ Result<void> ReplyInterfaceProxy::sendMessageToClient(const std::optional<Proper
   const auto method = numberOf(Method::sendMessageToClient);
   // Events may be missed by a client that reads slowly, but not that there will be no more of them.
   const bool isEnd = !sessionInfo && !payload && category == 0 && type == 0;
-  return isEnd ? Connection(core).sendFirmly(method, 5, encode) : Connection(core).send(method, 5, encode);
+  Connection connection(core);
+  if (isEnd) return connection.sendFirmly(method, 5, encode);
+  if (_isBehind && !connection.hasRoomForAnyCall()) {
+    return Failure(connectionError(ConnectionError::outboxFull, "the outbox is full: the peer reads too slowly"));
+  }
+  auto sent = connection.send(method, 5, encode);
+  _isBehind = !sent && sent.error().code == static_cast<int>(ConnectionError::outboxFull);
+  return sent;
 }
 
 }  // namespace velk

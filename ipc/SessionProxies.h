@@ -1,6 +1,7 @@
 // Both interfaces of a connection, on both ends: proxies turn methods into calls, dispatchers turn calls into methods.
 #pragma once
 
+#include <atomic>
 #include <functional>
 #include <memory>
 
@@ -77,12 +78,15 @@ class ReplyInterfaceProxy final {
   explicit ReplyInterfaceProxy(const std::shared_ptr<Connection>& connection) : _connection(connection->core()) {}
   /// The error says why the event is not on its way: the connection has ended, its outbox is full, the event is larger
   /// than a frame. The end of aggregation (nothing in any argument) fits into an outbox that takes no more events.
+  /// After an event that did not fit none is encoded before an event of any size would fit: the caller may hold a lock
+  /// that others want, and a client that stands still would cost the work for every event.
   [[nodiscard]] Result<void> sendMessageToClient(const std::optional<PropertyDictionary>& sessionInfo, double timestamp,
                                                  std::uint16_t category, std::uint16_t type,
                                                  const std::optional<PropertyDictionary>& payload);
 
  private:
   const std::weak_ptr<ipc::ConnectionCore> _connection;
+  std::atomic<bool> _isBehind{false};
 };
 
 /// The client's side of the same.

@@ -1,5 +1,5 @@
 // Events on their way to the client that aggregates them. An event is only ever appended to the aggregator's bounded
-// outbox: a peer that hangs costs its relatives a log line, never time.
+// outbox: a peer that hangs costs its relatives a log line a minute, never time. Nothing is logged under a lock.
 #include "platform/Log.h"
 #include "session/ClientSession.h"
 #include "session/LogTexts.h"
@@ -7,6 +7,9 @@
 namespace velk {
 
 namespace {
+
+/// A client that does not read fails every event of its relatives in the same way.
+constexpr Duration kFailureLineInterval = std::chrono::minutes(1);
 
 void logFailure(const Result<void>& sent) {
   if (!sent) log::standard(session_texts::kProxyFailure, sent.error());
@@ -31,7 +34,9 @@ void ClientSession::aggregateMessage(double timestamp, std::uint16_t category, s
     if (ancestor) sent = ancestor->sendToAggregator(ownSessionInfo(), timestamp, category, type, merged);
   }
   if (!ancestor && hasAggregator()) sent = sendToAggregator(ownSessionInfo(), timestamp, category, type, merged);
-  logFailure(sent);
+  if (sent) return;
+  const bool isNews = ancestor ? ancestor->takesAggregatorFailureLine() : takesAggregatorFailureLine();
+  if (isNews) logFailure(sent);
 }
 
 Result<void> ClientSession::sendToAggregator(const std::optional<PropertyDictionary>& sessionInfo, double timestamp,
@@ -40,6 +45,14 @@ Result<void> ClientSession::sendToAggregator(const std::optional<PropertyDiction
   Guard guard(_aggregationLock);
   if (!_hasAggregator) return {};  // ended since the caller looked: nothing follows the end marker
   return appendToConnection(sessionInfo, timestamp, category, type, payload);
+}
+
+bool ClientSession::takesAggregatorFailureLine() {
+  const auto now = _services.backends.platform.clock.steadyTime();
+  Guard guard(_aggregationLock);
+  if (_lastFailureLine && now - *_lastFailureLine < kFailureLineInterval) return false;
+  _lastFailureLine = now;
+  return true;
 }
 
 void ClientSession::shutdownSessionAggregation() {

@@ -73,6 +73,7 @@ class ClientSession final : public ReportingdSession {
                                               std::uint16_t category, std::uint16_t type,
                                               const std::optional<PropertyDictionary>& payload) override;
   void clientHasGone() override;
+  [[nodiscard]] bool takesAggregatorFailureLine() override;
   void invalidate() override;
   void teardown() override;
 
@@ -183,6 +184,7 @@ class ClientSession final : public ReportingdSession {
   /// Held where events and the end marker are appended to this session's connection, so that nothing follows the
   /// marker. May be taken with the agent's monitor held; what runs under it waits for nobody.
   Lock _aggregationLock;
+  std::optional<SteadyTime> _lastFailureLine VELK_GUARDED_BY(_aggregationLock);
 
   // Guarded by _lock.
   mutable Lock _lock;

@@ -62,6 +62,9 @@ class ReportingdSession : public ClientSessionInterface, public std::enable_shar
   }
   /// The peer has hung up. What it sent before still runs, and waits for no room in the transport. Waits for nothing.
   virtual void clientHasGone() {}
+  /// Whether a failure of `sendToAggregator` is to be logged: one a minute for each aggregator. Asked with no lock
+  /// held.
+  [[nodiscard]] virtual bool takesAggregatorFailureLine() { return true; }
   /// Ends the connection. Only posts: may be called under the agent's lock.
   virtual void invalidate() = 0;
   /// The end: health message, flush, keep-alive, clean-up. Exactly once, on the connection's queue, after the agent

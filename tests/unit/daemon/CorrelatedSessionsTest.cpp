@@ -1,5 +1,7 @@
 #include "daemon/CorrelatedSessions.h"
 
+#include <algorithm>
+
 #include "tests/unit/daemon/AgentFixture.h"
 
 namespace velk {
@@ -178,6 +180,63 @@ TEST_F(CorrelatedSessionsTest, UpdatesEveryDeeperSessionDownstream) {
   EXPECT_TRUE(sibling->calls.empty());
   EXPECT_EQ(logged(daemontexts::kUpdatingDownstream, child->number), 1);
   EXPECT_EQ(logged(daemontexts::kUpdatingDownstream, root->number), 0);
+}
+
+/// A session that asks the agent what real ones ask, and counts how often anybody asks for its level.
+class AskingSession : public FakeReportingdSession {
+ public:
+  std::uint32_t hierarchyLevel() const override {
+    ++questions;
+    return level;
+  }
+  void updateCombinedSessionID() override { chain = agent->parentSessionIDStringForSession(*this); }
+  void syncReportingStates() override { parent = agent->parentSessionForChild(*this); }
+
+  ReportingdAgent* agent = nullptr;
+  std::optional<std::string> chain;
+  std::shared_ptr<ReportingdSession> parent;
+  static inline std::size_t questions = 0;
+};
+
+TEST_F(CorrelatedSessionsTest, UpdatingATreeDoesNotWalkItForEverySession) {
+  constexpr std::size_t kSessions = 512;
+  std::vector<std::shared_ptr<AskingSession>> tree;
+  for (std::size_t number = 0; number < kSessions; ++number) {
+    auto session = std::make_shared<AskingSession>();
+    session->agent = agent.get();
+    session->token = "tree";
+    // The deepest first: no order that happens to be the right one already.
+    session->level = static_cast<std::uint32_t>((kSessions - number) * 4 / kSessions);
+    session->idString = std::to_string(number);
+    agent->updateCorrelatedSessions(*session);
+    tree.push_back(std::move(session));
+  }
+  AskingSession::questions = 0;
+  agent->updateDownstreamSessions(*tree.back());
+  EXPECT_LT(AskingSession::questions, 10 * kSessions);
+  const auto& deepest = *tree.front();
+  ASSERT_EQ(deepest.level, 4U);
+  std::string expected;
+  for (std::uint32_t level = 0; level < deepest.level; ++level) {
+    const auto first =
+        std::find_if(tree.begin(), tree.end(), [level](const auto& session) { return session->level == level; });
+    expected += (expected.empty() ? "" : ".") + (*first)->idString;
+    if (level + 1 == deepest.level) {
+      EXPECT_EQ(deepest.parent, *first);
+    }
+  }
+  EXPECT_EQ(deepest.chain, expected);
+  for (const auto& session : tree) session->parent = nullptr;
+}
+
+TEST_F(CorrelatedSessionsTest, AnswersAsBeforeAfterAnUpdate) {
+  const auto root = add(0, "A");
+  const auto child = add(1, "B");
+  agent->updateDownstreamSessions(*root);
+  agent->invalidateReportingSession(root);
+  EXPECT_EQ(agent->parentSessionForChild(*child), nullptr);
+  const auto other = add(0, "A2");
+  EXPECT_EQ(agent->parentSessionForChild(*child), other);
 }
 
 TEST_F(CorrelatedSessionsTest, LeavesTheTopmostAggregatorAlone) {

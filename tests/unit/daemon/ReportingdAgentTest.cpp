@@ -169,7 +169,7 @@ TEST_F(ReportingdAgentTest, GivesThePlaceOfAClientThatHasGoneBackAtOnceAndOnce) 
   const auto connection = connect();
   const auto session = made.back();
   session->info = PropertyDictionary{{kVelkReportingSessionInfoClientType, 9}};
-  agent->isActiveClientLimitReachedForSession(*session, *session->info);
+  static_cast<void>(agent->isActiveClientLimitReachedForSession(*session, *session->info));
   EXPECT_EQ(activeClients(9), 2);
   connection->depart();
   settleDepartures();
@@ -216,7 +216,7 @@ TEST_F(ReportingdAgentTest, DepartureThatIsHeardOfAfterTheEndChangesNothing) {
   const auto connection = connect();
   const auto session = made.back();
   session->info = PropertyDictionary{{kVelkReportingSessionInfoClientType, 9}};
-  agent->isActiveClientLimitReachedForSession(*session, *session->info);
+  static_cast<void>(agent->isActiveClientLimitReachedForSession(*session, *session->info));
   connection->depart();
   connection->end();
   settleDepartures();
@@ -278,11 +278,11 @@ TEST_F(ReportingdAgentTest, AnEmptySharedDictionaryIsData) {
 TEST_F(ReportingdAgentTest, SharedDataStayWithinTheirBound) {
   const auto session = create();
   session->token = "tree";
-  agent->updateSharedDataForSession(*session, {{"first", std::string(300'000, 'x')}});
-  agent->updateSharedDataForSession(*session, {{"second", std::string(300'000, 'x')}});
+  agent->updateSharedDataForSession(*session, {{"first", std::string(600'000, 'x')}});
+  agent->updateSharedDataForSession(*session, {{"second", std::string(600'000, 'x')}});
   EXPECT_FALSE(agent->sharedDataForSession(*session)->contains("second"));
-  EXPECT_TRUE(log.contains("data are not taken: those of its hierarchy would exceed"));
-  agent->updateSharedDataForSession(*session, {{"first", "short"}, {"second", std::string(300'000, 'x')}});
+  EXPECT_TRUE(log.contains("data are not taken: those of its hierarchy would exceed 1048576 bytes"));
+  agent->updateSharedDataForSession(*session, {{"first", "short"}, {"second", std::string(600'000, 'x')}});
   EXPECT_EQ(*agent->sharedDataForSession(*session)->string("first"), "short");
 }
 

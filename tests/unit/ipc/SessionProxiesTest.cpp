@@ -269,8 +269,9 @@ TEST_F(SessionProxiesTest, TheEndOfAggregationFitsIntoAFullOutbox) {
   ReplyInterfaceProxy toClient(daemon);
   const PropertyDictionary info{{"SessionID", 1}};
   const auto fill = [&](std::size_t bytes) {
+    ReplyInterfaceProxy another(daemon);  // which has not been refused anything yet
     std::size_t sent = 0;
-    while (toClient.sendMessageToClient(info, 0, 1, 1, PropertyDictionary{{"text", std::string(bytes, 'x')}})) ++sent;
+    while (another.sendMessageToClient(info, 0, 1, 1, PropertyDictionary{{"text", std::string(bytes, 'x')}})) ++sent;
     return sent;
   };
   // The client does not read yet.
@@ -280,6 +281,23 @@ TEST_F(SessionProxiesTest, TheEndOfAggregationFitsIntoAFullOutbox) {
   resume();
   queue->runUntil([&] { return receiver->events.size() == events + 1; });
   EXPECT_EQ(receiver->events.back(), (PropertyArray{nullptr, 0.0, 0, 0, nullptr})) << "behind everything";
+}
+
+TEST_F(SessionProxiesTest, AfterAnEventThatDidNotFitNoneIsTriedBeforeAnyWouldFit) {
+  const auto receiver = std::make_shared<RecordingClient>();
+  client->setExportedDispatcher(std::make_shared<ReplyInterfaceDispatcher>(receiver));
+  ReplyInterfaceProxy toClient(daemon);
+  const PropertyDictionary large{{"text", std::string(900'000, 'x')}};
+  std::size_t events = 0;
+  while (toClient.sendMessageToClient(std::nullopt, 0, 1, 1, large)) ++events;
+  const auto small = toClient.sendMessageToClient(std::nullopt, 0, 1, 1, PropertyDictionary{});
+  ASSERT_FALSE(small) << "it would fit, and so would have been encoded";
+  EXPECT_EQ(small.error().code, static_cast<int>(ConnectionError::outboxFull));
+  resume();
+  queue->runUntil([&] { return receiver->events.size() == events; });
+  EXPECT_TRUE(daemon->waitUntilSent(kPatience));
+  EXPECT_TRUE(toClient.sendMessageToClient(std::nullopt, 0, 1, 1, PropertyDictionary{}));
+  queue->runUntil([&] { return receiver->events.size() == events + 1; });
 }
 
 TEST_F(SessionProxiesTest, EndsOfAggregationThatNobodyReadsAreBounded) {

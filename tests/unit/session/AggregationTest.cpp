@@ -201,6 +201,20 @@ TEST_F(AggregationTest, FullOutboxIsLoggedAndTheEventGoesOn) {
   EXPECT_EQ(backend("splunk").sent.size(), 1U);
 }
 
+TEST_F(AggregationTest, AFullOutboxIsLoggedOnceAMinute) {
+  startChildOfAggregator();
+  connection->full = true;
+  const auto lines = [&] {
+    return recordedLog.count("sendMessageWithDictionary: Failed to get remote object proxy: outbox full");
+  };
+  for (int event = 0; event < 100; ++event) send(message(5, 6));
+  EXPECT_EQ(lines(), 1);
+  fakes.clock().advance(std::chrono::minutes(1));
+  for (int event = 0; event < 100; ++event) send(message(5, 6));
+  EXPECT_EQ(lines(), 2);
+  EXPECT_EQ(backend("splunk").sent.size(), 200U);
+}
+
 TEST_F(AggregationTest, ShutdownSendsOneEndMarkerAndNothingAfterIt) {
   start({"splunk"}, {}, std::nullopt, true);
   forgetStartMessages();
