@@ -169,7 +169,7 @@ TEST_F(ReportingdAgentTest, GivesThePlaceOfAClientThatHasGoneBackAtOnceAndOnce) 
   const auto connection = connect();
   const auto session = made.back();
   session->info = PropertyDictionary{{kVelkReportingSessionInfoClientType, 9}};
-  agent->isActiveClientLimitReachedForSession(*session, *session->info);
+  static_cast<void>(agent->isActiveClientLimitReachedForSession(*session, *session->info));
   EXPECT_EQ(activeClients(9), 2);
   connection->depart();
   settleDepartures();
@@ -216,7 +216,7 @@ TEST_F(ReportingdAgentTest, DepartureThatIsHeardOfAfterTheEndChangesNothing) {
   const auto connection = connect();
   const auto session = made.back();
   session->info = PropertyDictionary{{kVelkReportingSessionInfoClientType, 9}};
-  agent->isActiveClientLimitReachedForSession(*session, *session->info);
+  static_cast<void>(agent->isActiveClientLimitReachedForSession(*session, *session->info));
   connection->depart();
   connection->end();
   settleDepartures();
