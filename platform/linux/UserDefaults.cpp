@@ -48,7 +48,8 @@ FileIdentity identityOfPath(const std::string& path) {
   return ::stat(path.c_str(), &status) == 0 ? identityOf(status) : FileIdentity{};
 }
 
-enum class Usability { usable, corrupt, unreadable };
+/// `outOfReach`: for want of descriptors or memory, which says nothing about the file.
+enum class Usability { usable, corrupt, unreadable, outOfReach };
 
 /// One version of a suite's file in memory.
 struct Version {
@@ -71,9 +72,10 @@ Version readVersion(const std::string& path) {
   version.file = FileDescriptor(::open(path.c_str(), O_RDONLY | O_CLOEXEC | O_NONBLOCK | O_NOCTTY));
   if (!version.file) {
     if (errno == ENOENT || errno == ENOTDIR) return version;
+    const bool isScarcity = errno == EMFILE || errno == ENFILE || errno == ENOMEM;
     const std::string problem = std::generic_category().message(errno);
     version.identity = identityOfPath(path);
-    return problematic(std::move(version), Usability::unreadable, problem);
+    return problematic(std::move(version), isScarcity ? Usability::outOfReach : Usability::unreadable, problem);
   }
   struct stat status {};
   if (::fstat(version.file.get(), &status) == 0) version.identity = identityOf(status);
@@ -111,14 +113,30 @@ class CachedFile {
     // Not under the lock: another thread that reads the file meanwhile finds the same.
     auto version = std::make_shared<const Version>(readVersion(_path));
     Guard guard(_lock);
+    if (version->usability == Usability::outOfReach) {
+      // Not kept, so that the next read tries again.
+      isNew = !std::exchange(_isOutOfReach, true);
+      return version;
+    }
+    _isOutOfReach = false;
     _version = version;
     return version;
+  }
+
+  /// For readers: while the present version is out of reach, what was there before is closer to it than nothing.
+  std::shared_ptr<const Version> currentOrLast(bool& isNew) {
+    auto version = current(isNew);
+    if (version->usability != Usability::outOfReach) return version;
+    if (isNew) log::error("UserDefaults: Cannot read %s for now: %s", _path, version->problem);
+    Guard guard(_lock);
+    return _version != nullptr ? _version : version;
   }
 
  private:
   const std::string _path;
   Lock _lock;
   std::shared_ptr<const Version> _version VELK_GUARDED_BY(_lock);
+  bool _isOutOfReach VELK_GUARDED_BY(_lock) = false;
 };
 
 /// How long a writer waits for the others: it may be a session that holds up more than itself.
@@ -294,7 +312,7 @@ class FileUserDefaults : public UserDefaults {
  private:
   std::shared_ptr<const Version> userVersion() const {
     bool isNew = false;
-    auto version = _user.current(isNew);
+    auto version = _user.currentOrLast(isNew);
     if (version->usability == Usability::corrupt) return afterSettingAside(isNew);
     if (isNew && version->usability == Usability::unreadable) {
       log::error("UserDefaults: Cannot read %s: %s", _user.path(), version->problem);
@@ -327,10 +345,10 @@ class FileUserDefaults : public UserDefaults {
   PropertyDictionary administratorValues() const {
     if (_administrator.path().empty()) return {};
     bool isNew = false;
-    const auto version = _administrator.current(isNew);
+    const auto version = _administrator.currentOrLast(isNew);
     const bool refused = !version->isTrustworthy;
     if (isNew && refused) log::error("UserDefaults: Ignoring %s: others can write it", _administrator.path());
-    if (isNew && !refused && version->usability != Usability::usable) {
+    if (isNew && !refused && version->usability != Usability::usable && version->usability != Usability::outOfReach) {
       log::error("UserDefaults: Cannot use %s: %s", _administrator.path(), version->problem);
     }
     return refused ? PropertyDictionary() : version->values;
@@ -344,7 +362,7 @@ class FileUserDefaults : public UserDefaults {
     const SuiteLock suite(_gate);
     if (!suite.held()) return failure("UserDefaults", 1, suite.whyNot());
     const auto version = setAsideLocked(false);
-    if (version->usability == Usability::unreadable) {
+    if (version->usability == Usability::unreadable || version->usability == Usability::outOfReach) {
       return failure("UserDefaults", 2, "cannot read " + _user.path() + ": " + version->problem);
     }
     PropertyDictionary values = version->values;

@@ -4,8 +4,6 @@
 #include <gtest/gtest.h>
 #include <sys/resource.h>
 
-#include <iterator>
-
 #include "platform/Files.h"
 #include "platform/Platform.h"
 #include "platform/UserDefaults.h"

@@ -50,6 +50,19 @@ TEST(Storebag, IsFetchedOnceVerifiedAndCached) {
             1U);
 }
 
+TEST(Storebag, IsAskedForWithTheInstalledVersion) {
+  ReportingServer server;
+  server.setStorebag("heather", storebagWith(server));
+  const TemporaryDirectory installed;
+  installed.write("version", "9.3\n");
+  Daemon::Options options;
+  options.environment = {{"VELKREPORTING_DATA_DIRECTORY", installed.path()}};
+  Daemon daemon(server, options);
+
+  EXPECT_TRUE(isConfigured(openOnce(daemon, 9, 1)));
+  EXPECT_EQ(server.tls().requests().at(0).target, "/bags/vindle/heather?version=9.3");
+}
+
 TEST(Storebag, ThatAnotherKeySignedIsNeitherUsedNorCached) {
   ReportingServer server;
   ReportingServer stranger;

@@ -200,6 +200,7 @@ TEST_F(StorebagServiceTest, ARefreshThatIsPendingIsNotAskedForTwice) {
   EXPECT_EQ(
       log.count("getURLRequestWithCompletionHandler: ignored duplicate request for storebag '" + defaultUrl() + "'"),
       1);
+  pool->stop();
   EXPECT_EQ(http.sessions().size(), 1U);
 }
 
@@ -492,6 +493,7 @@ TEST_F(PullDueTest, IsTheBusinessOfNoFreshCopy) {
   setPullDue("bramble", 50);
   putOnDisk("bramble", bagWithSections("new"), 600);
   fetch();
+  pool->stop();
   EXPECT_TRUE(http.sessions().empty());
 }
 

@@ -4,6 +4,7 @@
 #include <gtest/gtest.h>
 #include <signal.h>
 #include <sys/file.h>
+#include <sys/resource.h>
 #include <sys/stat.h>
 #include <sys/wait.h>
 #include <unistd.h>
@@ -196,6 +197,29 @@ TEST_F(UserDefaultsTest, DoesNotReplaceWhatItCannotRead) {
   EXPECT_EQ(suite->value("key"), std::nullopt);
   EXPECT_FALSE(suite->set("key", 1));
   EXPECT_EQ(log.lines().size(), 1U);
+}
+
+TEST_F(UserDefaultsTest, KeepsToWhatItReadLastWhileDescriptorsAreShort) {
+#ifdef __SANITIZE_ADDRESS__
+  GTEST_SKIP() << "this sanitizer needs descriptors";
+#endif
+  const auto suite = open();
+  ASSERT_TRUE(suite->set("key", "old"));
+  EXPECT_EQ(suite->value("key"), PropertyValue("old"));
+  ASSERT_TRUE(open()->set("key", "new"));
+  rlimit usual{};
+  ASSERT_EQ(::getrlimit(RLIMIT_NOFILE, &usual), 0);
+  const rlimit none{0, usual.rlim_max};
+  ASSERT_EQ(::setrlimit(RLIMIT_NOFILE, &none), 0);
+  const auto during = suite->value("key");
+  const auto again = suite->value("key");
+  const auto written = suite->set("other", 1);
+  ASSERT_EQ(::setrlimit(RLIMIT_NOFILE, &usual), 0);
+  EXPECT_EQ(during, PropertyValue("old"));
+  EXPECT_EQ(again, PropertyValue("old"));
+  EXPECT_FALSE(written);
+  EXPECT_EQ(log.lines().size(), 1U) << "told once";
+  EXPECT_EQ(suite->value("key"), PropertyValue("new"));
 }
 
 TEST_F(UserDefaultsTest, StoresAValueOnlyWhereThereIsNone) {
