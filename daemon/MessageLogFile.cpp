@@ -1,12 +1,15 @@
 #include "daemon/MessageLogFile.h"
 
+#include <algorithm>
 #include <array>
 #include <cstdio>
 #include <ctime>
+#include <utility>
 #include <vector>
 
 #include "daemon/MessageLogTexts.h"
 #include "foundation/Text.h"
+#include "platform/BlockingScope.h"
 #include "platform/Clock.h"
 #include "platform/Files.h"
 #include "platform/LocalTime.h"
@@ -22,6 +25,8 @@ constexpr const char* kLogType = "224";
 constexpr double kMaximumAgeInSeconds = 86400;
 constexpr std::size_t kMaximumEntryBytes = 256 * 1024;
 constexpr std::size_t kMaximumFileBytes = 64 * 1024 * 1024;
+/// More than the files that can wait for their submission.
+constexpr int kNamesTried = 10;
 
 std::string formatted(const std::tm& time, const char* format) {
   std::array<char, 64> buffer{};
@@ -62,16 +67,6 @@ std::vector<std::string_view> partsOfOwnName(std::string_view name) {
   return parts;
 }
 
-/// When the file was made: what its name says, else its birth. Appending changes neither.
-std::optional<Date> creationDate(const std::string& path) {
-  const auto parts = partsOfOwnName(std::string_view(path).substr(path.rfind('/') + 1));
-  if (parts.size() == 3) {
-    if (const auto date = dateFromNameTime(std::string(parts[1]))) return date;
-  }
-  const auto birth = files::creationTime(path);
-  return birth ? std::optional(Date{secondsFromTimeValue(*birth)}) : std::nullopt;
-}
-
 bool isContinuationByte(char character) { return (static_cast<unsigned char>(character) & 0xc0) == 0x80; }
 
 std::string_view cut(std::string_view text) {
@@ -94,9 +89,7 @@ bool standsAsItIs(std::string_view text) {
 }
 
 /// The text with its line breaks and tabs, but no other control character; no line of it looks like a new entry.
-std::string entryText(std::string_view text) {
-  text = cut(text);
-  if (standsAsItIs(text)) return std::string(text);
+std::string changedText(std::string_view text) {
   std::string result;
   bool first = true;
   for (const auto line : split(text, '\n')) {
@@ -114,10 +107,31 @@ std::string entryText(std::string_view text) {
 
 }  // namespace
 
+/// Made before the lock is taken. The text outlives it.
+struct MessageLogFile::Entry {
+  Entry(Date date, std::string_view whole) : head("(" + dateText(date) + ") "), text(cut(whole)) {
+    if (standsAsItIs(text)) return;
+    changed = changedText(text);
+    text = changed;
+  }
+  Entry(const Entry&) = delete;
+  Entry& operator=(const Entry&) = delete;
+  [[nodiscard]] std::size_t size() const { return head.size() + text.size() + 1; }
+
+  const std::string head;
+  std::string changed;
+  std::string_view text;
+};
+
 Monitor MessageLogFile::_logFileLock;
 
-MessageLogFile::MessageLogFile(std::string directory, const Clock& clock, LogSubmission& submission)
-    : _directory(std::move(directory)), _clock(clock), _submission(submission) {}
+MessageLogFile::MessageLogFile(std::string directory, const Clock& clock, LogSubmission& submission,
+                               std::shared_ptr<Queue> expiryQueue, CreationTime creationTime)
+    : _directory(std::move(directory)),
+      _clock(clock),
+      _submission(submission),
+      _expiryQueue(std::move(expiryQueue)),
+      _creationTime(std::move(creationTime)) {}
 
 Date MessageLogFile::now() const { return Date{secondsFromTimeValue(_clock.wallTime())}; }
 
@@ -125,26 +139,57 @@ bool MessageLogFile::isExpired(const std::optional<Date>& date) const {
   return date && now().secondsSince1970 - date->secondsSince1970 > kMaximumAgeInSeconds;
 }
 
-bool MessageLogFile::isOfTheFuture(const std::optional<Date>& date) const {
-  return date && date->secondsSince1970 - now().secondsSince1970 > kMaximumAgeInSeconds;
+/// The file's birth, which neither entries nor a change of the time zone move. On a file system that keeps none the
+/// time in the name stands in: the time of the last change would never be a day ago.
+std::optional<Date> MessageLogFile::creationDate(const std::string& path) const {
+  if (const auto birth = _creationTime(path)) return Date{secondsFromTimeValue(*birth)};
+  const auto parts = partsOfOwnName(std::string_view(path).substr(path.rfind('/') + 1));
+  return parts.empty() ? std::nullopt : dateFromNameTime(std::string(parts[1]));
 }
 
 void MessageLogFile::writeToLogFile(std::string_view text) {
-  Guard guard(_logFileLock);
-  // A current file without a date is used as it is.
-  if (!_currentPath || isExpired(_currentDate)) scanDirectory();
-  if (!_currentPath) return;
-  appendEntry(text);
+  const Entry entry(now(), text);
+  Steps steps;
+  {
+    Guard guard(_logFileLock);
+    // A current file without a date is used as it is.
+    if (!_currentPath || isExpired(_currentDate)) scanDirectoryLocked(steps);
+    if (_currentPath) appendLocked(entry, steps);
+  }
+  perform(std::move(steps));
 }
 
-void MessageLogFile::scanDirectory() {
-  // The current file is not forgotten before the scan: when it has expired it may stay current by name until the next
-  // entry finds it gone.
-  for (const auto& path : ownFiles()) considerEntry(path, creationDate(path));
-  if (!_currentPath) createNewLogFile(&_currentPath, &_currentDate);
+void MessageLogFile::perform(Steps steps) {
+  const auto isExpiry = [](const Step& step) { return step.format == nullptr; };
+  if (std::none_of(steps.begin(), steps.end(), isExpiry)) return performNow(steps);
+  // The lines behind the end of a file wait for it, so that they tell what happened in its order.
+  _expiryQueue->async([this, steps = std::move(steps)] { performNow(steps); });
 }
 
-std::vector<std::string> MessageLogFile::ownFiles() {
+void MessageLogFile::performNow(const Steps& steps) {
+  for (const auto& step : steps) {
+    if (step.format == nullptr) {
+      deleteExpiredLogFile(*step.subject, step.date);
+      Guard guard(_logFileLock);
+      _expiring.erase(std::find(_expiring.begin(), _expiring.end(), *step.subject));
+    } else if (step.level == log::Level::error) {
+      log::error(step.format, step.subject);
+    } else {
+      log::standard(step.format, step.subject, dateText(step.date));
+    }
+  }
+}
+
+void MessageLogFile::scanDirectoryLocked(Steps& steps) {
+  // The current file is not forgotten before the scan: when it has expired it may stay current by name until this entry
+  // finds it gone.
+  for (const auto& path : ownFiles(steps)) {
+    if (!isExpiringLocked(path)) considerEntryLocked(path, creationDate(path), steps);
+  }
+  if (!_currentPath) createLocked(_currentPath, _currentDate, steps);
+}
+
+std::vector<std::string> MessageLogFile::ownFiles(Steps& steps) const {
   std::vector<std::string> paths;
   const auto names = files::list(_directory);
   if (names) {
@@ -154,24 +199,33 @@ std::vector<std::string> MessageLogFile::ownFiles() {
     return paths;
   }
   if (names.error().code != static_cast<int>(files::Code::notFound)) {
-    log::error(logtexts::kErrorReadingLogDirectory, names.error());
+    steps.push_back({log::Level::error, logtexts::kErrorReadingLogDirectory, names.error().description});
     return paths;
   }
-  log::standard(logtexts::kCreatingLogDirectory, _directory);
+  steps.push_back({log::Level::standard, logtexts::kCreatingLogDirectory, _directory});
   // When it cannot be made, the file in it cannot either, and that is reported.
   (void)files::createDirectories(_directory);
   return paths;
 }
 
-void MessageLogFile::considerEntry(const std::string& path, const std::optional<Date>& date) {
-  if (isExpired(date)) return deleteExpiredLogFile(path, date);
+void MessageLogFile::considerEntryLocked(const std::string& path, const std::optional<Date>& date, Steps& steps) {
+  if (isExpired(date)) return expireLocked(path, date, steps);
   if (_currentPath && _currentDate) {
     const bool isNewer = date && date->secondsSince1970 > _currentDate->secondsSince1970;
-    if (!isNewer) return deleteExpiredLogFile(path, date);
-    deleteExpiredLogFile(*_currentPath, _currentDate);
+    if (!isNewer) return expireLocked(path, date, steps);
+    expireLocked(*_currentPath, _currentDate, steps);
   }
   _currentPath = path;
   _currentDate = date;
+}
+
+void MessageLogFile::expireLocked(const std::string& path, const std::optional<Date>& date, Steps& steps) {
+  _expiring.push_back(path);
+  steps.push_back({log::Level::standard, nullptr, path, date});
+}
+
+bool MessageLogFile::isExpiringLocked(const std::string& path) const {
+  return std::find(_expiring.begin(), _expiring.end(), path) != _expiring.end();
 }
 
 void MessageLogFile::createNewLogFile(std::optional<std::string>* path, std::optional<Date>* creation) {
@@ -179,22 +233,45 @@ void MessageLogFile::createNewLogFile(std::optional<std::string>* path, std::opt
     log::error(logtexts::kLogFileArgumentsMissing);
     return;
   }
-  path->reset();
-  creation->reset();
-  std::string created =
-      _directory + "/" + std::string(kNamePrefix) + "_" + nameTime(now()) + "_" + std::string(kNameSuffix);
-  // What counts is whether the file is there: one of the same second is as good.
+  Steps steps;
+  {
+    Guard guard(_logFileLock);
+    createLocked(*path, *creation, steps);
+  }
+  perform(std::move(steps));
+}
+
+/// Named after this second, or after the next one whose name is free: a full file is replaced within its second.
+std::string MessageLogFile::freePathLocked() const {
+  const Date date = now();
+  std::string path;
+  for (int second = 0; second < kNamesTried; ++second) {
+    path = _directory + "/" + std::string(kNamePrefix) + "_" + nameTime(Date{date.secondsSince1970 + second}) + "_" +
+           std::string(kNameSuffix);
+    if (!files::exists(path) && !isExpiringLocked(path)) break;
+  }
+  return path;
+}
+
+void MessageLogFile::createLocked(std::optional<std::string>& path, std::optional<Date>& creation, Steps& steps) {
+  path.reset();
+  creation.reset();
+  _file = AppendedFile();
+  std::string created = freePathLocked();
+  // What counts is whether the file is there.
   (void)_submission.createSubmittableLog(created, kLogType);
   if (!files::exists(created)) {
-    log::error(logtexts::kFailedToCreateLogFile, created);
+    steps.push_back({log::Level::error, logtexts::kFailedToCreateLogFile, std::move(created)});
     return;
   }
-  *creation = creationDate(created);
-  log::standard(logtexts::kCreatedLogFile, created, dateText(*creation));
-  *path = std::move(created);
+  creation = creationDate(created);
+  steps.push_back({log::Level::standard, logtexts::kCreatedLogFile, created, creation});
+  path = std::move(created);
 }
 
 void MessageLogFile::deleteExpiredLogFile(const std::string& path, const std::optional<Date>& creation) {
+  // The submission may copy the file.
+  BlockingScope blocking;
   if (_submission.moveForSubmission(path, kLogType)) {
     log::standard(logtexts::kSubmittedLogFile, path, dateText(creation));
     return;
@@ -204,27 +281,39 @@ void MessageLogFile::deleteExpiredLogFile(const std::string& path, const std::op
   log::standard(logtexts::kDeletedLogFile, path, dateText(creation));
 }
 
-void MessageLogFile::appendEntry(std::string_view text) {
-  const std::string line = "(" + dateText(now()) + ") " + entryText(text) + "\n";
-  const auto size = files::size(*_currentPath);
-  if (size && *size + line.size() > kMaximumFileBytes && isOfTheFuture(_currentDate)) {
-    // Made while the clock was wrong: it would stay current, and full, until its day has come.
-    deleteExpiredLogFile(*_currentPath, _currentDate);
-    createNewLogFile(&_currentPath, &_currentDate);
-    if (!_currentPath) return;
-  } else if (size && *size + line.size() > kMaximumFileBytes) {
-    if (_reportedFull != _currentPath) log::error("writeToLogFile: %s is full", *_currentPath);
-    _reportedFull = _currentPath;
-    return;
+/// False: the entry is lost. A full current file is replaced.
+bool MessageLogFile::hasRoomLocked(std::size_t size, const Entry& entry, Steps& steps) {
+  if (size + entry.size() <= kMaximumFileBytes) return true;
+  if (_expiring.size() >= kMaximumExpiring) {
+    if (!std::exchange(_saidThatEntriesAreLost, true)) {
+      steps.push_back(
+          {log::Level::error, "writeToLogFile: %s is full, and those before it are not submitted yet", _currentPath});
+    }
+    return false;
   }
-  const auto appended = files::append(*_currentPath, {reinterpret_cast<const std::uint8_t*>(line.data()), line.size()});
-  if (!appended && appended.error().code == static_cast<int>(files::Code::incomplete)) {
-    log::error("writeToLogFile: %s", appended.error());
+  expireLocked(*_currentPath, _currentDate, steps);
+  createLocked(_currentPath, _currentDate, steps);
+  return _currentPath && _file.open(*_currentPath);
+}
+
+void MessageLogFile::appendLocked(const Entry& entry, Steps& steps) {
+  const auto size = _file.open(*_currentPath);
+  if (!size || isExpiringLocked(*_currentPath)) {
+    // A file that was taken away costs the message in hand; the next one goes to the new file.
+    createLocked(_currentPath, _currentDate, steps);
+  } else if (!hasRoomLocked(*size, entry, steps)) {
     return;
+  } else if (const auto appended = _file.append({entry.head, entry.text, "\n"}); !appended) {
+    // Once, not for every message while the disk is full.
+    if (std::exchange(_saidThatEntriesAreLost, true)) return;
+    steps.push_back({log::Level::error, "writeToLogFile: %s", appended.error().description});
+    return;
+  } else {
+    _saidThatEntriesAreLost = false;
   }
-  // A file that was taken away costs the message in hand; the next one goes to the new file.
-  if (!appended) createNewLogFile(&_currentPath, &_currentDate);
-  log::standard(logtexts::kSavedLogMessage, _currentPath);
+  if (log::isEnabled(log::Level::standard)) {
+    steps.push_back({log::Level::standard, logtexts::kSavedLogMessage, _currentPath});
+  }
 }
 
 }  // namespace velk

@@ -71,5 +71,8 @@ int main(int argumentCount, char** arguments) {
   if (const auto* status = std::get_if<int>(&parsed)) return *status;
   const auto& options = std::get<velk::DaemonOptions>(parsed);
   velk::log::setSink(velk::log::makeSystemLogSink("velkreportingd", options.foreground), options.logLevel);
-  return runDaemon(options);
+  velk::log::flushSystemLogOnFatalSignals();
+  const int status = runDaemon(options);
+  velk::log::flushSystemLog();
+  return status;
 }

@@ -10,11 +10,18 @@
 
 namespace velk::log {
 
-/// For the daemon and the tools. Structured journal entries when the standard error stream is the journal's
-/// (JOURNAL_STREAM names it) unless `alwaysErrorStream`, otherwise lines on it: "<7>", "<6>" or "<3>" for debug,
-/// standard and error, then the line, so that whoever collects the stream knows the level. `identifier` names the
-/// program. A line that cannot be written is lost.
-[[nodiscard]] std::shared_ptr<Sink> makeSystemLogSink(std::string identifier, bool alwaysErrorStream = false);
+/// For the programs. Structured journal entries when the standard error stream is the journal's (JOURNAL_STREAM names
+/// it) unless `alwaysErrorStream`, otherwise lines on it: "<7>", "<6>" or "<3>" for debug, standard and error, then the
+/// line, so that whoever collects the stream knows the level. `identifier` names the program. Callers never wait for
+/// the stream or the journal: a thread of the log's own writes (see LogWriter.h). A line that cannot be written is
+/// lost.
+[[nodiscard]] std::shared_ptr<Sink> makeSystemLogSink(const std::string& identifier, bool alwaysErrorStream = false);
+
+/// Waits until the newest of those sinks has written what it was given, half a second at most: before a process ends.
+void flushSystemLog();
+/// From here on a fatal signal waits as long before it ends the process, so that its last lines are seen. Signals that
+/// have a handler keep it. Once a process.
+void flushSystemLogOnFatalSignals();
 
 /// For processes that link the library. Says nothing unless its owner asked for it: VELKREPORTING_LOG (read with
 /// secure_getenv) as "debug", "default" or "error" sends lines of that level and above to the standard error stream,

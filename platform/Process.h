@@ -28,7 +28,8 @@ void limitHeaps();
 /// Gives memory that is free back to the system. Takes some milliseconds after a busy time.
 void returnFreeMemory();
 
-/// Ends the process at once, whatever its threads do: nothing more of it runs.
+/// Ends the process at once, whatever its threads do: nothing more of it runs, but for the system log's last lines (see
+/// `flushSystemLog`).
 [[noreturn]] void endNow(int status);
 
 /// The main thread's wait: for the signals that steer a daemon, and for other threads that want it to look.

@@ -17,6 +17,8 @@
 #include <cstdlib>
 #include <cstring>
 
+#include "platform/LogSinks.h"
+
 namespace velk::process {
 namespace {
 
@@ -51,7 +53,10 @@ void limitHeaps() { ::mallopt(M_ARENA_MAX, 2); }
 
 void returnFreeMemory() { ::malloc_trim(0); }
 
-void endNow(int status) { ::_exit(status); }
+void endNow(int status) {
+  log::flushSystemLog();
+  ::_exit(status);
+}
 
 void setUtilityPriority() {
   static_cast<void>(::setpriority(PRIO_PROCESS, 0, kUtilityNice));

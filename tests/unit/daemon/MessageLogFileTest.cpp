@@ -4,13 +4,16 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
+#include <atomic>
 #include <ctime>
+#include <map>
 #include <thread>
 #include <vector>
 
 #include "daemon/MessageLogTexts.h"
 #include "platform/Files.h"
 #include "tests/support/FakePlatform.h"
+#include "tests/support/ManualScheduler.h"
 #include "tests/support/RecordingLog.h"
 #include "tests/support/TemporaryDirectory.h"
 
@@ -19,10 +22,24 @@ namespace {
 
 constexpr std::int64_t kHour = 3600;
 constexpr std::int64_t kDay = 24 * kHour;
+constexpr off_t kFullFile = 64 * 1024 * 1024;
 
 class MessageLogFileTest : public testing::Test {
  protected:
-  MessageLogFileTest() : subject(directory / "logs", clock, submission) {}
+  MessageLogFileTest()
+      : subject(directory / "logs", clock, submission, scheduler.makeSerialQueue("expired"),
+                [this](const std::string& path) { return birthOf(path); }) {}
+
+  /// A message, and the end of what it made expire.
+  void write(std::string_view text) {
+    subject.writeToLogFile(text);
+    scheduler.runUntilIdle();
+  }
+  /// As the file system would say it, if the clock were its clock.
+  [[nodiscard]] std::optional<TimeValue> birthOf(const std::string& path) {
+    if (!hasBirths) return std::nullopt;
+    return births.try_emplace(path, clock.wallTime()).first->second;
+  }
 
   /// The name of a log made this many seconds before now.
   [[nodiscard]] std::string nameAt(std::int64_t age) const {
@@ -34,9 +51,12 @@ class MessageLogFileTest : public testing::Test {
     return text;
   }
   [[nodiscard]] std::string pathAt(std::int64_t age) const { return directory / ("logs/" + nameAt(age)); }
-  std::string makeLog(std::int64_t age, std::string_view contents) const {
-    return directory.write("logs/" + nameAt(age), contents);
+  std::string makeLog(std::int64_t age, std::string_view contents) {
+    const auto path = directory.write("logs/" + nameAt(age), contents);
+    births[path] = TimeValue{clock.wallTime().seconds - age, 0};
+    return path;
   }
+  static void fill(const std::string& path) { ASSERT_EQ(::truncate(path.c_str(), kFullFile), 0); }
   [[nodiscard]] std::vector<std::string> logFiles() const {
     return files::list(directory / "logs").value_or(std::vector<std::string>());
   }
@@ -57,13 +77,16 @@ class MessageLogFileTest : public testing::Test {
 
   test::RecordingLog log;
   const test::TemporaryDirectory directory;
-  test::FakeClock clock;
+  test::ManualScheduler scheduler;
+  test::FakeClock& clock = scheduler.fakeClock();
   test::FakeLogSubmission submission;
+  std::map<std::string, TimeValue> births;
+  bool hasBirths = true;
   MessageLogFile subject;
 };
 
 TEST_F(MessageLogFileTest, BeginsWithOneFileAndOneLine) {
-  subject.writeToLogFile("[post -> sendMessageWithDictionary] {}");
+  write("[post -> sendMessageWithDictionary] {}");
   ASSERT_EQ(logFiles(), std::vector<std::string>{nameAt(0)});
   EXPECT_EQ(contents(nameAt(0)), "(2020-09-13 12:26:40 +0000) [post -> sendMessageWithDictionary] {}\n");
   ASSERT_EQ(submission.created().size(), 1U);
@@ -80,9 +103,9 @@ TEST_F(MessageLogFileTest, BeginsWithOneFileAndOneLine) {
 }
 
 TEST_F(MessageLogFileTest, AppendsToTheCurrentFile) {
-  subject.writeToLogFile("first");
+  write("first");
   clock.advance(std::chrono::hours(24));
-  subject.writeToLogFile("second");
+  write("second");
   EXPECT_EQ(contents(nameAt(kDay)), "(2020-09-13 12:26:40 +0000) first\n(2020-09-14 12:26:40 +0000) second\n");
   EXPECT_EQ(logFiles().size(), 1U);
 }
@@ -90,7 +113,7 @@ TEST_F(MessageLogFileTest, AppendsToTheCurrentFile) {
 TEST_F(MessageLogFileTest, SubmitsTheOldLogAndGoesOnWithTheRecentOne) {
   const auto old = makeLog(2 * kDay, "old\n");
   makeLog(kHour, "recent\n");
-  subject.writeToLogFile("new");
+  write("new");
   EXPECT_EQ(movedPaths(), std::vector<std::string>{old});
   EXPECT_EQ(logFiles(), std::vector<std::string>{nameAt(kHour)});
   EXPECT_EQ(contents(nameAt(kHour)), "recent\n(2020-09-13 12:26:40 +0000) new\n");
@@ -104,7 +127,7 @@ TEST_F(MessageLogFileTest, DeletesWhatIsNotTaken) {
   submission.accepts = false;
   const auto old = makeLog(2 * kDay, "old\n");
   makeLog(kHour, "recent\n");
-  subject.writeToLogFile("new");
+  write("new");
   EXPECT_EQ(logFiles(), std::vector<std::string>{nameAt(kHour)});
   EXPECT_EQ(log.count(log::Level::standard, "deleteExpiredLogFile: Deleted expired velkreportingd log file " + old +
                                                 " (2020-09-11 12:26:40 +0000)"),
@@ -115,7 +138,7 @@ TEST_F(MessageLogFileTest, KeepsTheNewestOfTheRecentLogs) {
   const auto older = makeLog(5 * kHour, "older\n");
   const auto oldest = makeLog(6 * kHour, "oldest\n");
   makeLog(kHour, "newer\n");
-  subject.writeToLogFile("new");
+  write("new");
   EXPECT_EQ(movedPaths(), (std::vector<std::string>{oldest, older}));
   EXPECT_EQ(logFiles(), std::vector<std::string>{nameAt(kHour)});
 }
@@ -125,69 +148,141 @@ TEST_F(MessageLogFileTest, IgnoresFilesOfOtherServices) {
       "other_2020-09-10-00-00-00_messageLog.ips", "velkreportingd_2020-09-10-00-00-00_messageLog.ips_x",
       "velkreportingd_a_b_messageLog.ips", "velkreportingd_messageLog.ips", "velkreportingd_x_other.txt"};
   for (const auto& name : foreign) directory.write("logs/" + name, "foreign");
-  subject.writeToLogFile("new");
+  write("new");
   EXPECT_TRUE(movedPaths().empty());
   EXPECT_EQ(logFiles().size(), foreign.size() + 1);
   for (const auto& name : foreign) EXPECT_EQ(contents(name), "foreign");
 }
 
 TEST_F(MessageLogFileTest, ReplacesACurrentFileAfterADay) {
-  subject.writeToLogFile("first");
+  write("first");
   clock.advance(std::chrono::seconds(kDay + 1));
   log.clear();
-  subject.writeToLogFile("lost");
+  write("lost");
   // The expired file is found gone, which costs this message.
   EXPECT_EQ(movedPaths(), std::vector<std::string>{pathAt(kDay + 1)});
   EXPECT_EQ(logFiles(), std::vector<std::string>{nameAt(0)});
   EXPECT_EQ(contents(nameAt(0)), "");
   EXPECT_EQ(log.count("writeToLogFile: Saved log message to " + pathAt(0)), 1);
-  subject.writeToLogFile("kept");
+  write("kept");
   EXPECT_EQ(contents(nameAt(0)), "(2020-09-14 12:26:41 +0000) kept\n");
 }
 
 TEST_F(MessageLogFileTest, LosesOneMessageWhenTheFileVanished) {
-  subject.writeToLogFile("first");
+  write("first");
   ASSERT_TRUE(files::remove(pathAt(0)));
   clock.advance(std::chrono::minutes(1));
-  subject.writeToLogFile("lost");
+  write("lost");
   EXPECT_EQ(contents(nameAt(0)), "");
-  subject.writeToLogFile("kept");
+  write("kept");
   EXPECT_EQ(contents(nameAt(0)), "(2020-09-13 12:27:40 +0000) kept\n");
 }
 
-TEST_F(MessageLogFileTest, DropsMessagesWhileItsFileIsFullAndSaysSoOnce) {
-  subject.writeToLogFile("first");
-  ASSERT_EQ(::truncate(pathAt(0).c_str(), 64 * 1024 * 1024), 0);
-  subject.writeToLogFile("dropped");
-  subject.writeToLogFile("dropped");
-  EXPECT_EQ(files::size(pathAt(0)), 64U * 1024 * 1024);
-  EXPECT_EQ(log.count(log::Level::error, "writeToLogFile: " + pathAt(0) + " is full"), 1);
+TEST_F(MessageLogFileTest, GoesOnInANewFileWhenTheCurrentOneIsFull) {
+  write("first");
+  fill(pathAt(0));
+  log.clear();
+  write("kept");
+  // The name of this second is taken.
+  ASSERT_EQ(logFiles(), std::vector<std::string>{nameAt(-1)});
+  EXPECT_EQ(contents(nameAt(-1)), "(2020-09-13 12:26:40 +0000) kept\n");
+  EXPECT_EQ(movedPaths(), std::vector<std::string>{pathAt(0)});
+  std::vector<std::string> texts;
+  for (const auto& line : log.lines()) texts.push_back(line.text.substr(0, line.text.find(pathAt(0).substr(0, 20))));
+  EXPECT_EQ(texts,
+            (std::vector<std::string>{"deleteExpiredLogFile: LogMoveForSubmission succesfully submitted log file ",
+                                      "writeToLogFile: Created new velkreportingd log file ",
+                                      "writeToLogFile: Saved log message to "}));
+  clock.advance(std::chrono::hours(1));
+  write("second");
+  EXPECT_EQ(contents(nameAt(kHour - 1)), "(2020-09-13 12:26:40 +0000) kept\n(2020-09-13 13:26:40 +0000) second\n");
 }
 
-// The clock was years ahead when the file was made, and has been set right since.
-TEST_F(MessageLogFileTest, ReplacesAFullFileOfTheFuture) {
-  const auto future = makeLog(-30 * kDay, "");
-  ASSERT_EQ(::truncate(future.c_str(), 64 * 1024 * 1024), 0);
-  subject.writeToLogFile("kept");
-  EXPECT_EQ(movedPaths(), std::vector<std::string>{future});
-  EXPECT_EQ(contents(nameAt(0)), "(2020-09-13 12:26:40 +0000) kept\n");
+TEST_F(MessageLogFileTest, DeletesAFullFileThatIsNotTaken) {
+  submission.accepts = false;
+  write("first");
+  fill(pathAt(0));
+  write("kept");
+  EXPECT_EQ(logFiles(), std::vector<std::string>{nameAt(-1)});
+}
+
+TEST_F(MessageLogFileTest, FilesThatFillUpWithinASecondAreNotConfused) {
+  submission.accepts = false;
+  for (int number = 0; number < 3; ++number) {
+    subject.writeToLogFile("entry " + std::to_string(number));
+    fill(pathAt(-number));
+  }
+  EXPECT_EQ(logFiles(), (std::vector<std::string>{nameAt(0), nameAt(-1), nameAt(-2)}));
+  subject.writeToLogFile("last");
+  EXPECT_EQ(logFiles().size(), 4U);
+  scheduler.runUntilIdle();
+  EXPECT_EQ(logFiles(), std::vector<std::string>{nameAt(-3)});
+  EXPECT_EQ(contents(nameAt(-3)), "(2020-09-13 12:26:40 +0000) last\n");
+}
+
+TEST_F(MessageLogFileTest, DropsEntriesWhileTooManyFullFilesWaitAndSaysSoOnce) {
+  for (std::size_t number = 0; number <= MessageLogFile::kMaximumExpiring; ++number) {
+    subject.writeToLogFile("entry");
+    fill(pathAt(-static_cast<std::int64_t>(number)));
+  }
+  subject.writeToLogFile("dropped");
+  subject.writeToLogFile("dropped");
+  EXPECT_EQ(logFiles().size(), MessageLogFile::kMaximumExpiring + 1);
+  EXPECT_EQ(log.count(log::Level::error,
+                      "writeToLogFile: " + pathAt(-3) + " is full, and those before it are not submitted yet"),
+            1);
+  scheduler.runUntilIdle();
+  write("kept");
+  ASSERT_EQ(logFiles().size(), 1U);
+  EXPECT_TRUE(contents(logFiles()[0]).ends_with("kept\n"));
+}
+
+// Its submission may read it whole, over a slow disk.
+TEST_F(MessageLogFileTest, NoEntryWaitsForTheSubmission) {
+  const auto old = makeLog(2 * kDay, "old\n");
+  subject.writeToLogFile("one");
+  subject.writeToLogFile("two");
+  EXPECT_TRUE(submission.moved().empty());
+  EXPECT_EQ(contents(nameAt(0)), "(2020-09-13 12:26:40 +0000) one\n(2020-09-13 12:26:40 +0000) two\n");
+  scheduler.runUntilIdle();
+  EXPECT_EQ(movedPaths(), std::vector<std::string>{old});
+}
+
+// A sink that needs the message log's lock on another thread: it would wait for ever if a line were written under it.
+TEST_F(MessageLogFileTest, WritesNoLineOfTheSystemLogUnderItsLock) {
+  class Writer final : public log::Sink {
+   public:
+    explicit Writer(MessageLogFile& messageLog) : _messageLog(messageLog) {}
+    void write(log::Level, std::string_view) override {
+      if (_isBusy.exchange(true)) return;
+      std::thread([this] { _messageLog.writeToLogFile("from another thread"); }).join();
+      _isBusy = false;
+    }
+
+   private:
+    MessageLogFile& _messageLog;
+    std::atomic<bool> _isBusy = false;
+  };
+  log::setSink(std::make_shared<Writer>(subject));
+  write("first");
+  EXPECT_TRUE(contents(nameAt(0)).ends_with("from another thread\n"));
 }
 
 TEST_F(MessageLogFileTest, TriesAgainAfterAFileCouldNotBeMade) {
   submission.creates = false;
-  subject.writeToLogFile("dropped");
+  write("dropped");
   EXPECT_EQ(log.count(log::Level::error, "writeToLogFile: Failed to create new velkreportingd log file " + pathAt(0)),
             1);
   EXPECT_TRUE(logFiles().empty());
   submission.creates = true;
-  subject.writeToLogFile("kept");
+  write("kept");
   EXPECT_EQ(contents(nameAt(0)), "(2020-09-13 12:26:40 +0000) kept\n");
 }
 
 TEST_F(MessageLogFileTest, ReportsADirectoryThatItCannotRead) {
   // A loop of symbolic links can neither be read nor made.
   ASSERT_EQ(::symlink((directory / "logs").c_str(), (directory / "logs").c_str()), 0);
-  subject.writeToLogFile("dropped");
+  write("dropped");
   ASSERT_FALSE(log.lines().empty());
   EXPECT_EQ(log.lines()[0].level, log::Level::error);
   EXPECT_TRUE(log.contains("writeToLogFile: Error reading from log directory: "));
@@ -213,14 +308,44 @@ TEST_F(MessageLogFileTest, ForgetsTheOldFileBeforeItMakesANewOne) {
   EXPECT_EQ(date, std::nullopt);
 }
 
-TEST_F(MessageLogFileTest, TellsTheAgeByTheNameNotByTheLastChange) {
-  const auto old = makeLog(2 * kDay, "appended to just now\n");
-  subject.writeToLogFile("new");
+// A change of the time zone, or of the clock, leaves names that say something else.
+TEST_F(MessageLogFileTest, TellsTheAgeByTheBirthNotByTheName) {
+  const auto old = makeLog(kHour, "born long ago\n");
+  births[old] = TimeValue{clock.wallTime().seconds - 2 * kDay, 0};
+  const auto recent = makeLog(3 * kDay, "recent\n");
+  births[recent] = TimeValue{clock.wallTime().seconds - kHour, 0};
+  write("new");
   EXPECT_EQ(movedPaths(), std::vector<std::string>{old});
+  EXPECT_EQ(contents(nameAt(3 * kDay)), "recent\n(2020-09-13 12:26:40 +0000) new\n");
+}
+
+TEST_F(MessageLogFileTest, NameTellsTheAgeWhereTheFileSystemKeepsNoBirth) {
+  hasBirths = false;
+  const auto old = makeLog(2 * kDay, "appended to just now\n");
+  const auto recent = makeLog(kHour, "recent\n");
+  write("new");
+  EXPECT_EQ(movedPaths(), std::vector<std::string>{old});
+  EXPECT_EQ(contents(nameAt(kHour)), "recent\n(2020-09-13 12:26:40 +0000) new\n");
+}
+
+TEST_F(MessageLogFileTest, EntryThatWasCutOffBeforeTheStartGetsItsLineBreak) {
+  makeLog(kHour, "whole\ncut o");
+  write("new");
+  EXPECT_EQ(contents(nameAt(kHour)), "whole\ncut o\n(2020-09-13 12:26:40 +0000) new\n");
+}
+
+TEST_F(MessageLogFileTest, LosesOneMessageWhenTheFileWasMovedAndNeverWritesToItAgain) {
+  write("first");
+  const auto moved = directory / "logs/moved";
+  ASSERT_TRUE(files::move(pathAt(0), moved));
+  write("lost");
+  write("kept");
+  EXPECT_EQ(contents("moved"), "(2020-09-13 12:26:40 +0000) first\n");
+  EXPECT_EQ(contents(nameAt(0)), "(2020-09-13 12:26:40 +0000) kept\n");
 }
 
 TEST_F(MessageLogFileTest, LetsNoTextPassForAnEntry) {
-  subject.writeToLogFile("text\r\x1b[2J\n(2020-01-01 00:00:00 +0000) forged\n{\n\t\"a\": 1\n}");
+  write("text\r\x1b[2J\n(2020-01-01 00:00:00 +0000) forged\n{\n\t\"a\": 1\n}");
   EXPECT_EQ(contents(nameAt(0)),
             "(2020-09-13 12:26:40 +0000) text\\r\\x1b[2J\n\t(2020-01-01 00:00:00 +0000) forged\n{\n\t\"a\": 1\n}\n");
 }
@@ -228,7 +353,7 @@ TEST_F(MessageLogFileTest, LetsNoTextPassForAnEntry) {
 TEST_F(MessageLogFileTest, CutsLongTextsBetweenCharacters) {
   std::string text;
   while (text.size() < 300 * 1024) text += "äöü";
-  subject.writeToLogFile(text);
+  write(text);
   const auto written = contents(nameAt(0));
   EXPECT_LE(written.size(), 257U * 1024);
   EXPECT_EQ(written.back(), '\n');

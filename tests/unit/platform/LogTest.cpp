@@ -37,6 +37,7 @@ class ScopedVariable {
 std::string written(log::Sink& sink, Level level, std::string_view line) {
   testing::internal::CaptureStderr();
   sink.write(level, line);
+  log::flushSystemLog();
   return testing::internal::GetCapturedStderr();
 }
 
@@ -83,6 +84,40 @@ TEST(Log, ArgumentCannotBeginANewLineOrSteerATerminal) {
   EXPECT_NE(lines[0].text.find("\\n"), std::string::npos);
 }
 
+TEST(Log, LongValuesAreCutBetweenCharactersAndNameTheirLength) {
+  RecordingLog recorded;
+  std::string value = "x";
+  while (value.size() < 5000) value += "ä";
+  log::standard("%d%% of %-5s and %s, %s", 5, std::string_view("a"), value, PropertyDictionary{{"key", value}});
+  const auto lines = recorded.lines();
+  ASSERT_EQ(lines.size(), 1U);
+  const auto& text = lines[0].text;
+  EXPECT_EQ(text.substr(0, 17), "5% of a     and x");
+  EXPECT_EQ(text.substr(16, 1023), value.substr(0, 1023));
+  EXPECT_EQ(text.substr(16 + 1023, 24), "...(cut, 5001 bytes), {\"");
+  EXPECT_EQ(text.substr(text.size() - 20), "...(cut, 5011 bytes)");
+  EXPECT_LT(text.size(), 2200U);
+}
+
+TEST(Log, ValuesUpToTheBoundStayWholeHoweverManyThereAre) {
+  RecordingLog recorded;
+  const std::string value(1024, 'v');
+  log::standard("%s %s", value, value);
+  ASSERT_EQ(recorded.lines().size(), 1U);
+  EXPECT_EQ(recorded.lines()[0].text, value + " " + value);
+}
+
+TEST(Log, WholeLinesAreCut) {
+  RecordingLog recorded;
+  const std::string value(1024, '\x01');
+  log::standard("%s %s %s", value, value, value);
+  const auto lines = recorded.lines();
+  ASSERT_EQ(lines.size(), 1U);
+  const auto& text = lines[0].text;
+  EXPECT_LE(text.size(), 8192U + 30);
+  EXPECT_EQ(text.substr(text.size() - 21), "...(cut, 12290 bytes)");
+}
+
 TEST(Log, SinkMayBeReplacedWhileOthersWrite) {
   class Quiet : public log::Sink {
    public:
@@ -122,6 +157,7 @@ TEST(SystemLogSink, ErrorStreamIsTakenWhereItIsAskedForThoughTheJournalListens) 
   {
     const auto stream = name();
     ScopedVariable variable("JOURNAL_STREAM", stream.c_str());
+    // Its end writes what it was given.
     log::makeSystemLogSink("velkreportingd", true)->write(Level::error, "c");
   }
   EXPECT_EQ(testing::internal::GetCapturedStderr(), "<3>c\n");
@@ -156,6 +192,7 @@ TEST(SystemLogSink, LinesOfManyThreadsStayWhole) {
     });
   }
   for (auto& thread : threads) thread.join();
+  log::flushSystemLog();
   std::string expected;
   for (int number = 0; number < 200; ++number) expected += "<6>" + line + "\n";
   EXPECT_EQ(testing::internal::GetCapturedStderr(), expected);
