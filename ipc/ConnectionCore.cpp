@@ -57,6 +57,17 @@ ConnectionCore::~ConnectionCore() {
   if (_whenClosed) _whenClosed();
 }
 
+void ConnectionCore::share(std::shared_ptr<SharedRoom> unread, std::shared_ptr<SharedRoom> unsent) {
+  const std::weak_ptr<ConnectionCore> weak = weak_from_this();
+  _unreadPart = std::make_unique<SharedRoom::Part>(std::move(unread), peer.uid, [weak] {
+    const auto self = weak.lock();
+    if (self) self->_loop.post([self] { self->frameIsOverdue(); });
+  });
+  _unsentPart = std::make_unique<SharedRoom::Part>(std::move(unsent), peer.uid, [weak] {
+    if (const auto self = weak.lock()) self->endForUnreadReplies();
+  });
+}
+
 void ConnectionCore::resume() {
   if (_fork.forked()) return;
   _loop.post([self = shared_from_this()] { self->startReading(); });
@@ -101,7 +112,28 @@ std::optional<ConnectionCore::Refusal> ConnectionCore::appendLocked(FrameHeader 
     return full;
   }
   _outboxBytes.fetch_add(added);
+  if (_unsentPart && _outboxBytes.load() > kFreeOutboxBytes && !takesRoomLocked(outboxLimit)) {
+    _outboxBytes.fetch_sub(added);
+    _outbox.truncate(start, descriptors);
+    return full;
+  }
   return std::nullopt;
+}
+
+/// Replies get their room in any case, at the cost of a peer that has long not read its own.
+bool ConnectionCore::takesRoomLocked(std::size_t outboxLimit) {
+  const auto bytes = [this] { return unsentBytesToShare(); };
+  if (!_unsentPart->tryResize(bytes)) {
+    if (outboxLimit < kMaximumOutboxBytesWithReplies) return false;
+    _unsentPart->resize(bytes);
+    _isCrowdedOut = true;
+  }
+  _unsentPart->owesSince(_loop.clock().steadyTime());
+  return true;
+}
+
+void ConnectionCore::makeRoomForReplies() {
+  if (_isCrowdedOut.exchange(false)) _unsentPart->endOverdue(SteadyTime::max(), true);
 }
 
 bool ConnectionCore::claimSenderLocked() {
@@ -148,6 +180,7 @@ Result<void> ConnectionCore::sendCall(std::uint32_t method, std::size_t argument
     }
   }
   if (wake) wakeSender();
+  makeRoomForReplies();
   if (!refusal) return {};
   return Failure(connectionError(refusal->code, refusal->text));
 }
@@ -187,6 +220,7 @@ void ConnectionCore::sendAnswer(FrameHeader header, BodyEncoder encode, bool pro
     }
   }
   if (wake) wakeSender();
+  makeRoomForReplies();
   if (!refusal) return;
   if (refusal->code == ConnectionError::outboxFull) return endForUnreadReplies();
   log::error(texts::kReplyNotSent, description, refusal->text);

@@ -13,6 +13,7 @@
 #include "ipc/Limits.h"
 #include "ipc/Outbox.h"
 #include "ipc/PendingReplies.h"
+#include "ipc/SharedRoom.h"
 #include "platform/EventLoop.h"
 #include "platform/Fork.h"
 #include "platform/Lock.h"
@@ -27,6 +28,8 @@ class ConnectionCore : public std::enable_shared_from_this<ConnectionCore> {
                  std::shared_ptr<Queue> queue, Task whenClosed);
   ~ConnectionCore();
 
+  /// Before anything else, for connections that share them with others.
+  void share(std::shared_ptr<SharedRoom> unread, std::shared_ptr<SharedRoom> unsent);
   void resume();
   void invalidate();
   void closeAfterSending(Duration drainTime);
@@ -83,6 +86,8 @@ class ConnectionCore : public std::enable_shared_from_this<ConnectionCore> {
   [[nodiscard]] std::optional<Refusal> appendLocked(FrameHeader header, BodyEncoder encode,
                                                     std::vector<FileDescriptor>& descriptors, std::size_t outboxLimit)
       VELK_REQUIRES(_lock);
+  [[nodiscard]] bool takesRoomLocked(std::size_t outboxLimit) VELK_REQUIRES(_lock);
+  void makeRoomForReplies();
   void sendAnswer(FrameHeader header, BodyEncoder encode, bool prompt);
   /// True: the caller must `wakeSender` once it has released the lock.
   [[nodiscard]] bool claimSenderLocked() VELK_REQUIRES(_lock);
@@ -99,6 +104,11 @@ class ConnectionCore : public std::enable_shared_from_this<ConnectionCore> {
   [[nodiscard]] bool pausesReading();
   void awaitHangUp();
   void peerHasGone();
+  [[nodiscard]] bool hasRoomToRead();
+  void awaitRoom();
+  void readIfRoomCame();
+  void endWhereOthersWait();
+  void frameIsOverdue();
   void readingEnded(End end, const char* reason);
   [[nodiscard]] bool openWatch();
   void awaitWritable();
@@ -112,6 +122,12 @@ class ConnectionCore : public std::enable_shared_from_this<ConnectionCore> {
   void failSendingLocked() VELK_REQUIRES(_lock);
   void bytesLeft(std::size_t count);
   void resumeDelivery();
+  [[nodiscard]] std::size_t unreadBytesToShare() const noexcept;
+  [[nodiscard]] std::size_t unsentBytesToShare() const noexcept;
+  void shrinkUnread();
+  void askForRoomAgain();
+  void shrinkUnsent();
+  [[nodiscard]] bool mayRunCalls(std::size_t outboxLimit) const;
 
   // On the delivery queue.
   void scheduleDelivery();
@@ -140,7 +156,9 @@ class ConnectionCore : public std::enable_shared_from_this<ConnectionCore> {
   const bool _accepted;
   const ForkGuard _fork;
 
-  // Self-synchronised.
+  // Self-synchronised. Null where nothing is shared.
+  std::unique_ptr<SharedRoom::Part> _unreadPart;
+  std::unique_ptr<SharedRoom::Part> _unsentPart;
   std::atomic<bool> _ended{false};       ///< calls fail from here on
   std::atomic<bool> _discarding{false};  ///< frames that have not run never will
   std::atomic<bool> _closingHere{false};
@@ -148,10 +166,14 @@ class ConnectionCore : public std::enable_shared_from_this<ConnectionCore> {
   std::atomic<End> _end{End::none};
   std::atomic<std::size_t> _outboxBytes{0};
   std::atomic<std::size_t> _unreadBytes{0};
+  std::atomic<std::size_t> _bytesBegun{0};  ///< of the frame that is not whole yet
   std::atomic<std::size_t> _unclaimedDescriptors{0};
   std::atomic<bool> _readingPaused{false};
   std::atomic<bool> _deliveryPaused{false};
   std::atomic<bool> _answerTimerRuns{false};
+  std::atomic<bool> _waitsForRoom{false};     ///< the socket is left alone until there is room for what was begun
+  std::atomic<bool> _isInLineForRoom{false};  ///< the room calls back
+  std::atomic<bool> _isCrowdedOut{false};     ///< replies took more room than there was
 
   // Used on the loop's thread only.
   FileDescriptor _socket;  ///< the sender uses it too, and is waited for before it is closed
@@ -160,6 +182,7 @@ class ConnectionCore : public std::enable_shared_from_this<ConnectionCore> {
   std::unique_ptr<DescriptorWatch> _watch;
   FrameReader _reader;
   Task _whenClosed;
+  bool _looksForOverdue = false;
   bool _reading = false;
   bool _readingDone = false;
   bool _awaitsHangUp = false;

@@ -79,6 +79,8 @@ bool ConnectionCore::takeInbox() {
   _current.clear();
   _nextFrame = 0;
   _nextDescriptor = 0;
+  shrinkUnread();
+  askForRoomAgain();
   End end = End::none;
   {
     Guard guard(_inboxLock);
@@ -96,10 +98,10 @@ bool ConnectionCore::takeInbox() {
 /// A peer that does not read its replies is not served. Whoever sends them lets delivery go on.
 bool ConnectionCore::mustPauseFor(const FrameBatch::Frame& frame) {
   if (frame.header.serial == 0 || frame.header.kind != FrameKind::call) return false;
-  if (_outboxBytes.load() <= kOutboxBytesToPauseCalls) return false;
+  if (mayRunCalls(kOutboxBytesToPauseCalls)) return false;
   flushAnswers();
   _deliveryPaused = true;
-  return !(_outboxBytes.load() <= kOutboxBytesToPauseCalls / 2 && _deliveryPaused.exchange(false));
+  return !(mayRunCalls(kOutboxBytesToPauseCalls / 2) && _deliveryPaused.exchange(false));
 }
 
 void ConnectionCore::runFrame(const FrameBatch::Frame& frame) {

@@ -1,5 +1,6 @@
 // How a connection's bytes move: on the event loop's thread, except that the delivery queue may send what it has just
 // answered.
+#include <algorithm>
 #include <cerrno>
 #include <cstring>
 
@@ -44,8 +45,88 @@ void ConnectionCore::awaitReadable() {
 void ConnectionCore::receive() {
   if (_readingDone || _closed) return;
   int reads = 0;
-  while (reads < kReadsPerTurn && receiveOnce()) ++reads;
-  if (!_readingDone && !pausesReading()) awaitReadable();
+  while (reads < kReadsPerTurn && hasRoomToRead() && receiveOnce()) ++reads;
+  if (!_readingDone && !pausesReading() && hasRoomToRead()) awaitReadable();
+}
+
+std::size_t ConnectionCore::unreadBytesToShare() const noexcept {
+  const std::size_t bytes = _unreadBytes.load() + _bytesBegun.load();
+  return bytes - std::min(bytes, kFreeUnreadBytes);
+}
+
+std::size_t ConnectionCore::unsentBytesToShare() const noexcept {
+  const std::size_t bytes = _outboxBytes.load();
+  return bytes - std::min(bytes, kFreeOutboxBytes);
+}
+
+/// A frame that has begun gets the room for all of it, so that those that have theirs can always be finished.
+bool ConnectionCore::hasRoomToRead() {
+  if (_waitsForRoom) return false;
+  if (!_unreadPart || (unreadBytesToShare() == 0 && _unreadPart->bytes() == 0)) return true;
+  if (!_unreadPart->tryResize([this] { return unreadBytesToShare(); })) {
+    awaitRoom();
+    return false;
+  }
+  if (_bytesBegun.load() > kFreeUnreadBytes) _unreadPart->owesSince(_loop.clock().steadyTime());
+  return true;
+}
+
+void ConnectionCore::awaitRoom() {
+  _waitsForRoom = true;
+  const std::weak_ptr<ConnectionCore> weak = weak_from_this();
+  if (!_isInLineForRoom.exchange(true)) {
+    const std::size_t wanted = unreadBytesToShare();
+    _unreadPart->whenThereIsRoom(wanted - std::min(wanted, _unreadPart->bytes()), [weak] {
+      const auto self = weak.lock();
+      if (!self) return;
+      self->_isInLineForRoom = false;
+      self->_loop.post([self] { self->readIfRoomCame(); });
+    });
+  }
+  askForRoomAgain();
+  endWhereOthersWait();
+}
+
+/// Without what has run meanwhile there may be nothing to wait for. Any thread.
+void ConnectionCore::askForRoomAgain() {
+  if (_waitsForRoom.load() && unreadBytesToShare() == 0) {
+    _loop.post([self = shared_from_this()] { self->readIfRoomCame(); });
+  }
+}
+
+void ConnectionCore::readIfRoomCame() {
+  if (_waitsForRoom.exchange(false)) receive();
+}
+
+/// Whoever waits looks now and then for frames whose rest does not come.
+void ConnectionCore::endWhereOthersWait() {
+  if (!_waitsForRoom || _readingDone) return;
+  _unreadPart->endOverdue(_loop.clock().steadyTime() - kFrameTimeWhileOthersWait, false);
+  if (std::exchange(_looksForOverdue, true)) return;
+  _loop.postAfter(kFrameTimeWhileOthersWait / 4, [weak = weak_from_this()] {
+    const auto self = weak.lock();
+    if (!self) return;
+    self->_looksForOverdue = false;
+    self->endWhereOthersWait();
+  });
+}
+
+void ConnectionCore::frameIsOverdue() {
+  if (_bytesBegun.load() != 0) readingEnded(End::badFrame, "the rest of a frame did not come while others waited");
+}
+
+void ConnectionCore::shrinkUnread() {
+  if (_unreadPart && _unreadPart->bytes() != 0) {
+    // What could not grow before does not grow here: the other direction is `hasRoomToRead`.
+    static_cast<void>(_unreadPart->tryResize([this] { return std::min(unreadBytesToShare(), _unreadPart->bytes()); }));
+  }
+}
+
+void ConnectionCore::shrinkUnsent() {
+  if (!_unsentPart || _unsentPart->bytes() == 0) return;
+  _unsentPart->resize([this] { return unsentBytesToShare(); });
+  _unsentPart->owesNothing();
+  if (_unsentPart->bytes() != 0) _unsentPart->owesSince(_loop.clock().steadyTime());
 }
 
 /// True when there may be more to read at once.
@@ -85,6 +166,7 @@ bool ConnectionCore::received(std::span<const std::uint8_t> bytes) {
     const std::size_t frames = _inbox.frames.size() - framesBefore;
     anything = frames != 0;
     _unreadBytes.fetch_add(_inbox.bytes.size() - bytesBefore + frames * kFrameHeaderBytes);
+    _bytesBegun = _reader.bytesBegun();
     _unclaimedDescriptors.fetch_add(_inbox.descriptors.size() - descriptorsBefore);
   }
   if (fault != nullptr) {
@@ -92,6 +174,7 @@ bool ConnectionCore::received(std::span<const std::uint8_t> bytes) {
   } else if (_reader.sawGoodbye()) {
     readingEnded(End::goodbye, "");
   } else if (anything) {
+    if (_unreadPart && _unreadPart->bytes() != 0) _unreadPart->owesNothing();
     scheduleDelivery();
   }
   return !_readingDone && _unreadBytes.load() < kMaximumUnreadBytes;
@@ -119,9 +202,15 @@ void ConnectionCore::peerHasGone() {
 
 void ConnectionCore::readingEnded(End end, const char* reason) {
   if (!std::exchange(_readingDone, true)) {
-    Guard guard(_inboxLock);
-    _receivedEnd = end;
-    _endReason = reason;
+    {
+      Guard guard(_inboxLock);
+      _receivedEnd = end;
+      _endReason = reason;
+    }
+    _reader.dropPartial();
+    _bytesBegun = 0;
+    if (_unreadPart) _unreadPart->owesNothing();
+    shrinkUnread();
   }
   if (end == End::here) {
     departureHandler = nullptr;
@@ -194,6 +283,7 @@ void ConnectionCore::failSendingLocked() {
     outbox->clear();
   }
   _outboxBytes = 0;
+  shrinkUnsent();
 }
 
 /// The peer reads no more. What it had sent before may still wait in the socket, so reading goes on.
@@ -209,7 +299,15 @@ void ConnectionCore::sendingFailed() {
 }
 
 void ConnectionCore::bytesLeft(std::size_t count) {
-  if (_outboxBytes.fetch_sub(count) - count <= kOutboxBytesToPauseCalls / 2) resumeDelivery();
+  _outboxBytes.fetch_sub(count);
+  shrinkUnsent();
+  if (_deliveryPaused.load() && mayRunCalls(kOutboxBytesToPauseCalls / 2)) resumeDelivery();
+}
+
+/// Calls that want replies, while so much or more may wait to be sent.
+bool ConnectionCore::mayRunCalls(std::size_t outboxLimit) const {
+  if (_outboxBytes.load() > outboxLimit) return false;
+  return !_unsentPart || _unsentPart->bytes() == 0 || !_unsentPart->isCrowded();
 }
 
 void ConnectionCore::resumeDelivery() {

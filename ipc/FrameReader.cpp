@@ -38,6 +38,11 @@ const char* FrameReader::consume(std::span<const std::uint8_t> received, FrameBa
   return checkDescriptors();
 }
 
+std::size_t FrameReader::bytesBegun() const noexcept {
+  if (_partial.size() < kFrameHeaderBytes) return _partial.size();
+  return kFrameHeaderBytes + readFrameHeader(_partial.data()).length;
+}
+
 /// Completes the frame that the last bytes left unfinished: its header first, then the rest.
 const char* FrameReader::consumePartial(std::span<const std::uint8_t>& received, FrameBatch& batch) {
   const auto fillTo = [&](std::size_t size) {
@@ -49,7 +54,11 @@ const char* FrameReader::consumePartial(std::span<const std::uint8_t>& received,
   if (!fillTo(kFrameHeaderBytes)) return nullptr;
   const auto header = readFrameHeader(_partial.data());
   if (const char* fault = faultOf(header)) return fault;
-  if (!fillTo(kFrameHeaderBytes + header.length)) return nullptr;
+  // Takes memory as bytes come, and no more than the frame needs.
+  const std::size_t size = kFrameHeaderBytes + header.length;
+  const std::size_t needed = std::min(size, _partial.size() + received.size());
+  if (needed > _partial.capacity()) _partial.reserve(std::min(size, std::max(needed, 2 * _partial.capacity())));
+  if (!fillTo(size)) return nullptr;
   const char* fault = take(_partial.data(), header, batch);
   if (_partial.capacity() > kBytesToKeep) _partial = {};
   _partial.clear();

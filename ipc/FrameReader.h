@@ -41,6 +41,10 @@ class FrameReader {
 
   /// A goodbye was the last frame: whatever follows it is ignored.
   [[nodiscard]] bool sawGoodbye() const noexcept { return _sawGoodbye; }
+  /// What the frame that has begun will take, once its header is here; else what is here of it.
+  [[nodiscard]] std::size_t bytesBegun() const noexcept;
+  /// Forgets the frame that has begun, and its memory. Nothing may be consumed after this.
+  void dropPartial() noexcept { _partial = {}; }
   /// The end came in the middle of a frame.
   [[nodiscard]] bool hasPartialFrame() const noexcept { return !_partial.empty(); }
 

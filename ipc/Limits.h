@@ -33,6 +33,17 @@ inline constexpr std::size_t kMaximumUnclaimedDescriptors = 16;
 /// half of them have run, so that the peer's own outbox fills and its sends are refused: nothing is lost in between.
 inline constexpr std::size_t kMaximumUnreadBytes = 512 * 1024;
 
+/// Received bytes of one connection that count towards nothing else: small frames get through, whoever takes the room.
+inline constexpr std::size_t kFreeUnreadBytes = 32 * 1024;
+
+/// Beyond those, received bytes that have not run yet and frames that have begun (as long as they will be), for all
+/// connections and for those of one user. A connection for which there is no room is not read until there is.
+inline constexpr std::size_t kMaximumUnreadBytesOfAll = 64 * 1024 * 1024;
+inline constexpr std::size_t kMaximumUnreadBytesOfUser = 16 * 1024 * 1024;
+
+/// How long the rest of a frame may take while others wait for its room. Then the connection is ended.
+inline constexpr std::chrono::seconds kFrameTimeWhileOthersWait{2};
+
 /// How much is taken from a socket at once.
 inline constexpr std::size_t kReceiveBytes = 64 * 1024;
 
@@ -47,6 +58,14 @@ inline constexpr std::size_t kOutboxBytesToPauseCalls = 1024 * 1024;
 /// How far replies may use the outbox; a reply beyond that ends the connection. The end of aggregation may as well:
 /// some twenty bytes that an aggregator waits for, however slowly it reads.
 inline constexpr std::size_t kMaximumOutboxBytesWithReplies = 2 * kMaximumOutboxBytes;
+
+/// Unsent bytes of one connection that count towards nothing else.
+inline constexpr std::size_t kFreeOutboxBytes = 64 * 1024;
+
+/// Beyond those, unsent bytes of all connections and of those of one user. From half of it on calls of connections that
+/// have such bytes are paused; a reply beyond it ends the connection that has not read its replies for the longest.
+inline constexpr std::size_t kMaximumOutboxBytesOfAll = 64 * 1024 * 1024;
+inline constexpr std::size_t kMaximumOutboxBytesOfUser = 16 * 1024 * 1024;
 
 /// Calls of one connection that wait for a reply. A call beyond is refused with an error.
 inline constexpr std::size_t kMaximumPendingReplies = 65'536;

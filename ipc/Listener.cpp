@@ -8,6 +8,7 @@
 #include <map>
 #include <utility>
 
+#include "ipc/ConnectionCore.h"
 #include "ipc/LogTexts.h"
 #include "platform/Entitlements.h"
 #include "platform/EventLoop.h"
@@ -219,9 +220,11 @@ class Listener::Core : public std::enable_shared_from_this<Listener::Core> {
       addUndecided(-1);
       return;
     }
-    const auto connection =
-        Connection::adopt(std::move(pending->socket), std::move(pending->peer), true, *_options.loop,
-                          std::move(pending->queue), [self = shared_from_this(), uid] { self->release(uid); });
+    auto core = std::make_shared<ipc::ConnectionCore>(
+        std::move(pending->socket), std::move(pending->peer), true, *_options.loop, std::move(pending->queue),
+        [self = shared_from_this(), uid] { self->release(uid); });
+    core->share(_unread, _unsent);
+    const auto connection = std::make_shared<Connection>(std::move(core));
     if (!_options.shouldAcceptNewConnection(connection)) connection->invalidate();
     addUndecided(-1);
     {
@@ -289,6 +292,11 @@ class Listener::Core : public std::enable_shared_from_this<Listener::Core> {
   // Constant after construction.
   const Options _options;
   const std::string _path;
+  // Self-synchronised.
+  const std::shared_ptr<ipc::SharedRoom> _unread =
+      std::make_shared<ipc::SharedRoom>(ipc::kMaximumUnreadBytesOfAll, ipc::kMaximumUnreadBytesOfUser);
+  const std::shared_ptr<ipc::SharedRoom> _unsent =
+      std::make_shared<ipc::SharedRoom>(ipc::kMaximumOutboxBytesOfAll, ipc::kMaximumOutboxBytesOfUser);
 
   // Used on the loop's thread only.
   std::unique_ptr<DescriptorWatch> _watch;

@@ -1,4 +1,7 @@
 // What a connection refuses, and when it stops reading or serving.
+#include <thread>
+
+#include "ipc/ConnectionCore.h"
 #include "tests/unit/ipc/ConnectionFixture.h"
 
 namespace velk {
@@ -94,6 +97,70 @@ TEST_F(ConnectionBoundsTest, ServesNoCallsToAPeerThatDoesNotReadItsReplies) {
   });
   queue->runUntil([&] { return events.size() == kCalls; });
   reader.join();
+}
+
+/// Connections of one user that share rooms.
+class SharingConnectionsTest : public ConnectionTest {
+ protected:
+  struct End {
+    std::shared_ptr<Connection> connection;
+    std::unique_ptr<RawPeer> peer;
+  };
+
+  End makeSharing() {
+    auto ends = makeLocalSocketPair();
+    auto core = std::make_shared<ipc::ConnectionCore>(std::move(ends->first), self(), true, loop, queue, Task());
+    core->share(unread, unsent);
+    End end{std::make_shared<Connection>(std::move(core)), std::make_unique<RawPeer>(std::move(ends->second))};
+    end.connection->setExportedDispatcher(std::make_shared<FunctionDispatcher>([this](IncomingCall& call) {
+      events.push_back("call " + std::to_string(call.method));
+      call.reply.sendValues({std::string(900'000, 'x')});
+      return Result<void>();
+    }));
+    end.connection->setInvalidationHandler([this] { events.push_back("invalidated"); });
+    end.connection->resume();
+    return end;
+  }
+
+  std::shared_ptr<ipc::SharedRoom> unread = std::make_shared<ipc::SharedRoom>(8'000'000, 1'000'000);
+  std::shared_ptr<ipc::SharedRoom> unsent = std::make_shared<ipc::SharedRoom>(8'000'000, 1'000'000);
+};
+
+TEST_F(SharingConnectionsTest, AReplyBeyondTheRoomEndsTheOneThatHasNotReadForLongest) {
+  const auto first = makeSharing();
+  const auto second = makeSharing();
+  first.peer->send(callBytes(kMethod, 1, {}));
+  runUntil("call 2");
+  events.clear();
+  EXPECT_GT(unsent->taken(), 400'000U);
+  second.peer->send(callBytes(kMethod, 1, {}));
+  runUntil("call 2");
+  runUntil("invalidated");
+  EXPECT_EQ(
+      recorded.count(log::Level::error, formatText(ipc::texts::kUnreadReplies, {first.connection->description()})), 1);
+  EXPECT_EQ(second.peer->receive()->header.serial, 1U) << "who reads is served";
+  EXPECT_FALSE(second.connection->hasEnded());
+  queue->runUntil([&] { return unsent->taken() == 0; });
+  second.connection->invalidate();
+  runUntil("invalidated");
+}
+
+TEST_F(SharingConnectionsTest, AFrameWaitsUntilThereIsRoomForIt) {
+  const auto first = makeSharing();
+  const auto second = makeSharing();
+  const auto whole = callBytes(kMethod, 0, {std::string(900'000, 'x')});
+  const auto half = std::span(whole).first(whole.size() / 2);
+  first.peer->send({half.begin(), half.end()});
+  queue->runUntil([&] { return unread->taken() > 800'000; });
+  std::thread sender([&] { second.peer->send(whole); });
+  first.peer->send({whole.begin() + static_cast<std::ptrdiff_t>(half.size()), whole.end()});
+  queue->runUntil([&] { return events.size() == 2; });
+  sender.join();
+  EXPECT_EQ(unread->taken(), 0U);
+  events.clear();
+  first.connection->invalidate();
+  second.connection->invalidate();
+  queue->runUntil([&] { return events.size() == 2; });
 }
 
 }  // namespace
