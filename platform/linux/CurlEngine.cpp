@@ -24,6 +24,7 @@ constexpr std::size_t kMaximumBulkRequests = 24;
 constexpr std::size_t kMaximumRequestsWithFirstOnes = 256;
 constexpr long kMaximumIdleConnections = 16;
 constexpr std::size_t kMaximumSpareHandles = 4;
+constexpr Duration kDropReportInterval = std::chrono::seconds(60);
 
 SteadyTime now() { return std::chrono::steady_clock::now(); }
 
@@ -442,11 +443,9 @@ void CurlEngine::drop(CurlTask& task) {
 }
 
 void CurlEngine::reportDropped(bool atOnce) {
-  constexpr Duration kInterval = std::chrono::seconds(60);
-  if (_dropped == 0) return;
   const auto time = now();
-  if (!atOnce && _droppedReported != SteadyTime::min() && time - _droppedReported < kInterval) return;
-  _droppedReported = time;
+  if (_dropped == 0 || (!atOnce && time < _mayReportDropped)) return;
+  _mayReportDropped = time + kDropReportInterval;
   log::error("HttpSessionService: more than %llu bytes wait to be sent; %llu of the oldest requests were dropped",
              _maximumStandingBytes, std::exchange(_dropped, 0));
 }
@@ -461,6 +460,7 @@ void CurlEngine::sleep() {
     Guard guard(_lock);
     if (!_inbox.empty()) return;
     _routeMonitor.reset();
+    _routes.reset();
     if (!forgetConnections()) _idleSince = now();
   }
 }
@@ -473,6 +473,7 @@ int CurlEngine::sleepMilliseconds() const {
   if (_urgentWaiting > 0) {
     for (const auto& [number, task] : _waiting) until = std::min(until, task->deadline());
   }
+  if (_dropped > 0) until = std::min(until, _mayReportDropped);
   if (until == SteadyTime::max()) return kForEver;
   const auto left = std::chrono::ceil<std::chrono::milliseconds>(until - now()).count();
   return static_cast<int>(std::clamp<std::int64_t>(left, 0, kForEver));

@@ -150,7 +150,7 @@ class CurlEngine {
   std::size_t _urgentWaiting = 0;
   std::size_t _standingBytes = 0;
   std::size_t _dropped = 0;
-  SteadyTime _droppedReported = SteadyTime::min();
+  SteadyTime _mayReportDropped = SteadyTime::min();
   /// Open while there are requests, so that no change is missed between an attempt and its failure.
   std::unique_ptr<RouteMonitor> _routeMonitor;
   /// Counts the changes, and the times when some may have been missed.
