@@ -1,20 +1,12 @@
 // Requests on a machine without a network: each test runs on a thread with a network namespace of its own, which the
 // HTTP thread inherits.
-#include <arpa/inet.h>
-#include <net/if.h>
-#include <sched.h>
-#include <sys/ioctl.h>
-#include <sys/socket.h>
-#include <unistd.h>
-
 #include <atomic>
-#include <cstring>
 
-#include "platform/FileDescriptor.h"
 #include "platform/Semaphore.h"
 #include "platform/linux/CurlEngine.h"
 #include "platform/linux/CurlSession.h"
 #include "platform/linux/RouteMonitor.h"
+#include "tests/support/NetworkNamespace.h"
 #include "tests/support/RecordingLog.h"
 #include "tests/support/TlsTestServer.h"
 #include "tests/unit/platform/HttpRecorder.h"
@@ -22,38 +14,15 @@
 namespace velk {
 namespace {
 
+using test::connectNetwork;
+using test::disconnectNetwork;
+using test::startLoopback;
 using test::TlsTestServer;
 using namespace std::chrono_literals;
 
-/// False where the system does not allow such namespaces.
-bool runWithoutNetwork(const std::function<void()>& body) {
-  bool allowed = false;
-  std::thread([&] {
-    allowed = ::unshare(CLONE_NEWNET) == 0;
-    if (allowed) body();
-  }).join();
-  return allowed;
-}
-
-#define VELK_WITHOUT_NETWORK(...) \
-  if (!runWithoutNetwork(__VA_ARGS__)) GTEST_SKIP() << "no network namespaces here: they are made by root"
-
-void setLoopback(bool isUp, const char* addressText) {
-  const FileDescriptor socket(::socket(AF_INET, SOCK_DGRAM | SOCK_CLOEXEC, 0));
-  ifreq request{};
-  std::strcpy(request.ifr_name, "lo");
-  request.ifr_flags = static_cast<short>(isUp ? IFF_UP : 0);
-  ASSERT_EQ(::ioctl(socket.get(), SIOCSIFFLAGS, &request), 0);
-  auto* address = reinterpret_cast<sockaddr_in*>(&request.ifr_addr);
-  *address = {};
-  address->sin_family = AF_INET;
-  ::inet_pton(AF_INET, addressText, &address->sin_addr);
-  ASSERT_EQ(::ioctl(socket.get(), SIOCSIFADDR, &request), 0);
-}
-/// Gives the namespace the one address that the requests go to.
-void connectNetwork() { setLoopback(true, TlsTestServer::kOtherAddress); }
-/// Takes it away again.
-void disconnectNetwork() { setLoopback(true, "127.0.0.1"); }
+#define VELK_WITHOUT_NETWORK(...)                     \
+  if (!test::runInEmptyNetworkNamespace(__VA_ARGS__)) \
+  GTEST_SKIP() << "no network namespaces here: they are made by root"
 
 struct Network {
   explicit Network(bool waits = true, CurlEngine::Options options = {})
@@ -120,7 +89,7 @@ TEST(HttpConnectivityTest, WaitsForARouteAsLongAsItTakesAndSaysSoOnce) {
     network.start(Network::request(100ms));
     ASSERT_TRUE(network.waiting(1));
     EXPECT_FALSE(network.completed(1, 300ms)) << "the time of a request begins with the route";
-    disconnectNetwork();  // a change that does not help
+    startLoopback();  // a change that does not help
     EXPECT_FALSE(network.completed(1, 100ms));
     connectNetwork();
     ASSERT_TRUE(network.completed(1));
@@ -225,7 +194,7 @@ TEST(HttpConnectivityTest, ARequestThatMayNotUseAMobileNetworkWaitsForAnother) {
     Network network(true, {.look = routes.look()});
     network.start(requestWithoutMobile());
     ASSERT_TRUE(network.waiting(1));
-    disconnectNetwork();  // a change, but the network is a mobile one still
+    startLoopback();  // a change, but the network is a mobile one still
     EXPECT_FALSE(network.completed(1, 100ms));
     routes.isMobile = false;
     connectNetwork();

@@ -166,7 +166,7 @@ TEST_F(HttpLinesTest, AnUrgentRequestStandsInNoLine) {
   ASSERT_TRUE(_server.waitForRequests(8));
   auto urgent = request("/urgent");
   urgent.isUrgent = true;
-  EXPECT_FALSE(fetch(urgent).error);
+  EXPECT_NE(fetch(urgent).response, nullptr);
   EXPECT_EQ(_delegate->completed, 1);
 }
 
