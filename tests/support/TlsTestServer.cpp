@@ -11,6 +11,7 @@
 #include <unistd.h>
 #include <zlib.h>
 
+#include <atomic>
 #include <chrono>
 #include <cstdio>
 #include <cstdlib>
@@ -211,7 +212,10 @@ class TlsTestServer::Implementation {
  private:
   void makeContext() {
     const Key caKey(EVP_EC_gen("P-256"));
-    const auto ca = makeCertificate("Test CA", caKey.get(), nullptr, caKey.get());
+    // Of its own, so that a program may believe several.
+    static std::atomic<int> number{0};
+    const std::string name = "Test CA " + std::to_string(++number);
+    const auto ca = makeCertificate(name.c_str(), caKey.get(), nullptr, caKey.get());
     const Key key(EVP_EC_gen("P-256"));
     const auto certificate = makeCertificate("localhost", key.get(), ca.get(), caKey.get());
     caFile = writeCa(ca.get());
