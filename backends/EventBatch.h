@@ -15,10 +15,46 @@
 
 namespace velk {
 
+/// Events in little memory. Most events of a session have the same keys and differ in few values: of each such kind the
+/// first event is kept whole, of the others only what differs. Not synchronised.
+class CompactEvents {
+ public:
+  void append(PropertyDictionary event);
+  /// As it is.
+  void appendWhole(PropertyDictionary event);
+  /// The events, as they were appended; none are left.
+  [[nodiscard]] std::vector<PropertyDictionary> take();
+  [[nodiscard]] std::size_t count() const noexcept { return _kinds.size(); }
+
+ private:
+  [[nodiscard]] std::size_t kindOf(const PropertyDictionary& event) const;
+  void appendDifferences(const PropertyDictionary& first, const PropertyDictionary& event);
+  void appendValue(const PropertyValue& value);
+  void appendNumber(std::uint64_t number);
+  void appendBytes(const void* bytes, std::size_t count);
+
+  /// The first event of each kind.
+  std::vector<PropertyDictionary> _firsts;
+  /// Of the event that was appended last: the next one often is of the same.
+  std::size_t _lastKind = 0;
+  /// Of each event.
+  std::vector<std::uint8_t> _kinds;
+  /// Of each event that is not kept whole: values that differ, each behind its distance from the one before; then 0.
+  std::vector<std::uint8_t> _differences;
+  /// Arrays and dictionaries among them, in their order.
+  std::vector<PropertyValue> _containers;
+  /// Those that are of no kind.
+  std::vector<PropertyDictionary> _whole;
+};
+
 class EventBatch {
  public:
   /// So many methods are counted; further ones never reach a threshold by themselves.
   static constexpr std::size_t kMaximumCounters = 65'536;
+
+  /// While the batches of the process hold no more than this (estimated), their events are kept as dictionaries, which
+  /// is quickest; beyond it in little memory. So a few busy sessions pay no time, and many idle ones little memory.
+  static constexpr std::uint64_t kMaximumBytesAsDictionaries = 1024U * 1024;
 
   enum class Appended : std::uint8_t { kept, full, stillFull };
 
@@ -47,10 +83,12 @@ class EventBatch {
   void setSessionID(const std::string& sessionID);
   /// Of all events, without looking at any.
   [[nodiscard]] std::uint64_t estimatedSize() const noexcept { return _bytes; }
-  [[nodiscard]] std::size_t count() const noexcept { return _events.size(); }
+  [[nodiscard]] std::size_t count() const noexcept { return _events.count(); }
 
  private:
-  std::vector<PropertyDictionary> _events;
+  void keep(PropertyDictionary event, std::uint64_t size);
+
+  CompactEvents _events;
   // By the method's number; a method that is not a whole number is counted under its text's hash.
   std::unordered_map<std::int64_t, std::int64_t> _counters;
   const std::shared_ptr<BatchMemory> _memory;

@@ -3,6 +3,7 @@
 #include <gtest/gtest.h>
 #include <signal.h>
 
+#include <fstream>
 #include <random>
 
 #include "tests/integration/HandWrittenCalls.h"
@@ -154,6 +155,48 @@ TEST_F(HostileClient, ThatNeverReadsHoldsUpNobody) {
   ControlledSession beside(*daemon);
   EXPECT_EQ(beside.open(9, 2)[0], kSplunk);
   EXPECT_EQ(beside.finish(), 0);
+}
+
+/// Of the daemon, in bytes: resident, without what it shares with files.
+std::size_t residentMemory(Daemon& daemon) {
+  std::ifstream status("/proc/" + std::to_string(daemon.process().pid()) + "/status");
+  std::string word;
+  while (status >> word) {
+    std::size_t kibibytes = 0;
+    if (word == "RssAnon:" && status >> kibibytes) return kibibytes * 1024;
+  }
+  return 0;
+}
+
+TEST_F(HostileClient, WithHalfFramesOnManyConnectionsTakesBoundedMemory) {
+  constexpr std::size_t kConnections = 300;
+  // A method that takes no argument: a refusal is an answer.
+  const std::string whole = call(1, {number(6), text(std::string(1'000'000, 'x'))});
+  const std::size_t before = residentMemory(*daemon);
+  std::vector<std::unique_ptr<RawConnection>> connections;
+  std::vector<std::size_t> sent;
+  for (std::size_t i = 0; i < kConnections; ++i) {
+    connections.push_back(std::make_unique<RawConnection>(*daemon));
+    const auto half = std::string_view(whole).substr(0, whole.size() / 2);
+    sent.push_back(connections.back()->sendWhatFits(half, std::chrono::milliseconds(1)));
+  }
+  EXPECT_EQ(honest->call({{"method", "flushMessagesWithCompletion"}}).size(), 2U) << "small calls pass";
+  EXPECT_LT(residentMemory(*daemon), before + 64 * 1024 * 1024);
+
+  std::size_t answered = 0;
+  std::size_t ended = 0;
+  for (std::size_t i = 0; i < kConnections; ++i) {
+    const bool isSent = connections[i]->send(std::string_view(whole).substr(sent[i]));
+    const auto answer = isSent ? connections[i]->receive() : std::nullopt;
+    ++(answer && answer->kind == FrameKind::error ? answered : ended);
+    connections[i].reset();
+  }
+  EXPECT_GT(answered, 0U);
+  RawConnection beside(*daemon);
+  ASSERT_TRUE(beside.send(whole));
+  EXPECT_TRUE(beside.receive());
+  EXPECT_EQ(daemon->log().countOnceThereAre(ended, "the rest of a frame did not come while others waited"), ended);
+  EXPECT_LT(residentMemory(*daemon), before + 64 * 1024 * 1024);
 }
 
 TEST_F(HostileClient, CannotForgeLinesOfTheLog) {

@@ -1,8 +1,19 @@
 #include "backends/EventBatch.h"
 
 #include <gtest/gtest.h>
+#include <malloc.h>
+
+#include <cmath>
+#include <deque>
+#include <limits>
+#include <random>
 
 #include "backends/MemoryEstimate.h"
+#include "foundation/Format.h"
+
+#if defined(__SANITIZE_ADDRESS__) || defined(__SANITIZE_THREAD__)
+#define VELK_SANITIZED_HEAP
+#endif
 
 namespace velk::test {
 namespace {
@@ -159,6 +170,127 @@ TEST(EventBatch, EstimatesItsSizeWithTheSessionIDThatWasSetLast) {
                                        memoryEstimate({{"b", 1}, {"_sessionID", longer}}));
   batch.discard();
   EXPECT_EQ(batch.estimatedSize(), 0U);
+}
+
+/// Text in which order, types and signs of zeros show.
+std::string exactText(const PropertyDictionary& event) {
+  std::string text;
+  for (const auto& [key, value] : event) {
+    text += key + ":" + std::to_string(static_cast<int>(value.type())) + "=";
+    if (const auto* dictionary = value.dictionary()) {
+      text += "{" + exactText(*dictionary) + "}";
+    } else if (value.date() != nullptr) {
+      text += std::to_string(value.date()->secondsSince1970);
+    } else {
+      text += description(&value);
+    }
+    text += ";";
+  }
+  return text;
+}
+
+/// The memory of a process that holds more than it keeps as dictionaries.
+std::shared_ptr<BatchMemory> takenMemory() {
+  auto memory = std::make_shared<BatchMemory>();
+  static_cast<void>(memory->take(EventBatch::kMaximumBytesAsDictionaries + 1, 0));
+  return memory;
+}
+
+TEST(EventBatch, GivesEventsBackAsTheyWere) {
+  std::mt19937 random(7);
+  const std::vector<PropertyValue> values{PropertyValue(),
+                                          true,
+                                          false,
+                                          0,
+                                          1,
+                                          -5,
+                                          std::numeric_limits<std::int64_t>::min(),
+                                          std::numeric_limits<std::uint64_t>::max(),
+                                          0.0,
+                                          -0.0,
+                                          1.0,
+                                          std::nan(""),
+                                          Date{1.5},
+                                          "",
+                                          "1",
+                                          std::string(300, 'x'),
+                                          std::string("nul\0inside", 10),
+                                          ByteData{},
+                                          ByteData{0, 128, 255},
+                                          PropertyArray{1, "two"},
+                                          PropertyDictionary{{"a", 1}, {"b", 2}},
+                                          PropertyDictionary{{"b", 2}, {"a", 1}},
+                                          std::string(20'000, 'l')};
+  for (int round = 0; round < 50; ++round) {
+    EventBatch batch(takenMemory());
+    std::vector<std::string> texts;
+    std::uint64_t size = 0;
+    for (int number = 0; number < 60; ++number) {
+      PropertyDictionary event;
+      const unsigned kind = random() % 20;
+      for (unsigned key = 0; key < kind % 7 * 5; ++key) {
+        event.set("key" + std::to_string(kind) + "." + std::to_string(key), values[random() % values.size()]);
+      }
+      texts.push_back(exactText(event));
+      size += memoryEstimate(event);
+      batch.append(std::move(event));
+    }
+    EXPECT_EQ(batch.estimatedSize(), size);
+    const auto events = batch.take();
+    ASSERT_EQ(events.size(), texts.size());
+    for (std::size_t i = 0; i < texts.size(); ++i) EXPECT_EQ(exactText(events[i]), texts[i]) << i;
+    EXPECT_EQ(batch.estimatedSize(), 0U);
+  }
+}
+
+TEST(EventBatch, AppendsAfterASessionIDWasSetAsTheEventsSay) {
+  EventBatch batch(takenMemory());
+  batch.append({{"_sessionID", "a"}, {"number", 1}});
+  batch.append({{"_sessionID", "a"}, {"number", 2}});
+  batch.setSessionID("parent.a");
+  batch.append({{"_sessionID", "b"}, {"number", 3}});
+  const auto size = batch.estimatedSize();
+  const auto events = batch.take();
+  EXPECT_EQ(*events[1].string("_sessionID"), "parent.a");
+  EXPECT_EQ(integerValue(events[1].find("number")), 2);
+  EXPECT_EQ(*events[2].string("_sessionID"), "b");
+  std::uint64_t expected = 0;
+  for (const auto& event : events) expected += memoryEstimate(event);
+  EXPECT_EQ(size, expected);
+}
+
+/// An event as sessions build them: some thirty entries, few of which differ.
+PropertyDictionary usualEvent(int number) {
+  PropertyDictionary event;
+  event.reserve(32);
+  event.set("screen", "settings/network/details");
+  event.set("duration", number * 0.25);
+  event.set("outcome", number % 3 == 0 ? "cancelled" : "completed");
+  event.set("_eventNumber", number);
+  event.set("_clientTS", 1'780'000'000.25 + number);
+  event.set("eventTime", 1'780'000'000.25 + number);
+  event.set("_sessionID", "Zm9vYmFyYmF6cXV4cXV1eA==.Zm9vYmFyYmF6cXV4cXV1eA==");
+  for (int field = 0; field < 21; ++field)
+    event.set("_fixedField" + std::to_string(field), "value" + std::to_string(field));
+  return event;
+}
+
+TEST(EventBatch, TakesLittleMemory) {
+#ifdef VELK_SANITIZED_HEAP
+  GTEST_SKIP() << "the sanitizer's heap counts otherwise";
+#endif
+  constexpr int kSessions = 200;
+  constexpr int kEvents = 45;
+  const auto memory = std::make_shared<BatchMemory>();
+  std::deque<EventBatch> batches;
+  for (int session = 0; session < kSessions; ++session) batches.emplace_back(memory);
+  const auto before = ::mallinfo2().uordblks;
+  for (auto& batch : batches) {
+    for (int number = 0; number < kEvents; ++number) batch.append(usualEvent(number));
+  }
+  const auto each = (::mallinfo2().uordblks - before) / kSessions;
+  RecordProperty("bytes", static_cast<int>(each));
+  EXPECT_LT(each, 16U * 1024);
 }
 
 }  // namespace
