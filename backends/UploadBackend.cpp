@@ -19,8 +19,6 @@ constexpr const char* kRequestFormat =
     "%@?uuid=%s&sequence=%u&description=%@%%20(Uploaded%%20by%%20Fenn)&filename=%@&raw=true";
 constexpr std::string_view kDescription = "Vistra AFRC log";
 constexpr std::string_view kTaken = "success";
-/// How much of an answer the log shows.
-constexpr std::size_t kLoggedAnswerBytes = 4096;
 
 /// What RFC 3986 allows in a query as it stands: the ampersand as well, which therefore ends a file's name for a server
 /// that splits the query at it. The names have always been sent so.
@@ -169,7 +167,6 @@ bool UploadBackend::postAndWait(ReportingSessionConnectivityInterface& transport
   std::optional<std::string> text(std::in_place, answer->data.begin(), answer->data.end());
   if (!isUtf8(*text)) text.reset();
   const bool isTaken = text && text->find(kTaken) != std::string::npos;
-  if (text) text->resize(utf8Prefix(*text, kLoggedAnswerBytes).size());
   log::standard(backend_texts::kUploadAnswered, uploadURL, text);
   return isTaken;
 }

@@ -61,4 +61,10 @@ void RecordingLog::clear() {
   _recorder->lines.clear();
 }
 
+std::string asLoggedValue(const std::string& value) {
+  constexpr std::size_t kLongest = 1024;
+  if (value.size() <= kLongest) return value;
+  return value.substr(0, kLongest) + "...(cut, " + std::to_string(value.size()) + " bytes)";
+}
+
 }  // namespace velk::test

@@ -40,4 +40,7 @@ class RecordingLog {
   std::shared_ptr<Recorder> _recorder;
 };
 
+/// What a line shows of a value of single-byte characters: the log cuts long ones and names their length.
+[[nodiscard]] std::string asLoggedValue(const std::string& value);
+
 }  // namespace velk::test

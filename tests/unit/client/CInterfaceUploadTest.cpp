@@ -27,8 +27,8 @@ class CInterfaceUploadTest : public CInterfaceTest {
     EXPECT_FALSE(VelkReportingClientUploadFile(client, path.c_str(), noteUpload, &context, Context::destroy)) << path;
     EXPECT_EQ(context.ended.load(), 1) << path;
     EXPECT_TRUE(context.texts.empty()) << path;
-    const std::string line =
-        "uploadFileWithURL: Failed to get sandbox extension for path " + inLog + ", errno " + std::to_string(reason);
+    const std::string line = "uploadFileWithURL: Failed to get sandbox extension for path " + asLoggedValue(inLog) +
+                             ", errno " + std::to_string(reason);
     EXPECT_EQ(_log.count(line), 1) << line;
   }
   /// Handed over and answered.
