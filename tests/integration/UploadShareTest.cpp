@@ -163,6 +163,8 @@ TEST_F(UploadShare, OfTheDiskLeavesRoomForStorebags) {
   ASSERT_EQ(session.open(9, 1).size(), 3U);
   ControlledSession another(daemon);
   ASSERT_EQ(another.open(9, 2).size(), 3U);
+  // Both sessions' start messages: what arrives after them is the file.
+  ASSERT_TRUE(server.waitForPosts(2));
   const auto posts = server.posts().size();
   TlsTestServer::Response silence;
   silence.silent = true;
