@@ -157,7 +157,7 @@ void DashboardBackend::useReliableUDP() {
 
 bool DashboardBackend::connectSocket() {
   if (!isIPv4Address(_serverIP)) {
-    // Display URL and log data need none. A closed socket sends nothing and reads from nobody.
+    // Display URL and log data need none. A closed socket neither sends nor reads.
     log::error(backend_texts::kNoServerAddress, _serverIP);
     _readSource.reset();
     _socket->close();

@@ -217,7 +217,7 @@ void ReportingSessionConnectivityHelper::didBecomeDownloadTask(HttpSession& sess
   log::error(texts::kDidBecomeDownloadTask, session.sessionDescription());
 }
 
-// Without a network nobody waits for room: the HTTP service bounds what waits for a route.
+// Without a network no sender waits for room: the HTTP service bounds the posts that wait for a route.
 void ReportingSessionConnectivityHelper::taskIsWaitingForConnectivity(HttpSession&, HttpTask& task) {
   _stateQueue->async([self = shared_from_this(), description = task.taskDescription()] {
     const auto found = self->_tasks.find(description);

@@ -80,7 +80,7 @@ void ReportingSessionConnectivityHelper::activate(std::uint32_t releaseTimeout) 
 }
 
 void ReportingSessionConnectivityHelper::activate() {
-  // Not one that its owner has let go of: there would be nobody to invalidate it once more.
+  // A helper that its owner has invalidated stays inactive: it would never be invalidated again.
   Service asleep = Service::asleep;
   if (!_service.compare_exchange_strong(asleep, Service::awake)) return;
   log::standard(texts::kActivating, sessionIdentifier().value_or(texts::kInactiveIdentifier));

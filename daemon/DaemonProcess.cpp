@@ -38,7 +38,7 @@ namespace {
 constexpr Duration kActivatedIdleLimit = std::chrono::seconds(30);
 // The end of the process, from its beginning: until when it waits for decisions about connections, for sessions to say
 // goodbye, for the network to take their last posts, for calls of the diagnostics adaptor, and for reads of clients'
-// files. Whoever comes later has what the earlier ones left; the posts have two seconds at the least.
+// files. Later waits have what the earlier ones left; the posts have two seconds at the least.
 constexpr Duration kDecisionsUntil = std::chrono::milliseconds(500);
 constexpr Duration kTeardownsUntil = std::chrono::milliseconds(1500);
 constexpr Duration kDeliveriesUntil = std::chrono::milliseconds(3800);
@@ -249,7 +249,7 @@ void DaemonProcess::Parts::reload() {
     Guard guard(entitlementsLock);
     entitlements.swap(rules);
   } else {
-    // Half of the rules would lock out clients that nobody meant to lock out.
+    // Half of the rules would lock out clients that the administrator let in.
     log::error("reload: not all entitlements can be read: the old ones stay; storebags are fetched afresh");
   }
   reportMissingPublicKey();
@@ -292,7 +292,7 @@ Result<void> DaemonProcess::Parts::listen(std::vector<FileDescriptor> sockets, c
   }
   if (!listeners.empty()) return {};
   if (socketPath.empty()) {
-    // Everybody may connect, so everybody may pass through.
+    // Every user may connect, so every user may pass through.
     if (auto made = files::createDirectories(directories.runtime, 0755); !made) return made;
   }
   const auto path = socketPath.empty() ? directories.runtime + "/" + std::string(kServiceName) : socketPath;
@@ -334,7 +334,7 @@ void DaemonProcess::Parts::stopTakingConnections() {
 }
 
 void DaemonProcess::Parts::endSessions() {
-  // Everybody who is here: the call that runs is answered, then the session ends with its last messages.
+  // Every session: the call that runs is answered, then the session ends with its last messages.
   stopDeadline.expect("the agent's lock", "what sessions have not posted is lost");
   agent->invalidateAllSessions();
   stopDeadline.expect("sessions that end", "what they have not posted is lost");

@@ -258,7 +258,7 @@ void MessageLogFile::createLocked(std::optional<std::string>& path, std::optiona
   creation.reset();
   _file = AppendedFile();
   std::string created = freePathLocked();
-  // What counts is whether the file is there.
+  // The file's existence decides.
   (void)_submission.createSubmittableLog(created, kLogType);
   if (!files::exists(created)) {
     steps.push_back({log::Level::error, logtexts::kFailedToCreateLogFile, std::move(created)});

@@ -1,4 +1,4 @@
-// The bound of the process's end. Whoever stops the process says what it waits for; when the time is over the deadline
+// The bound of the process's end. The code that stops the process names each wait; when the time is over the deadline
 // names that wait in an error line and ends the process, whatever its threads do. Made by the daemon's process, whose
 // other parts it outlives.
 #pragma once

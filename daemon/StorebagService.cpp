@@ -142,7 +142,7 @@ StorebagService::DiskCopy StorebagService::copyFromDisk(const std::string& name)
     expired = hasExpired(copy, maxAge);
     log::standard(daemontexts::kLoadedFromDisk, name, expired ? daemontexts::kDiskExpired : daemontexts::kDiskValid);
   }
-  // Nobody waits for it: the copy is served.
+  // No session waits for it: the copy is served.
   if (expired) pull(name, makeRequest(name, lastModified), false, nullptr);
   return copy;
 }
@@ -220,7 +220,7 @@ void StorebagService::pull(const std::string& name, HttpRequest request, bool is
   const auto url = request.url;
   // Held until the due time has been stored, so that the pull cannot end first.
   Guard guard(_storebagLock);
-  // A transport that was made after `stop` would be invalidated by nobody.
+  // A transport that was made after `stop` would never be invalidated.
   if (isStopped()) return;
   if (const auto pending = _pulls.find(url); pending != _pulls.end()) {
     const auto& transport = pending->second.transport;

@@ -98,7 +98,7 @@ void ConnectionCore::readIfRoomCame() {
   if (_waitsForRoom.exchange(false)) receive();
 }
 
-/// Whoever waits looks now and then for frames whose rest does not come.
+/// A waiting connection looks now and then for frames whose rest does not come.
 void ConnectionCore::endWhereOthersWait() {
   if (!_waitsForRoom || _readingDone) return;
   _unreadPart->endOverdue(_loop.clock().steadyTime() - kFrameTimeWhileOthersWait, false);

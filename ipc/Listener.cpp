@@ -220,9 +220,9 @@ class Listener::Core : public std::enable_shared_from_this<Listener::Core> {
       addUndecided(-1);
       return;
     }
-    auto core = std::make_shared<ipc::ConnectionCore>(
-        std::move(pending->socket), std::move(pending->peer), true, *_options.loop, std::move(pending->queue),
-        [self = shared_from_this(), uid] { self->release(uid); });
+    auto core = std::make_shared<ipc::ConnectionCore>(std::move(pending->socket), std::move(pending->peer), true,
+                                                      *_options.loop, std::move(pending->queue),
+                                                      [self = shared_from_this(), uid] { self->release(uid); });
     core->share(_unread, _unsent);
     const auto connection = std::make_shared<Connection>(std::move(core));
     if (!_options.shouldAcceptNewConnection(connection)) connection->invalidate();
@@ -234,7 +234,7 @@ class Listener::Core : public std::enable_shared_from_this<Listener::Core> {
     _decided.notifyAll();
   }
 
-  /// False once the listener has been stopped: `waitUntilDecided` has nobody left to wait for.
+  /// False once the listener has been stopped: `waitUntilDecided` has nothing left to wait for.
   [[nodiscard]] bool beginsToDecide() {
     Guard guard(_lock);
     _deciding = !_stopped;
@@ -258,7 +258,7 @@ class Listener::Core : public std::enable_shared_from_this<Listener::Core> {
     });
   }
 
-  /// Who waited for the look-up that has just ended; null when nobody did.
+  /// Who waited for the look-up that has just ended; null when none did.
   [[nodiscard]] std::unique_ptr<Pending> nextToLookUp(std::uint32_t uid) {
     Guard guard(_lock);
     const auto lookUps = _lookUps.find(uid);

@@ -162,7 +162,7 @@ class ClientSession final : public ReportingdSession {
   const std::string _sessionIDString;
 
   // Of the connection's queue alone.
-  /// What the backends post carries its number.
+  /// The posts of the backends carry its number.
   const std::shared_ptr<PostSender> _sender;
   PropertyArray _frameworks;
   std::string _deviceIdentifier;

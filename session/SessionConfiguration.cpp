@@ -165,7 +165,7 @@ void ClientSession::createBackendsWithStorebag(const PropertyDictionary& storeba
       entry.backend->setCorrelatedSessionID(_sessionIDString);
     }
   }
-  // What the old ones have batched would go with them.
+  // The batches of the old ones would go with them.
   if (ownBackends() && !ownBackends()->empty()) flushBackends(FlushReply());
   publishBackends(std::move(backends));
 }

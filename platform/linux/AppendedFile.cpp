@@ -43,7 +43,7 @@ Result<std::size_t> AppendedFile::open(const std::string& path) {
   struct stat status {};
   if (::lstat(path.c_str(), &status) != 0) {
     auto error = systemFailure("cannot open", path, files::Code::notFound);
-    // What was open has been moved or removed: its space is given back.
+    // The open file has been moved or removed: its space is given back.
     _file = FileDescriptor();
     return error;
   }

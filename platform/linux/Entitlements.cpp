@@ -170,7 +170,7 @@ class EntitlementRules::Parser {
       _loaded.rules._grants.push_back(std::move(_current));
       return;
     }
-    // Names that nobody knows have had a line of their own.
+    // Unknown names have had a line of their own.
     if (_hasUnknownNames && !restrictionIsLost) return;
     log::error("Entitlements: %s:%d: the section grants nothing: %s", _path, _sectionLine,
                restrictionIsLost ? "no usable executable" : "no user and no group");

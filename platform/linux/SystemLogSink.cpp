@@ -87,7 +87,7 @@ class ErrorStream final : public LineOutput {
       const auto count = ::write(STDERR_FILENO, part.data(), part.size());
       if (count < 0 && errno == EINTR) continue;
       if (count < 0 && errno == EAGAIN && waitForRoom(-1)) continue;  // Another process made it non-blocking.
-      if (count <= 0) return;                                         // Nobody reads it: there is nowhere to say so.
+      if (count <= 0) return;                                         // No reader: there is nowhere to say so.
       part.remove_prefix(static_cast<std::size_t>(count));
     }
   }

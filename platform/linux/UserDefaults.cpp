@@ -141,7 +141,7 @@ class CachedFile {
 
 /// How long a writer waits for the others: it may be a session that holds up more than itself.
 constexpr Duration kLockTime = std::chrono::seconds(1);
-/// After a wait in vain nobody waits again for so long, so that the several settings of one session cost one wait.
+/// After a wait in vain no caller waits again for so long, so that the several settings of one session cost one wait.
 constexpr Duration kHeldMemory = std::chrono::seconds(10);
 /// The system wakes nobody after a time, so the file is tried again and again; and a process that writes many settings
 /// in a row leaves the others this gap to come in.
@@ -219,7 +219,7 @@ class SuiteLock {
   SuiteLock(const SuiteLock&) = delete;
   SuiteLock& operator=(const SuiteLock&) = delete;
   [[nodiscard]] bool held() const noexcept { return static_cast<bool>(_file); }
-  /// Somebody else has it, who may be changing the suite just now.
+  /// Another process has it, which may be changing the suite just now.
   [[nodiscard]] bool isHeldElsewhere() const noexcept { return _isHeldElsewhere; }
   [[nodiscard]] const std::string& whyNot() const noexcept { return _whyNot; }
 
@@ -233,7 +233,7 @@ class SuiteLock {
       if (errno != EWOULDBLOCK) return false;
       const auto now = systemClock().steadyTime();
       if (now >= deadline || _gate.isKnownToBeHeld(now)) {
-        // A wait, and not this attempt alone, begins the time in which nobody waits: it ends some day.
+        // A wait, and not this attempt alone, begins the time without waiting: it ends some day.
         if (now >= deadline) _gate.noteHeld(now);
         errno = EWOULDBLOCK;
         return false;
