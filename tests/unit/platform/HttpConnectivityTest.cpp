@@ -31,7 +31,11 @@ struct Network {
     configuration.waitsForConnectivity = waits;
     session = std::make_shared<CurlSession>(engine, configuration, delegate, queue);
   }
-  ~Network() { engine->stop(); }
+  ~Network() {
+    engine->stop();
+    // What the queue still holds holds the queue: its tasks know their session.
+    queue->runPending();
+  }
 
   [[nodiscard]] static HttpRequest request(Duration timeout = 20s) {
     HttpRequest request;
