@@ -157,6 +157,12 @@ TEST_F(HostileClient, ThatNeverReadsHoldsUpNobody) {
   EXPECT_EQ(beside.finish(), 0);
 }
 
+#if defined(__SANITIZE_ADDRESS__) || defined(__SANITIZE_THREAD__)
+constexpr bool kMemoryIsItsOwn = false;  // a sanitizer keeps freed memory, and shadows of all
+#else
+constexpr bool kMemoryIsItsOwn = true;
+#endif
+
 /// Of the daemon, in bytes: resident, without what it shares with files.
 std::size_t residentMemory(Daemon& daemon) {
   std::ifstream status("/proc/" + std::to_string(daemon.process().pid()) + "/status");
@@ -181,7 +187,7 @@ TEST_F(HostileClient, WithHalfFramesOnManyConnectionsTakesBoundedMemory) {
     sent.push_back(connections.back()->sendWhatFits(half, std::chrono::milliseconds(1)));
   }
   EXPECT_EQ(honest->call({{"method", "flushMessagesWithCompletion"}}).size(), 2U) << "small calls pass";
-  EXPECT_LT(residentMemory(*daemon), before + 64 * 1024 * 1024);
+  if (kMemoryIsItsOwn) EXPECT_LT(residentMemory(*daemon), before + 64 * 1024 * 1024);
 
   std::size_t answered = 0;
   std::size_t ended = 0;
@@ -196,7 +202,7 @@ TEST_F(HostileClient, WithHalfFramesOnManyConnectionsTakesBoundedMemory) {
   ASSERT_TRUE(beside.send(whole));
   EXPECT_TRUE(beside.receive());
   EXPECT_EQ(daemon->log().countOnceThereAre(ended, "the rest of a frame did not come while others waited"), ended);
-  EXPECT_LT(residentMemory(*daemon), before + 64 * 1024 * 1024);
+  if (kMemoryIsItsOwn) EXPECT_LT(residentMemory(*daemon), before + 64 * 1024 * 1024);
 }
 
 TEST_F(HostileClient, CannotForgeLinesOfTheLog) {
