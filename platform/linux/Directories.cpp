@@ -20,6 +20,7 @@ constexpr const char* kLibraryName = "/velkreporting-client";
 constexpr const char* kStateBelowHome = "/.local/state";
 constexpr const char* kSocketName = "/com.tavrin.velkreportingd";
 constexpr const char* kSystemRuntimeDirectory = "/run/velkreporting";
+constexpr const char* kSystemSocket = "/run/velkreporting/com.tavrin.velkreportingd";
 
 /// Nothing for a variable that is unset, empty, or not an absolute path (which the conventions tell to ignore). A
 /// list of paths, as service managers give for several directories, counts by its first.
@@ -123,7 +124,7 @@ std::string daemonSocketPath() {
   if (::geteuid() != 0) {
     if (auto own = userRuntimeDirectory() + kSocketName; isSocket(own)) return own;
   }
-  return std::string(kSystemRuntimeDirectory) + kSocketName;
+  return kSystemSocket;
 }
 
 }  // namespace velk
