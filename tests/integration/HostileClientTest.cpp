@@ -187,7 +187,9 @@ TEST_F(HostileClient, WithHalfFramesOnManyConnectionsTakesBoundedMemory) {
     sent.push_back(connections.back()->sendWhatFits(half, std::chrono::milliseconds(1)));
   }
   EXPECT_EQ(honest->call({{"method", "flushMessagesWithCompletion"}}).size(), 2U) << "small calls pass";
-  if (kMemoryIsItsOwn) EXPECT_LT(residentMemory(*daemon), before + 64 * 1024 * 1024);
+  if (kMemoryIsItsOwn) {
+    EXPECT_LT(residentMemory(*daemon), before + 64 * 1024 * 1024);
+  }
 
   std::size_t answered = 0;
   std::size_t ended = 0;
@@ -202,7 +204,9 @@ TEST_F(HostileClient, WithHalfFramesOnManyConnectionsTakesBoundedMemory) {
   ASSERT_TRUE(beside.send(whole));
   EXPECT_TRUE(beside.receive());
   EXPECT_EQ(daemon->log().countOnceThereAre(ended, "the rest of a frame did not come while others waited"), ended);
-  if (kMemoryIsItsOwn) EXPECT_LT(residentMemory(*daemon), before + 64 * 1024 * 1024);
+  if (kMemoryIsItsOwn) {
+    EXPECT_LT(residentMemory(*daemon), before + 64 * 1024 * 1024);
+  }
 }
 
 TEST_F(HostileClient, CannotForgeLinesOfTheLog) {
