@@ -83,7 +83,7 @@ class HttpSessionDelegate {
   virtual void didSendBodyData(HttpSession& session, HttpTask& task, std::int64_t sent, std::int64_t expected) = 0;
   virtual void didBecomeDownloadTask(HttpSession& session, HttpTask& task) = 0;
   virtual void didCompleteWithError(HttpSession& session, HttpTask& task, const std::optional<Error>& error) = 0;
-  /// There is no route that the task may use, and it waits for one. Once a task: attempts in vain do not end the waiting.
+  /// No route is there that the task may use: it waits for one. Once a task; attempts in vain do not end the waiting.
   virtual void taskIsWaitingForConnectivity(HttpSession& /*session*/, HttpTask& /*task*/) {}
   /// The last call of a session. It holds no reference to its delegate from then on.
   virtual void didBecomeInvalidWithError(HttpSession& session, const std::optional<Error>& error) = 0;
