@@ -22,7 +22,7 @@ class BatchMemory {
     return false;
   }
   void giveBack(std::uint64_t bytes) noexcept { _taken.fetch_sub(bytes, std::memory_order_relaxed); }
-  /// What a batch holds has another size now. Never refused: the events are there.
+  /// Changes the size of a batch. Never refused: the events are in memory already.
   void replace(std::uint64_t before, std::uint64_t now) noexcept {
     _taken.fetch_add(now - before, std::memory_order_relaxed);  // a smaller size wraps around to the right sum
   }

@@ -1,6 +1,6 @@
 // Which client entry of a storebag section applies to a session: matching of names, countries, devices and versions.
-// Used by the HTTPS post backend's configuration. A value that restricts whom or what an entry is for, and has the
-// wrong type, makes the entry apply to nothing: a mistake in a storebag reports too little, never too much. Any thread;
+// Used by the HTTPS post backend's configuration. A restricting value of the wrong type makes the entry apply
+// to nothing: a mistake in a storebag reports too little, never too much. Any thread;
 // nothing is kept.
 #pragma once
 
@@ -33,7 +33,7 @@ struct WrongType {
 [[nodiscard]] std::optional<WrongType> wrongTypeOfFilters(const PropertyDictionary& entry);
 
 /// Whether the entry's "client" names the client and its "service" a part of the service. An entry without them is for
-/// everybody, one with names that are no text is for nobody. Blanks around the commas belong to the names.
+/// everybody, one with names that are no text matches no client. Blanks around the commas belong to the names.
 [[nodiscard]] bool matchClientNameAndServiceID(const PropertyDictionary& entry, const std::string* clientName,
                                                const std::string* serviceID);
 

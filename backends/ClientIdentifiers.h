@@ -21,7 +21,7 @@ class ClientIdentifiers {
   static constexpr std::size_t kMaximumIdentifiers = 1024;
 
   /// The identifier under "uuid:<prefix>:<suffix>" (absent parts count as empty); a new random one is stored first when
-  /// there is none. The first identifier beyond each bound is told of in an error line.
+  /// there is none. One error line reports the first identifier beyond each bound.
   [[nodiscard]] std::string getPersistentIdentifierForCustomClientIDSuffix(UserDefaults& defaults,
                                                                            const std::string* prefix,
                                                                            const std::string* suffix);

@@ -1,4 +1,4 @@
-// What the uploads of all sessions share: how many there are, how much of the disk they take, whose turn it is to
+// Shared by the uploads of all sessions: their number, the disk space that they take, the order in which they
 // compress, and whether the process is about to end. One a process, made with what backends are handed
 // (`BackendContext`) and shared with the uploads, which may outlive their sessions. Any thread.
 #pragma once
@@ -23,10 +23,10 @@ class ProcessUploads {
   /// Uploads that are under way or wait: what sessions have taken outlives them, and a client may open another.
   static constexpr std::size_t kMaximumUploads = 64;
 
-  /// What compressed files may take of the disk, all together, on a file system of any size; of a smaller one, half of
-  /// what they find free.
+  /// All compressed files together take no more of the disk than this, and no more than half of the space that they
+  /// find free.
   static constexpr std::uint64_t kMaximumDiskBytes = std::uint64_t{1} << 30U;
-  /// What they leave free on the file system, which storebags need as well.
+  /// Compressed files leave this much free on the file system: storebags need room as well.
   static constexpr std::uint64_t kSpareDiskBytes = std::uint64_t{64} << 20U;
 
   /// The user (a uid) whose process handed an upload over.
@@ -94,7 +94,7 @@ class ProcessUploads {
   };
 
   void waitInLineLocked(User user, Semaphore& handed) VELK_REQUIRES(_lock);
-  /// Null when there is none.
+  /// Null when the line is empty.
   [[nodiscard]] Semaphore* takeNextLocked() VELK_REQUIRES(_lock);
 
   // Self-synchronised.

@@ -143,7 +143,7 @@ class ReportingSessionConnectivityHelper : public ReportingSessionConnectivityIn
   void setSessionIdentifier(std::string identifier);
   [[nodiscard]] bool hasDelegate() const { return !_reportingdSessionDelegate.expired(); }
 
-  /// What the helper was asked to be. The state queue follows.
+  /// The state that the callers asked for last. The state queue follows.
   enum class Service : std::uint8_t { asleep, awake, ended };
 
   static constexpr SteadyTime kNoTimer{SteadyTime::duration::min()};

@@ -53,7 +53,7 @@ class MessageLogFile : public MessageLog {
 
  private:
   struct Entry;
-  /// What the lock is not held for: a line of the system log, or the end of an expired file.
+  /// Work that runs outside the lock: a line of the system log, or the end of an expired file.
   struct Step {
     log::Level level = log::Level::standard;
     /// Null: the file at `subject` has expired.

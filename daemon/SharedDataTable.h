@@ -13,7 +13,7 @@
 namespace velk {
 
 /// Without a token every operation does nothing. A change costs what it changes, whatever else the hierarchy holds;
-/// only while somebody still has what `values` answered, the next change copies the dictionary first.
+/// while a reader still holds the result of `values`, the next change copies the dictionary first.
 class SharedDataTable {
  public:
   using Token = std::optional<std::string>;

@@ -1,5 +1,5 @@
-// What is known about a storebag's age between fetches, kept in the user-defaults suite: what the server said, and when
-// a pull that waits is due. Used by the storebag service under the storebag lock.
+// The age of storebags, kept in the user-defaults suite between fetches: the server's max age and date, and the time
+// at which a delayed pull is due. Used by the storebag service under the storebag lock.
 #pragma once
 
 #include <cstdint>
@@ -30,8 +30,8 @@ class StorebagMetrics {
   /// From the headers of a successful answer.
   void save(const std::string& name, const HttpResponse& response);
 
-  /// What is left of the delay after which the storebag is to be pulled, 0 when that time has passed. Nothing when no
-  /// time is stored, or one that no delay explains: the clock jumped, or somebody wrote it.
+  /// The rest of the delay before the storebag is pulled, in seconds; 0 when that time has passed. Nothing when no time
+  /// is stored, or a time beyond any delay: the clock jumped, or the setting was edited.
   [[nodiscard]] std::optional<std::uint32_t> secondsUntilPullDue(const std::string& name, TimeValue now) const;
   void savePullDue(const std::string& name, TimeValue now, std::uint32_t delay);
   /// The pull has been made.

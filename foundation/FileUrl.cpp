@@ -16,7 +16,7 @@ char escapedByte(std::string_view text) noexcept {
   return high < 0 || low < 0 ? '\0' : static_cast<char>(high * 16 + low);
 }
 
-/// What RFC 3986 allows in a path as it stands.
+/// RFC 3986 allows these characters in a path unescaped.
 bool isAllowedInPath(char character) noexcept {
   const bool isLetter = (character >= 'a' && character <= 'z') || (character >= 'A' && character <= 'Z');
   const bool isDigit = character >= '0' && character <= '9';
